@@ -1,0 +1,10 @@
+if(OSTREL_SANITIZER STREQUAL "address+undefined")
+  add_compile_options(-fsanitize=address,undefined -fno-sanitize-recover=all
+    -fno-omit-frame-pointer)
+  add_link_options(-fsanitize=address,undefined)
+elseif(OSTREL_SANITIZER STREQUAL "thread")
+  add_compile_options(-fsanitize=thread -fno-omit-frame-pointer)
+  add_link_options(-fsanitize=thread)
+elseif(NOT OSTREL_SANITIZER STREQUAL "")
+  message(FATAL_ERROR "OSTREL_SANITIZER is neither address+undefined nor thread")
+endif()

@@ -1,0 +1,666 @@
+// The walks below keep their own stack where they need one. Most do not: an
+// item's end is found by counting the items that are still to come.
+#include "platform/Value.h"
+
+#include <bit>
+#include <charconv>
+#include <cmath>
+#include <limits>
+#include <new>
+
+namespace ostrel {
+namespace {
+
+enum MajorType : std::uint8_t {
+  kUnsigned = 0,
+  kNegative = 1,
+  kText = 3,
+  kArrayType = 4,
+  kMapType = 5,
+  kTag = 6,
+  kSimple = 7,
+};
+
+constexpr std::uint8_t kFalse = 20;
+constexpr std::uint8_t kTrue = 21;
+constexpr std::uint8_t kHalf = 25;
+constexpr std::uint8_t kSingle = 26;
+constexpr std::uint8_t kFullDouble = 27;
+
+constexpr std::uint8_t kEmptyArray = kArrayType << 5;
+constexpr std::uint8_t kEmptyMap = kMapType << 5;
+
+constexpr std::size_t kLinearSearchLimit = 16;
+
+template <typename T>
+T loadBigEndian(const std::uint8_t* at) {
+  T value;
+  std::memcpy(&value, at, sizeof value);
+  if constexpr (sizeof(T) == 2) return __builtin_bswap16(value);
+  if constexpr (sizeof(T) == 4) return __builtin_bswap32(value);
+  if constexpr (sizeof(T) == 8) return __builtin_bswap64(value);
+  return value;
+}
+
+struct Head {
+  std::uint8_t majorType;
+  std::uint8_t additional;
+  std::uint64_t argument;
+  const std::uint8_t* next;  // One past the head.
+};
+
+Head readHead(const std::uint8_t* at) {
+  const std::uint8_t additional = *at & 0x1F;
+  Head head{static_cast<std::uint8_t>(*at >> 5), additional, additional, at + 1};
+  switch (additional) {
+    case 24:
+      head.argument = at[1];
+      head.next = at + 2;
+      break;
+    case 25:
+      head.argument = loadBigEndian<std::uint16_t>(at + 1);
+      head.next = at + 3;
+      break;
+    case 26:
+      head.argument = loadBigEndian<std::uint32_t>(at + 1);
+      head.next = at + 5;
+      break;
+    case 27:
+      head.argument = loadBigEndian<std::uint64_t>(at + 1);
+      head.next = at + 9;
+      break;
+    default:
+      break;
+  }
+  return head;
+}
+
+double decodeHalf(std::uint16_t bits) {
+  const int exponent = (bits >> 10) & 0x1F;
+  const int fraction = bits & 0x3FF;
+  double value;
+  if (exponent == 0) {
+    value = std::ldexp(fraction, -24);
+  } else if (exponent == 31) {
+    value = fraction == 0 ? std::numeric_limits<double>::infinity()
+                          : std::numeric_limits<double>::quiet_NaN();
+  } else {
+    value = std::ldexp(fraction + 1024, exponent - 25);
+  }
+  return (bits & 0x8000) ? -value : value;
+}
+
+std::optional<double> doubleOf(const Head& head) {
+  if (head.majorType != kSimple) return std::nullopt;
+  switch (head.additional) {
+    case kHalf:
+      return decodeHalf(static_cast<std::uint16_t>(head.argument));
+    case kSingle:
+      return std::bit_cast<float>(static_cast<std::uint32_t>(head.argument));
+    case kFullDouble:
+      return std::bit_cast<double>(head.argument);
+    default:
+      return std::nullopt;
+  }
+}
+
+double integerAsDouble(const Head& head) {
+  return head.majorType == kUnsigned
+             ? static_cast<double>(head.argument)
+             : -1.0 - static_cast<double>(head.argument);
+}
+
+std::string_view asText(std::span<const std::uint8_t> bytes) {
+  return {reinterpret_cast<const char*>(bytes.data()), bytes.size()};
+}
+
+// The same key always has the same bytes here, however its sender wrote it.
+std::string canonicalKey(ValueView key) {
+  std::string bytes;
+  ValueEncoder encoder(bytes);
+  if (auto text = key.string()) {
+    encoder.string(*text);
+  } else if (auto natural = key.unsignedInteger()) {
+    encoder.unsignedInteger(*natural);
+  } else {
+    encoder.signedInteger(key.signedInteger().value_or(0));
+  }
+  return bytes;
+}
+
+template <typename Number>
+void appendNumber(std::string& out, Number number) {
+  char digits[32];
+  const auto [end, error] = std::to_chars(digits, digits + sizeof digits, number);
+  out.append(digits, end);
+}
+
+void appendDouble(std::string& out, double number) {
+  if (std::isnan(number)) {
+    out += "nan";
+  } else if (std::isinf(number)) {
+    out += number < 0 ? "-inf" : "inf";
+  } else {
+    appendNumber(out, number);
+  }
+}
+
+void appendScalarDescription(std::string& out, ValueView value) {
+  switch (value.kind()) {
+    case ValueKind::kBoolean:
+      out += *value.boolean() ? "true" : "false";
+      return;
+    case ValueKind::kInteger:
+      if (auto natural = value.unsignedInteger()) {
+        appendNumber(out, *natural);
+      } else {
+        appendNumber(out, *value.signedInteger());
+      }
+      return;
+    case ValueKind::kDouble:
+      appendDouble(out, *value.floatingPoint());
+      return;
+    case ValueKind::kDate: {
+      const Date date = *value.date();
+      const std::string text = iso8601(date);
+      if (text.empty()) {
+        appendDouble(out, date.secondsSince1970);
+      } else {
+        out += text;
+      }
+      return;
+    }
+    case ValueKind::kString:
+      out += *value.string();
+      return;
+    case ValueKind::kArray:
+    case ValueKind::kDictionary:
+      return;
+  }
+}
+
+}  // namespace
+
+ValueBuffer ValueBuffer::make(std::size_t size,
+                              std::shared_ptr<PayloadAccount> account) {
+  void* memory = ::operator new(sizeof(Header) + size);
+  auto* header = new (memory) Header;
+  header->size = size;
+  header->account = std::move(account);
+  if (header->account) header->account->charge(sizeof(Header) + size);
+  ValueBuffer buffer;
+  buffer.header_ = header;
+  return buffer;
+}
+
+ValueBuffer ValueBuffer::copyOf(std::span<const std::uint8_t> bytes,
+                                std::shared_ptr<PayloadAccount> account) {
+  ValueBuffer buffer = make(bytes.size(), std::move(account));
+  std::memcpy(buffer.data(), bytes.data(), bytes.size());
+  return buffer;
+}
+
+void ValueBuffer::destroy(Header* header) noexcept {
+  const std::shared_ptr<PayloadAccount> account = std::move(header->account);
+  const std::size_t size = sizeof(Header) + header->size;
+  header->~Header();
+  ::operator delete(header);
+  if (account) account->relieve(size);
+}
+
+ValueKind ValueView::kind() const {
+  switch (*item_ >> 5) {
+    case kUnsigned:
+    case kNegative:
+      return ValueKind::kInteger;
+    case kText:
+      return ValueKind::kString;
+    case kArrayType:
+      return ValueKind::kArray;
+    case kMapType:
+      return ValueKind::kDictionary;
+    case kTag:
+      return ValueKind::kDate;
+    default:
+      return (*item_ & 0x1F) >= kHalf ? ValueKind::kDouble : ValueKind::kBoolean;
+  }
+}
+
+std::optional<bool> ValueView::boolean() const {
+  if (*item_ == (kSimple << 5 | kTrue)) return true;
+  if (*item_ == (kSimple << 5 | kFalse)) return false;
+  return std::nullopt;
+}
+
+std::optional<std::int64_t> ValueView::signedInteger() const {
+  const Head head = readHead(item_);
+  if (head.argument > std::numeric_limits<std::int64_t>::max()) return std::nullopt;
+  const auto magnitude = static_cast<std::int64_t>(head.argument);
+  if (head.majorType == kUnsigned) return magnitude;
+  if (head.majorType == kNegative) return -1 - magnitude;
+  return std::nullopt;
+}
+
+std::optional<std::uint64_t> ValueView::unsignedInteger() const {
+  const Head head = readHead(item_);
+  if (head.majorType != kUnsigned) return std::nullopt;
+  return head.argument;
+}
+
+std::optional<double> ValueView::floatingPoint() const {
+  return doubleOf(readHead(item_));
+}
+
+std::optional<Date> ValueView::date() const {
+  if (kind() != ValueKind::kDate) return std::nullopt;
+  const ValueView seconds(readHead(item_).next);
+  return Date{*seconds.number()};
+}
+
+std::optional<std::string_view> ValueView::string() const {
+  const Head head = readHead(item_);
+  if (head.majorType != kText) return std::nullopt;
+  return asText({head.next, static_cast<std::size_t>(head.argument)});
+}
+
+std::optional<ArrayView> ValueView::array() const {
+  const Head head = readHead(item_);
+  if (head.majorType != kArrayType) return std::nullopt;
+  return ArrayView(head.next, head.argument);
+}
+
+std::optional<DictionaryView> ValueView::dictionary() const {
+  const Head head = readHead(item_);
+  if (head.majorType != kMapType) return std::nullopt;
+  return DictionaryView(head.next, head.argument);
+}
+
+std::optional<double> ValueView::number() const {
+  const Head head = readHead(item_);
+  if (head.majorType == kUnsigned || head.majorType == kNegative) {
+    return integerAsDouble(head);
+  }
+  if (auto truth = boolean()) return *truth ? 1.0 : 0.0;
+  return doubleOf(head);
+}
+
+const std::uint8_t* ValueView::end() const {
+  const std::uint8_t* at = item_;
+  for (std::uint64_t left = 1; left != 0; --left) {
+    const Head head = readHead(at);
+    at = head.next;
+    switch (head.majorType) {
+      case kText:
+        at += head.argument;
+        break;
+      case kArrayType:
+        left += head.argument;
+        break;
+      case kMapType:
+        left += 2 * head.argument;
+        break;
+      case kTag:
+        ++left;
+        break;
+      default:
+        break;
+    }
+  }
+  return at;
+}
+
+bool operator==(ValueView a, ValueView b) {
+  std::vector<std::pair<ValueView, ValueView>> pairs{{a, b}};
+  while (!pairs.empty()) {
+    const auto [x, y] = pairs.back();
+    pairs.pop_back();
+    if (x.kind() != y.kind()) return false;
+    switch (x.kind()) {
+      case ValueKind::kBoolean:
+        if (x.boolean() != y.boolean()) return false;
+        break;
+      case ValueKind::kInteger:
+        if (x.signedInteger() != y.signedInteger() ||
+            x.unsignedInteger() != y.unsignedInteger()) {
+          return false;
+        }
+        break;
+      case ValueKind::kDouble:
+        if (*x.floatingPoint() != *y.floatingPoint()) return false;
+        break;
+      case ValueKind::kDate:
+        if (*x.date() != *y.date()) return false;
+        break;
+      case ValueKind::kString:
+        if (*x.string() != *y.string()) return false;
+        break;
+      case ValueKind::kArray: {
+        const ArrayView xs = *x.array();
+        const ArrayView ys = *y.array();
+        if (xs.size() != ys.size()) return false;
+        for (auto i = xs.begin(), j = ys.begin(); i != xs.end(); ++i, ++j) {
+          pairs.emplace_back(*i, *j);
+        }
+        break;
+      }
+      case ValueKind::kDictionary: {
+        const DictionaryView xs = *x.dictionary();
+        const DictionaryView ys = *y.dictionary();
+        if (xs.size() != ys.size()) return false;
+        for (const auto& [key, value] : xs) {
+          const auto other = ys.find(key);
+          if (!other) return false;
+          pairs.emplace_back(value, *other);
+        }
+        break;
+      }
+    }
+  }
+  return true;
+}
+
+std::optional<ValueView> DictionaryView::find(std::string_view key) const {
+  for (const auto& [entryKey, value] : *this) {
+    if (entryKey.string() == key) return value;
+  }
+  return std::nullopt;
+}
+
+std::optional<ValueView> DictionaryView::find(ValueView key) const {
+  if (auto text = key.string()) return find(*text);
+  for (const auto& [entryKey, value] : *this) {
+    if (entryKey.kind() == ValueKind::kInteger && entryKey == key) return value;
+  }
+  return std::nullopt;
+}
+
+Value::Value(std::span<const std::uint8_t> encoded)
+    : owner_(ValueBuffer::copyOf(encoded)),
+      view_(static_cast<const ValueBuffer&>(owner_).data()) {}
+
+Value::Value(ValueView view) : Value(view.bytes()) {}
+
+namespace {
+template <typename Encode>
+std::string encoded(Encode encode) {
+  std::string bytes;
+  ValueEncoder encoder(bytes);
+  encode(encoder);
+  return bytes;
+}
+
+std::span<const std::uint8_t> asBytes(std::string_view text) {
+  return {reinterpret_cast<const std::uint8_t*>(text.data()), text.size()};
+}
+}  // namespace
+
+Value::Value(bool value)
+    : Value(asBytes(encoded([&](ValueEncoder& to) { to.boolean(value); }))) {}
+Value::Value(double value)
+    : Value(asBytes(encoded([&](ValueEncoder& to) { to.floatingPoint(value); }))) {}
+Value::Value(Date value)
+    : Value(asBytes(encoded([&](ValueEncoder& to) { to.date(value); }))) {}
+Value::Value(std::string_view text)
+    : Value(asBytes(encoded([&](ValueEncoder& to) { to.string(text); }))) {}
+Value::Value(const Array& array) : owner_(array.owner()), view_(array.value()) {}
+Value::Value(const Dictionary& dictionary)
+    : owner_(dictionary.owner()), view_(dictionary.value()) {}
+
+Value Value::ofSigned(std::int64_t integer) {
+  return Value(asBytes(
+      encoded([&](ValueEncoder& to) { to.signedInteger(integer); })));
+}
+
+Value Value::ofUnsigned(std::uint64_t integer) {
+  return Value(asBytes(
+      encoded([&](ValueEncoder& to) { to.unsignedInteger(integer); })));
+}
+
+Array::Array() : item_(&kEmptyArray) {}
+
+std::optional<Array> Array::from(const Value& value) {
+  if (value->kind() != ValueKind::kArray) return std::nullopt;
+  return Array(value.owner(), value->bytes().data());
+}
+
+Dictionary::Dictionary() : item_(&kEmptyMap) {}
+
+Dictionary::Dictionary(
+    std::initializer_list<std::pair<std::string_view, Value>> entries)
+    : Dictionary() {
+  DictionaryBuilder builder;
+  for (const auto& [key, value] : entries) builder.set(key, value);
+  *this = builder.build();
+}
+
+std::optional<Dictionary> Dictionary::from(const Value& value) {
+  if (value->kind() != ValueKind::kDictionary) return std::nullopt;
+  return Dictionary(value.owner(), value->bytes().data());
+}
+
+std::optional<Value> Dictionary::get(std::string_view key) const {
+  const auto found = find(key);
+  if (!found) return std::nullopt;
+  return Value(owner_, *found);
+}
+
+void ValueEncoder::head(std::uint8_t majorType, std::uint64_t argument) {
+  char bytes[9];
+  std::size_t size;
+  if (argument < 24) {
+    bytes[0] = static_cast<char>(majorType << 5 | argument);
+    size = 1;
+  } else {
+    const int log2Width = argument <= 0xFF         ? 0
+                          : argument <= 0xFFFF     ? 1
+                          : argument <= 0xFFFFFFFF ? 2
+                                                   : 3;
+    const std::size_t width = std::size_t{1} << log2Width;
+    bytes[0] = static_cast<char>(majorType << 5 | (24 + log2Width));
+    for (std::size_t i = 0; i < width; ++i) {
+      bytes[1 + i] = static_cast<char>(argument >> (8 * (width - 1 - i)));
+    }
+    size = 1 + width;
+  }
+  out_.append(bytes, size);
+}
+
+void ValueEncoder::boolean(bool value) { head(kSimple, value ? kTrue : kFalse); }
+
+void ValueEncoder::signedInteger(std::int64_t value) {
+  if (value >= 0) {
+    head(kUnsigned, static_cast<std::uint64_t>(value));
+  } else {
+    head(kNegative, ~static_cast<std::uint64_t>(value));
+  }
+}
+
+void ValueEncoder::unsignedInteger(std::uint64_t value) { head(kUnsigned, value); }
+
+void ValueEncoder::floatingPoint(double value) {
+  const auto bits = __builtin_bswap64(std::bit_cast<std::uint64_t>(value));
+  char bytes[9] = {static_cast<char>(kSimple << 5 | kFullDouble)};
+  std::memcpy(bytes + 1, &bits, sizeof bits);
+  out_.append(bytes, sizeof bytes);
+}
+
+void ValueEncoder::date(Date value) {
+  head(kTag, 1);
+  floatingPoint(value.secondsSince1970);
+}
+
+void ValueEncoder::string(std::string_view text) {
+  head(kText, text.size());
+  out_.append(text);
+}
+
+void ValueEncoder::beginArray(std::size_t size) { head(kArrayType, size); }
+
+void ValueEncoder::beginDictionary(std::size_t size) { head(kMapType, size); }
+
+void ValueEncoder::item(ValueView value) { out_.append(asText(value.bytes())); }
+
+ArrayBuilder& ArrayBuilder::append(ValueView value) {
+  ValueEncoder(items_).item(value);
+  ++size_;
+  return *this;
+}
+
+Array ArrayBuilder::build() const {
+  std::string bytes;
+  ValueEncoder(bytes).beginArray(size_);
+  bytes += items_;
+  const ValueBuffer buffer = ValueBuffer::copyOf(asBytes(bytes));
+  return Array(buffer, buffer.data());
+}
+
+bool DictionaryBuilder::KeyOrder::operator()(std::size_t a, std::size_t b) const {
+  return builder->keyBytes(a) < builder->keyBytes(b);
+}
+bool DictionaryBuilder::KeyOrder::operator()(std::size_t a,
+                                             std::string_view b) const {
+  return builder->keyBytes(a) < b;
+}
+bool DictionaryBuilder::KeyOrder::operator()(std::string_view a,
+                                             std::size_t b) const {
+  return a < builder->keyBytes(b);
+}
+
+DictionaryBuilder::DictionaryBuilder() : order_(KeyOrder{this}) {}
+
+DictionaryBuilder::DictionaryBuilder(const Dictionary& start)
+    : DictionaryBuilder() {
+  account_ = start.owner().account();
+  merge(start);
+}
+
+std::optional<std::size_t> DictionaryBuilder::indexOf(
+    std::string_view encodedKey) const {
+  if (!order_.empty()) {
+    const auto found = order_.find(encodedKey);
+    if (found == order_.end()) return std::nullopt;
+    return *found;
+  }
+  for (std::size_t i = 0; i < entries_.size(); ++i) {
+    if (keyBytes(i) == encodedKey) return i;
+  }
+  return std::nullopt;
+}
+
+DictionaryBuilder& DictionaryBuilder::set(std::string_view key,
+                                          const Value& value) {
+  const Value keyValue(key);
+  return set(keyValue.view(), value.view());
+}
+
+DictionaryBuilder& DictionaryBuilder::set(ValueView key, ValueView value) {
+  const std::string encodedKey = canonicalKey(key);
+  const auto known = indexOf(encodedKey);
+  Entry entry;
+  entry.key = scratch_.size();
+  scratch_ += encodedKey;
+  entry.value = scratch_.size();
+  ValueEncoder(scratch_).item(value);
+  entry.end = scratch_.size();
+  if (known) {
+    entries_[*known] = entry;
+    return *this;
+  }
+  entries_.push_back(entry);
+  if (!order_.empty()) {
+    order_.insert(entries_.size() - 1);
+  } else if (entries_.size() > kLinearSearchLimit) {
+    for (std::size_t i = 0; i < entries_.size(); ++i) order_.insert(i);
+  }
+  return *this;
+}
+
+DictionaryBuilder& DictionaryBuilder::merge(const Dictionary& other) {
+  for (const auto& [key, value] : other) set(key, value);
+  return *this;
+}
+
+void DictionaryBuilder::appendUnique(std::string_view key, ValueView value) {
+  Entry entry;
+  entry.key = scratch_.size();
+  ValueEncoder encoder(scratch_);
+  encoder.string(key);
+  entry.value = scratch_.size();
+  encoder.item(value);
+  entry.end = scratch_.size();
+  entries_.push_back(entry);
+  if (!order_.empty()) order_.insert(entries_.size() - 1);
+}
+
+bool DictionaryBuilder::contains(std::string_view key) const {
+  return indexOf(canonicalKey(Value(key).view())).has_value();
+}
+
+Dictionary DictionaryBuilder::build() const {
+  std::string head;
+  ValueEncoder(head).beginDictionary(entries_.size());
+  std::size_t size = head.size();
+  for (const Entry& entry : entries_) size += entry.end - entry.key;
+  ValueBuffer buffer = ValueBuffer::make(size, account_);
+  std::uint8_t* at = buffer.data();
+  std::memcpy(at, head.data(), head.size());
+  at += head.size();
+  for (const Entry& entry : entries_) {
+    std::memcpy(at, scratch_.data() + entry.key, entry.end - entry.key);
+    at += entry.end - entry.key;
+  }
+  const std::uint8_t* item = buffer.data();
+  return Dictionary(std::move(buffer), item);
+}
+
+void appendDescription(std::string& out, ValueView value) {
+  struct Open {
+    const std::uint8_t* next;
+    std::size_t left;  // Items still to come: keys and values both count.
+    bool isDictionary;
+    bool isFirst = true;
+  };
+  std::vector<Open> open;
+  const auto enter = [&](ValueView item) {
+    if (auto array = item.array()) {
+      out += '[';
+      open.push_back({array->empty() ? nullptr : (*array->begin()).bytes().data(),
+                      array->size(), /*isDictionary=*/false});
+    } else if (auto dictionary = item.dictionary()) {
+      out += '{';
+      open.push_back(
+          {dictionary->empty() ? nullptr
+                               : (*dictionary->begin()).key.bytes().data(),
+           2 * dictionary->size(), /*isDictionary=*/true});
+    } else {
+      appendScalarDescription(out, item);
+    }
+  };
+  enter(value);
+  while (!open.empty()) {
+    Open& top = open.back();
+    if (top.left == 0) {
+      out += top.isDictionary ? '}' : ']';
+      open.pop_back();
+      continue;
+    }
+    const bool isValueOfKey = top.isDictionary && top.left % 2 == 1;
+    if (isValueOfKey) {
+      out += ": ";
+    } else if (!top.isFirst) {
+      out += ", ";
+    }
+    top.isFirst = false;
+    const ValueView item(top.next);
+    if (--top.left != 0) top.next = item.end();
+    enter(item);  // Ends the life of `top`.
+  }
+}
+
+std::string description(ValueView value) {
+  std::string text;
+  appendDescription(text, value);
+  return text;
+}
+
+}  // namespace ostrel
