@@ -1,0 +1,108 @@
+#include "Statistics/OstrelReportingUtility.h"
+
+#include <cstdint>
+#include <mutex>
+#include <optional>
+
+#include "platform/DeviceInfo.h"
+
+namespace ostrel {
+namespace {
+
+constexpr std::uint32_t kDomainMask = 0xFFFF0000;
+constexpr std::uint32_t kKindMask = 0x0000FFFF;
+constexpr std::uint32_t kAllOnes = 0xFFFFFFFF;
+
+// Empty for a domain without a name.
+std::string_view domainName(std::uint32_t domain) {
+  switch (domain) {
+    case 0x08000000:
+      return "Session";
+    case 0x10000000:
+      return "DSP";
+    case 0x20000000:
+      return "HAL";
+    case 0x40000000:
+      return "Routing";
+    case 0x80000000:
+      return "Toolbox";
+    default:
+      return {};
+  }
+}
+
+std::string_view kindName(std::uint32_t kind) {
+  static constexpr std::string_view kNames[] = {
+      "Undefined",   "Generic",       "Record",      "Playback", "PlaybackAndRecord",
+      "Setup",       "ClientRequest", "RouteChange", "Error",    "Chanreporting",
+      "Performance", "Volume"};
+  return kNames[kind < std::size(kNames) ? kind : 0];
+}
+
+struct InternalBuild {
+  std::mutex mutex;
+  std::optional<bool> answer;
+};
+
+InternalBuild& internalBuild() {
+  static InternalBuild& instance = *new InternalBuild;
+  return instance;
+}
+
+}  // namespace
+
+std::string_view ServiceTypeName(ServiceType serviceType) {
+  static constexpr std::string_view kNames[] = {
+      "generic",          "vocea",         "telephony",
+      "haptics",          "alarms",        "standalone",
+      "soundautoconfig",  "longformaudio", "nonlongformaudio",
+      "audiodeviceusage", "alerts",        "test"};
+  const auto code = static_cast<std::uint16_t>(serviceType);
+  return code < std::size(kNames) ? kNames[code] : "unknown";
+}
+
+std::string CategoryName(MessageCategory category) {
+  const auto code = static_cast<std::uint32_t>(category);
+  std::string name;
+  // Kept: the code of all ones counts as a kind without a domain.
+  // [KeepsAllOnesCategoryWithoutDomain]
+  if (code > kKindMask && code != kAllOnes) {
+    name += domainName(code & kDomainMask);
+    // Kept: a domain without a name still leaves its "_".
+    // [KeepsLeadingUnderscoreForUnnamedDomain]
+    name += '_';
+  }
+  name += kindName(code & kKindMask);
+  return name;
+}
+
+std::string_view MessageTypeName(MessageType type) {
+  static constexpr std::string_view kNames[] = {"Generic", "Start", "Stop",
+                                                "Setup",   "Error", "IssueDetector"};
+  const auto code = static_cast<std::uint16_t>(type);
+  if (code < std::size(kNames)) return kNames[code];
+  return code == 0xFFFF ? "Unknown" : "Undefined";
+}
+
+Value HostApplicationID(const Dictionary& userInfo) {
+  std::optional<Value> id = userInfo.get("HostApplicationDisplayID");
+  return id ? *std::move(id) : Value("Unknown");
+}
+
+bool IsInternalBuild(const OstrelReportingPlatform& platform) {
+  InternalBuild& state = internalBuild();
+  const std::lock_guard lock(state.mutex);
+  if (!state.answer) {
+    const std::optional<Value> answer = platform.deviceInfo->answer("InternalBuild");
+    state.answer = answer && answer->view().number().value_or(0) != 0;
+  }
+  return *state.answer;
+}
+
+void forgetIsInternalBuildForTesting() {
+  InternalBuild& state = internalBuild();
+  const std::lock_guard lock(state.mutex);
+  state.answer.reset();
+}
+
+}  // namespace ostrel

@@ -1,0 +1,54 @@
+// The vocabulary of the service: the names of its codes, and a few look-ups that
+// every part shares. Nothing here logs or fails.
+#pragma once
+
+#include <array>
+#include <chrono>
+#include <string>
+#include <string_view>
+
+#include "Statistics/OstrelReportingTypes.h"
+#include "platform/OstrelReportingPlatform.h"
+#include "platform/Value.h"
+
+namespace ostrel {
+
+/// The name of a service type, such as "telephony"; "unknown" for a code
+/// without a name. Any thread.
+std::string_view ServiceTypeName(ServiceType serviceType);
+
+/// The name of a category: its domain, "_" and its kind, such as
+/// "Routing_RouteChange", or the kind alone where there is no domain. Any
+/// thread.
+std::string CategoryName(MessageCategory category);
+
+/// The name of a message type, such as "Start"; "Undefined" for a code without
+/// a name. Any thread.
+std::string_view MessageTypeName(MessageType type);
+
+/// What stands under "HostApplicationDisplayID", of whatever kind it is;
+/// "Unknown" when nothing does. Any thread.
+Value HostApplicationID(const Dictionary& userInfo);
+
+/// Whether this is an internal build of the device. The first call of the
+/// process asks `DeviceInfo`; all others get its answer. No answer, or one that
+/// is not a number or a boolean, counts as not internal. Any thread; concurrent
+/// first callers wait.
+bool IsInternalBuild(const OstrelReportingPlatform& platform);
+
+/// Makes the next `IsInternalBuild` ask again. For tests.
+void forgetIsInternalBuildForTesting();
+
+/// The payload keys whose values are never compared when two messages are held
+/// to be duplicates: three time stamps, and the two keys that steer the
+/// throttle itself.
+inline constexpr std::array<std::string_view, 5> ThrottleExcludedKeys = {
+    "systemuptime_sec", "processuptime_ms", "ostrelreporting_timestamp",
+    "_comparison_field_blacklist", "_throttle_seconds"};
+
+/// How long one wait for the backends of a telemetry session lasts.
+inline constexpr std::chrono::nanoseconds BackendWaitTimeout =
+    std::chrono::duration_cast<std::chrono::nanoseconds>(
+        std::chrono::duration<double>(double{9.0F}));
+
+}  // namespace ostrel
