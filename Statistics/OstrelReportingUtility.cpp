@@ -62,18 +62,22 @@ std::string_view ServiceTypeName(ServiceType serviceType) {
 }
 
 std::string CategoryName(MessageCategory category) {
-  const auto code = static_cast<std::uint32_t>(category);
   std::string name;
+  appendCategoryName(name, category);
+  return name;
+}
+
+void appendCategoryName(std::string& out, MessageCategory category) {
+  const auto code = static_cast<std::uint32_t>(category);
   // Kept: the code of all ones counts as a kind without a domain.
   // [KeepsAllOnesCategoryWithoutDomain]
   if (code > kKindMask && code != kAllOnes) {
-    name += domainName(code & kDomainMask);
+    out += domainName(code & kDomainMask);
     // Kept: a domain without a name still leaves its "_".
     // [KeepsLeadingUnderscoreForUnnamedDomain]
-    name += '_';
+    out += '_';
   }
-  name += kindName(code & kKindMask);
-  return name;
+  out += kindName(code & kKindMask);
 }
 
 std::string_view MessageTypeName(MessageType type) {
@@ -104,5 +108,53 @@ void forgetIsInternalBuildForTesting() {
   const std::lock_guard lock(state.mutex);
   state.answer.reset();
 }
+
+namespace {
+
+void backendWaitEnded(const LogScope& scope, WorkQueue& queue,
+                      const std::shared_ptr<Condition>& condition,
+                      const std::function<bool()>& found,
+                      const std::function<void(bool)>& done, Condition::Wake wake);
+
+}  // namespace
+
+void OstrelReportingUtilityWait(const LogScope& scope, WorkQueue& queue,
+                                std::shared_ptr<Condition> condition,
+                                std::function<bool()> found,
+                                std::function<void(bool)> done) {
+  condition->lock();
+  if (found()) {
+    condition->unlock();
+    done(/*found=*/true);
+    return;
+  }
+  OSTREL_LOG_DEFAULT(scope, "%@", "waiting for telvard to find backends");
+  queue.suspend();
+  Condition& waited = *condition;
+  waited.wait(BackendWaitTimeout, [&scope, &queue, condition, found = std::move(found),
+                                   done = std::move(done)](Condition::Wake wake) {
+    queue.resume([&scope, &queue, condition, found, done, wake] {
+      backendWaitEnded(scope, queue, condition, found, done, wake);
+    });
+  });
+  waited.unlock();
+}
+
+namespace {
+
+void backendWaitEnded(const LogScope& scope, WorkQueue& queue,
+                      const std::shared_ptr<Condition>& condition,
+                      const std::function<bool()>& found,
+                      const std::function<void(bool)>& done, Condition::Wake wake) {
+  if (wake == Condition::Wake::kTimedOut) {
+    OSTREL_LOG_ERROR(scope, "%@", "failed to find backend");
+    done(/*found=*/false);
+    return;
+  }
+  OSTREL_LOG_DEFAULT(scope, "continuing");
+  OstrelReportingUtilityWait(scope, queue, condition, found, done);
+}
+
+}  // namespace
 
 }  // namespace ostrel

@@ -1,15 +1,20 @@
 // The vocabulary of the service: the names of its codes, and a few look-ups that
-// every part shares. Nothing here logs or fails.
+// every part shares. Of these only the wait for backends logs, and none fails.
 #pragma once
 
 #include <array>
 #include <chrono>
+#include <functional>
+#include <memory>
 #include <string>
 #include <string_view>
 
 #include "Statistics/OstrelReportingTypes.h"
+#include "platform/Condition.h"
+#include "platform/Logging.h"
 #include "platform/OstrelReportingPlatform.h"
 #include "platform/Value.h"
+#include "platform/WorkQueue.h"
 
 namespace ostrel {
 
@@ -21,6 +26,9 @@ std::string_view ServiceTypeName(ServiceType serviceType);
 /// "Routing_RouteChange", or the kind alone where there is no domain. Any
 /// thread.
 std::string CategoryName(MessageCategory category);
+
+/// As `CategoryName`, at the end of `out`: for names made of several parts.
+void appendCategoryName(std::string& out, MessageCategory category);
 
 /// The name of a message type, such as "Start"; "Undefined" for a code without
 /// a name. Any thread.
@@ -50,5 +58,16 @@ inline constexpr std::array<std::string_view, 5> ThrottleExcludedKeys = {
 inline constexpr std::chrono::nanoseconds BackendWaitTimeout =
     std::chrono::duration_cast<std::chrono::nanoseconds>(
         std::chrono::duration<double>(double{9.0F}));
+
+/// Holds `queue` back, without holding a thread, until `found` is true or a wait
+/// of `BackendWaitTimeout` ends in vain; then calls `done` on the queue with
+/// which of the two it was. Calls it at once when `found` is true already.
+/// `found` is asked with the condition's lock held; whoever makes it true
+/// signals the condition. Every wake that finds it false waits anew. Called on
+/// `queue`, which must stay alive through `done`.
+void OstrelReportingUtilityWait(const LogScope& scope, WorkQueue& queue,
+                                std::shared_ptr<Condition> condition,
+                                std::function<bool()> found,
+                                std::function<void(bool)> done);
 
 }  // namespace ostrel
