@@ -128,6 +128,8 @@ class ValueView {
 
   /// The encoding, from the first byte to the last.
   std::span<const std::uint8_t> bytes() const { return {item_, end()}; }
+  /// The first byte of the encoding.
+  const std::uint8_t* data() const { return item_; }
   /// One past the last byte of the encoding.
   const std::uint8_t* end() const;
 
