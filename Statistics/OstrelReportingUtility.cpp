@@ -109,52 +109,33 @@ void forgetIsInternalBuildForTesting() {
   state.answer.reset();
 }
 
-namespace {
+// The wait's continuation bears the wait's name: its lines do in the log.
 
-void backendWaitEnded(const LogScope& scope, WorkQueue& queue,
-                      const std::shared_ptr<Condition>& condition,
-                      const std::function<bool()>& found,
-                      const std::function<void(bool)>& done, Condition::Wake wake);
-
-}  // namespace
-
-void OstrelReportingUtilityWait(const LogScope& scope, WorkQueue& queue,
-                                std::shared_ptr<Condition> condition,
-                                std::function<bool()> found,
-                                std::function<void(bool)> done) {
-  condition->lock();
-  if (found()) {
-    condition->unlock();
-    done(/*found=*/true);
-    return;
-  }
-  OSTREL_LOG_DEFAULT(scope, "%@", "waiting for telvard to find backends");
-  queue.suspend();
-  Condition& waited = *condition;
-  waited.wait(BackendWaitTimeout, [&scope, &queue, condition, found = std::move(found),
-                                   done = std::move(done)](Condition::Wake wake) {
-    queue.resume([&scope, &queue, condition, found, done, wake] {
-      backendWaitEnded(scope, queue, condition, found, done, wake);
-    });
-  });
-  waited.unlock();
-}
-
-namespace {
-
-void backendWaitEnded(const LogScope& scope, WorkQueue& queue,
-                      const std::shared_ptr<Condition>& condition,
-                      const std::function<bool()>& found,
-                      const std::function<void(bool)>& done, Condition::Wake wake) {
+static void OstrelReportingUtilityWait(std::shared_ptr<const BackendWait> wait,
+                                       Condition::Wake wake) {
   if (wake == Condition::Wake::kTimedOut) {
-    OSTREL_LOG_ERROR(scope, "%@", "failed to find backend");
-    done(/*found=*/false);
+    OSTREL_LOG_ERROR(wait->scope, "%@", "failed to find backend");
+    wait->done(/*found=*/false);
     return;
   }
-  OSTREL_LOG_DEFAULT(scope, "continuing");
-  OstrelReportingUtilityWait(scope, queue, condition, found, done);
+  OSTREL_LOG_DEFAULT(wait->scope, "continuing");
+  OstrelReportingUtilityWait(std::move(wait));
 }
 
-}  // namespace
+void OstrelReportingUtilityWait(std::shared_ptr<const BackendWait> wait) {
+  Condition& condition = *wait->condition;
+  condition.lock();
+  if (wait->found()) {
+    condition.unlock();
+    wait->done(/*found=*/true);
+    return;
+  }
+  OSTREL_LOG_DEFAULT(wait->scope, "%@", "waiting for telvard to find backends");
+  wait->queue.suspend();
+  condition.wait(BackendWaitTimeout, [wait](Condition::Wake wake) {
+    wait->queue.resume([wait, wake] { OstrelReportingUtilityWait(wait, wake); });
+  });
+  condition.unlock();
+}
 
 }  // namespace ostrel

@@ -59,15 +59,21 @@ inline constexpr std::chrono::nanoseconds BackendWaitTimeout =
     std::chrono::duration_cast<std::chrono::nanoseconds>(
         std::chrono::duration<double>(double{9.0F}));
 
-/// Holds `queue` back, without holding a thread, until `found` is true or a wait
-/// of `BackendWaitTimeout` ends in vain; then calls `done` on the queue with
-/// which of the two it was. Calls it at once when `found` is true already.
-/// `found` is asked with the condition's lock held; whoever makes it true
-/// signals the condition. Every wake that finds it false waits anew. Called on
-/// `queue`, which must stay alive through `done`.
-void OstrelReportingUtilityWait(const LogScope& scope, WorkQueue& queue,
-                                std::shared_ptr<Condition> condition,
-                                std::function<bool()> found,
-                                std::function<void(bool)> done);
+/// A wait for the backends of a telemetry session. `queue` stays alive through
+/// `done`.
+struct BackendWait {
+  const LogScope& scope;
+  WorkQueue& queue;
+  std::shared_ptr<Condition> condition;
+  std::function<bool()> found;     // Asked with the condition's lock held.
+  std::function<void(bool)> done;  // Called on the queue.
+};
+
+/// Holds the queue back, without holding a thread, until `found` is true or a
+/// wait of `BackendWaitTimeout` ends in vain; then calls `done` with which of
+/// the two it was. Calls it at once when `found` is true already. Whoever makes
+/// `found` true signals the condition; a wake that finds it false waits anew.
+/// Called on the queue.
+void OstrelReportingUtilityWait(std::shared_ptr<const BackendWait> wait);
 
 }  // namespace ostrel

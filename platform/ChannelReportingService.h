@@ -55,18 +55,16 @@ class ChannelReportingService {
 
   virtual Subscribed createSubscription(const ChannelCollection& channels) = 0;
 
-  virtual Outcome<Dictionary> createSamples(
-      const ChannelSubscription& subscription,
-      const Dictionary& subscribedChannels) = 0;
+  virtual Outcome<Dictionary> createSamples(const ChannelSubscription& subscription,
+                                            const Dictionary& subscribedChannels) = 0;
 
   /// How far each channel of `later` moved since `earlier`.
-  virtual Outcome<Dictionary> createSamplesDelta(
-      const std::optional<Dictionary>& earlier, const Dictionary& later) = 0;
+  virtual Outcome<Dictionary> createSamplesDelta(const std::optional<Dictionary>& earlier,
+                                                 const Dictionary& later) = 0;
 
   /// Calls `callback` once per channel, on the calling thread, until it returns
   /// other than 0.
-  virtual void iterate(const Dictionary& samples,
-                       const ChannelCallback& callback) = 0;
+  virtual void iterate(const Dictionary& samples, const ChannelCallback& callback) = 0;
 };
 
 }  // namespace ostrel

@@ -21,14 +21,13 @@ std::string iso8601(Date date) {
   const year_month_day calendar{day};
   const hh_mm_ss clock{time - day};
   char text[32];
-  std::snprintf(text, sizeof text, "%04d-%02u-%02uT%02d:%02d:%02d.%03dZ",
-                static_cast<int>(calendar.year()),
-                static_cast<unsigned>(calendar.month()),
-                static_cast<unsigned>(calendar.day()),
-                static_cast<int>(clock.hours().count()),
-                static_cast<int>(clock.minutes().count()),
-                static_cast<int>(clock.seconds().count()),
-                static_cast<int>(clock.subseconds().count()));
+  std::snprintf(
+      text, sizeof text, "%04d-%02u-%02uT%02d:%02d:%02d.%03dZ",
+      static_cast<int>(calendar.year()), static_cast<unsigned>(calendar.month()),
+      static_cast<unsigned>(calendar.day()), static_cast<int>(clock.hours().count()),
+      static_cast<int>(clock.minutes().count()),
+      static_cast<int>(clock.seconds().count()),
+      static_cast<int>(clock.subseconds().count()));
   return text;
 }
 

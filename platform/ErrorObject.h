@@ -17,8 +17,7 @@ struct ErrorObject {
 };
 
 /// The service's own errors.
-inline constexpr std::string_view kOstrelErrorDomain =
-    "com.orbisk.audio.reporting";
+inline constexpr std::string_view kOstrelErrorDomain = "com.orbisk.audio.reporting";
 /// Errors without a more particular home.
 inline constexpr std::string_view kGeneralErrorDomain = "com.orbisk.general";
 /// Errors whose code is an `errno` value.

@@ -30,13 +30,12 @@ class FileSystem {
   /// become those of each directory it makes below the diagnostic log
   /// directory, whatever the umask. A directory that exists already is a
   /// success.
-  virtual Success createDirectory(const std::string& path,
-                                  std::uint32_t permissions) = 0;
+  virtual Success createDirectory(const std::string& path, std::uint32_t permissions) = 0;
 
   /// Replaces the file `name` in `directory` by `text` in one step: other
   /// readers see the old file, or none, or the whole new one. No `text` is a
-  /// failure. A name that cannot exist ("/" or NUL in it, too long) is a
-  /// failure; nothing is ever written outside `directory`, nor through a link.
+  /// failure without an error object. A name that cannot exist ("/" or NUL in it, too
+  /// long) is a failure; nothing is ever written outside `directory`, nor through a link.
   virtual Success writeFileAtomically(const std::string& directory,
                                       const std::string& name,
                                       const std::optional<TextSource>& text) = 0;

@@ -30,8 +30,7 @@ class IPCConnection {
   /// until after its invalidation.
   virtual void setExportedObject(
       std::shared_ptr<OstrelReportingServiceProtocol> object) = 0;
-  virtual std::shared_ptr<OstrelReportingServiceProtocol> exportedObject()
-      const = 0;
+  virtual std::shared_ptr<OstrelReportingServiceProtocol> exportedObject() const = 0;
 
   /// Called at most once, when the client vanished or broke the protocol;
   /// never when it ended well.
@@ -54,8 +53,7 @@ class IPCListenerDelegate {
   /// A client connected. The delegate sets the connection up and resumes it.
   /// False refuses it.
   virtual bool listenerShouldAcceptNewConnection(
-      IPCListener& listener,
-      const std::shared_ptr<IPCConnection>& newConnection) = 0;
+      IPCListener& listener, const std::shared_ptr<IPCConnection>& newConnection) = 0;
 };
 
 class IPCListener {

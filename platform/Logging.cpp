@@ -39,9 +39,7 @@ void setLevels(LogScope& scope, const ScopedLog& log) {
 
 // The length of the well-formed UTF-8 sequence at the start of `text`, or 0.
 std::size_t sequenceLength(std::string_view text) {
-  const auto byte = [&](std::size_t i) {
-    return static_cast<unsigned char>(text[i]);
-  };
+  const auto byte = [&](std::size_t i) { return static_cast<unsigned char>(text[i]); };
   const auto continues = [&](std::size_t i, unsigned low, unsigned high) {
     return i < text.size() && byte(i) >= low && byte(i) <= high;
   };
@@ -56,8 +54,7 @@ std::size_t sequenceLength(std::string_view text) {
   if (lead >= 0xF0 && lead <= 0xF4) {
     const unsigned low = lead == 0xF0 ? 0x90 : 0x80;
     const unsigned high = lead == 0xF4 ? 0x8F : 0xBF;
-    return continues(1, low, high) && continues(2, 0x80, 0xBF) &&
-                   continues(3, 0x80, 0xBF)
+    return continues(1, low, high) && continues(2, 0x80, 0xBF) && continues(3, 0x80, 0xBF)
                ? 4
                : 0;
   }
@@ -93,8 +90,7 @@ LogScope processLogScope("osrp", "reporting_process_verbose");
 
 void LogScope::setLevels(LogLevel lowest, int verbosity) {
   std::uint32_t levels = 0;
-  for (const LogLevel level :
-       {LogLevel::kError, LogLevel::kDefault, LogLevel::kInfo}) {
+  for (const LogLevel level : {LogLevel::kError, LogLevel::kDefault, LogLevel::kInfo}) {
     if (level <= lowest) levels |= 1u << static_cast<unsigned>(level);
   }
   if (verbosity >= kDebugVerbosity) {
@@ -126,8 +122,7 @@ void LogArgument::appendFloatingPoint(std::string& out, double value) {
   out += text.data();
 }
 
-std::string formatText(std::string_view format,
-                       std::span<const LogArgument> arguments) {
+std::string formatText(std::string_view format, std::span<const LogArgument> arguments) {
   std::string out;
   std::string text;
   std::size_t next = 0;

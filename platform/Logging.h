@@ -89,18 +89,23 @@ class LogArgument {
       out += std::to_string(value);
     } else if constexpr (std::is_floating_point_v<T>) {
       appendFloatingPoint(out, value);
-    } else if constexpr (std::is_same_v<T, ValueView> ||
-                         std::is_same_v<T, Value>) {
+    } else if constexpr (std::is_same_v<T, ValueView> || std::is_same_v<T, Value>) {
       appendDescription(out, value);
-    } else if constexpr (std::is_same_v<T, Dictionary> ||
-                         std::is_same_v<T, Array>) {
+    } else if constexpr (std::is_same_v<T, Dictionary> || std::is_same_v<T, Array>) {
       appendDescription(out, value.value());
     } else if constexpr (std::is_same_v<T, ErrorObject>) {
       out += value.description;
     } else if constexpr (requires { value.description(); }) {
       out += value.description();
-    } else if constexpr (requires { value.has_value(); *value; } ||
-                         requires { value.get(); *value; }) {
+    } else if constexpr (
+        requires {
+          value.has_value();
+          *value;
+        } ||
+        requires {
+          value.get();
+          *value;
+        }) {
       if (value) {
         appendText(out, *value);
       } else {
@@ -129,8 +134,7 @@ class LogArgument {
 /// the next argument in its own text, whatever its letter. An argument takes
 /// 2 KiB at most; its control characters and invalid UTF-8 are escaped, so that
 /// it can neither end the line nor forge one.
-std::string formatText(std::string_view format,
-                       std::span<const LogArgument> arguments);
+std::string formatText(std::string_view format, std::span<const LogArgument> arguments);
 
 template <typename... Arguments>
 std::string format(std::string_view format, const Arguments&... arguments) {
@@ -192,20 +196,18 @@ constexpr std::string_view qualifiedName(std::string_view signature) {
 
 }  // namespace ostrel
 
-#define OSTREL_LOG(scope, level, format_, ...)                                \
-  do {                                                                        \
-    static_assert(                                                            \
-        ::ostrel::countConversions(format_) ==                                \
-            std::tuple_size_v<decltype(std::forward_as_tuple(__VA_ARGS__))>,  \
-        "one argument for each conversion of the format");                    \
-    if ((scope).isOn(level)) {                                                \
-      ::ostrel::writeLogLine(                                                 \
-          scope, level,                                                       \
-          {__FILE_NAME__, __LINE__,                                           \
-           ::ostrel::qualifiedName(                                           \
-               static_cast<const char*>(__PRETTY_FUNCTION__))},               \
-          ::ostrel::format(format_ __VA_OPT__(, ) __VA_ARGS__));              \
-    }                                                                         \
+#define OSTREL_LOG(scope, level, format_, ...)                                         \
+  do {                                                                                 \
+    static_assert(::ostrel::countConversions(format_) ==                               \
+                      std::tuple_size_v<decltype(std::forward_as_tuple(__VA_ARGS__))>, \
+                  "one argument for each conversion of the format");                   \
+    if ((scope).isOn(level)) {                                                         \
+      ::ostrel::writeLogLine(                                                          \
+          scope, level,                                                                \
+          {__FILE_NAME__, __LINE__,                                                    \
+           ::ostrel::qualifiedName(static_cast<const char*>(__PRETTY_FUNCTION__))},    \
+          ::ostrel::format(format_ __VA_OPT__(, ) __VA_ARGS__));                       \
+    }                                                                                  \
   } while (false)
 
 #define OSTREL_LOG_ERROR(scope, ...) \

@@ -18,9 +18,9 @@ class Task {
   Task() = default;
 
   template <typename F>
-    requires(!std::is_same_v<std::decay_t<F>, Task> &&
-             std::is_invocable_v<std::decay_t<F>&>)
-  Task(F&& callable) {  // Implicit, so that a lambda is a task.
+  requires(!std::is_same_v<std::decay_t<F>, Task> &&
+           std::is_invocable_v<std::decay_t<F>&>)
+      Task(F&& callable) {  // Implicit, so that a lambda is a task.
     using Callable = std::decay_t<F>;
     if constexpr (fits<Callable>()) {
       new (storage_) Callable(std::forward<F>(callable));

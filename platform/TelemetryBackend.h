@@ -23,8 +23,7 @@ inline constexpr std::string_view kTelvarSessionInfoBatchEvent =
     "kTelvarSessionInfoBatchEvent";
 inline constexpr std::string_view kTelvarSessionInfoHierarchyToken =
     "kTelvarSessionInfoHierarchyToken";
-inline constexpr std::string_view kTelvarUserInfoClientName =
-    "kTelvarUserInfoClientName";
+inline constexpr std::string_view kTelvarUserInfoClientName = "kTelvarUserInfoClientName";
 inline constexpr std::string_view kTelvarUserInfoServiceName =
     "kTelvarUserInfoServiceName";
 
@@ -72,9 +71,8 @@ class TelemetryBackend {
 
   /// Sends one message that belongs to no session.
   virtual Success sendOneMessage(const Dictionary& sessionInfo,
-                                 const Dictionary& userInfo,
-                                 std::uint16_t category, std::uint16_t type,
-                                 const Dictionary& payload) = 0;
+                                 const Dictionary& userInfo, std::uint16_t category,
+                                 std::uint16_t type, const Dictionary& payload) = 0;
 };
 
 }  // namespace ostrel

@@ -22,5 +22,4 @@
 #define OSTREL_RELEASE(...) OSTREL_ANNOTATION(release_capability(__VA_ARGS__))
 #define OSTREL_ASSERT_CAPABILITY(x) OSTREL_ANNOTATION(assert_capability(x))
 #define OSTREL_RETURN_CAPABILITY(x) OSTREL_ANNOTATION(lock_returned(x))
-#define OSTREL_NO_THREAD_SAFETY_ANALYSIS \
-  OSTREL_ANNOTATION(no_thread_safety_analysis)
+#define OSTREL_NO_THREAD_SAFETY_ANALYSIS OSTREL_ANNOTATION(no_thread_safety_analysis)

@@ -18,8 +18,7 @@ class UserDefaultsSuite {
 
   /// The value as text: a string as it is, a number in decimal, none for
   /// anything else.
-  virtual std::optional<std::string> stringForKey(
-      std::string_view key) const = 0;
+  virtual std::optional<std::string> stringForKey(std::string_view key) const = 0;
 
   /// The value as a boolean: a number is true unless 0; a text is true when it
   /// reads as "yes", "true" or a number other than 0; anything else is false.
@@ -32,8 +31,7 @@ class UserDefaults {
 
   /// Reads the suite afresh. One that is missing or cannot be read has no
   /// values; the latter is logged.
-  virtual std::unique_ptr<UserDefaultsSuite> openSuite(
-      std::string_view name) = 0;
+  virtual std::unique_ptr<UserDefaultsSuite> openSuite(std::string_view name) = 0;
 };
 
 }  // namespace ostrel

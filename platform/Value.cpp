@@ -105,9 +105,8 @@ std::optional<double> doubleOf(const Head& head) {
 }
 
 double integerAsDouble(const Head& head) {
-  return head.majorType == kUnsigned
-             ? static_cast<double>(head.argument)
-             : -1.0 - static_cast<double>(head.argument);
+  return head.majorType == kUnsigned ? static_cast<double>(head.argument)
+                                     : -1.0 - static_cast<double>(head.argument);
 }
 
 std::string_view asText(std::span<const std::uint8_t> bytes) {
@@ -181,8 +180,7 @@ void appendScalarDescription(std::string& out, ValueView value) {
 
 }  // namespace
 
-ValueBuffer ValueBuffer::make(std::size_t size,
-                              std::shared_ptr<PayloadAccount> account) {
+ValueBuffer ValueBuffer::make(std::size_t size, std::shared_ptr<PayloadAccount> account) {
   void* memory = ::operator new(sizeof(Header) + size);
   auto* header = new (memory) Header;
   header->size = size;
@@ -407,13 +405,11 @@ Value::Value(const Dictionary& dictionary)
     : owner_(dictionary.owner()), view_(dictionary.value()) {}
 
 Value Value::ofSigned(std::int64_t integer) {
-  return Value(asBytes(
-      encoded([&](ValueEncoder& to) { to.signedInteger(integer); })));
+  return Value(asBytes(encoded([&](ValueEncoder& to) { to.signedInteger(integer); })));
 }
 
 Value Value::ofUnsigned(std::uint64_t integer) {
-  return Value(asBytes(
-      encoded([&](ValueEncoder& to) { to.unsignedInteger(integer); })));
+  return Value(asBytes(encoded([&](ValueEncoder& to) { to.unsignedInteger(integer); })));
 }
 
 Array::Array() : item_(&kEmptyArray) {}
@@ -425,8 +421,7 @@ std::optional<Array> Array::from(const Value& value) {
 
 Dictionary::Dictionary() : item_(&kEmptyMap) {}
 
-Dictionary::Dictionary(
-    std::initializer_list<std::pair<std::string_view, Value>> entries)
+Dictionary::Dictionary(std::initializer_list<std::pair<std::string_view, Value>> entries)
     : Dictionary() {
   DictionaryBuilder builder;
   for (const auto& [key, value] : entries) builder.set(key, value);
@@ -436,6 +431,11 @@ Dictionary::Dictionary(
 std::optional<Dictionary> Dictionary::from(const Value& value) {
   if (value->kind() != ValueKind::kDictionary) return std::nullopt;
   return Dictionary(value.owner(), value->bytes().data());
+}
+
+Dictionary Dictionary::copyOf(std::string_view encoded) {
+  const ValueBuffer buffer = ValueBuffer::copyOf(asBytes(encoded));
+  return Dictionary(buffer, buffer.data());
 }
 
 std::optional<Value> Dictionary::get(std::string_view key) const {
@@ -517,25 +517,26 @@ Array ArrayBuilder::build() const {
 bool DictionaryBuilder::KeyOrder::operator()(std::size_t a, std::size_t b) const {
   return builder->keyBytes(a) < builder->keyBytes(b);
 }
-bool DictionaryBuilder::KeyOrder::operator()(std::size_t a,
-                                             std::string_view b) const {
+bool DictionaryBuilder::KeyOrder::operator()(std::size_t a, std::string_view b) const {
   return builder->keyBytes(a) < b;
 }
-bool DictionaryBuilder::KeyOrder::operator()(std::string_view a,
-                                             std::size_t b) const {
+bool DictionaryBuilder::KeyOrder::operator()(std::string_view a, std::size_t b) const {
   return a < builder->keyBytes(b);
 }
 
 DictionaryBuilder::DictionaryBuilder() : order_(KeyOrder{this}) {}
 
-DictionaryBuilder::DictionaryBuilder(const Dictionary& start)
+DictionaryBuilder::DictionaryBuilder(std::shared_ptr<PayloadAccount> account)
     : DictionaryBuilder() {
-  account_ = start.owner().account();
+  account_ = std::move(account);
+}
+
+DictionaryBuilder::DictionaryBuilder(const Dictionary& start)
+    : DictionaryBuilder(start.owner().account()) {
   merge(start);
 }
 
-std::optional<std::size_t> DictionaryBuilder::indexOf(
-    std::string_view encodedKey) const {
+std::optional<std::size_t> DictionaryBuilder::indexOf(std::string_view encodedKey) const {
   if (!order_.empty()) {
     const auto found = order_.find(encodedKey);
     if (found == order_.end()) return std::nullopt;
@@ -547,8 +548,7 @@ std::optional<std::size_t> DictionaryBuilder::indexOf(
   return std::nullopt;
 }
 
-DictionaryBuilder& DictionaryBuilder::set(std::string_view key,
-                                          const Value& value) {
+DictionaryBuilder& DictionaryBuilder::set(std::string_view key, const Value& value) {
   const Value keyValue(key);
   return set(keyValue.view(), value.view());
 }
@@ -578,18 +578,6 @@ DictionaryBuilder& DictionaryBuilder::set(ValueView key, ValueView value) {
 DictionaryBuilder& DictionaryBuilder::merge(const Dictionary& other) {
   for (const auto& [key, value] : other) set(key, value);
   return *this;
-}
-
-void DictionaryBuilder::appendUnique(std::string_view key, ValueView value) {
-  Entry entry;
-  entry.key = scratch_.size();
-  ValueEncoder encoder(scratch_);
-  encoder.string(key);
-  entry.value = scratch_.size();
-  encoder.item(value);
-  entry.end = scratch_.size();
-  entries_.push_back(entry);
-  if (!order_.empty()) order_.insert(entries_.size() - 1);
 }
 
 bool DictionaryBuilder::contains(std::string_view key) const {
@@ -629,8 +617,7 @@ void appendDescription(std::string& out, ValueView value) {
     } else if (auto dictionary = item.dictionary()) {
       out += '{';
       open.push_back(
-          {dictionary->empty() ? nullptr
-                               : (*dictionary->begin()).key.bytes().data(),
+          {dictionary->empty() ? nullptr : (*dictionary->begin()).key.bytes().data(),
            2 * dictionary->size(), /*isDictionary=*/true});
     } else {
       appendScalarDescription(out, item);

@@ -46,8 +46,7 @@ class ValueBuffer {
  public:
   ValueBuffer() = default;
   /// `size` writable bytes. `account` may be none.
-  static ValueBuffer make(std::size_t size,
-                          std::shared_ptr<PayloadAccount> account = {});
+  static ValueBuffer make(std::size_t size, std::shared_ptr<PayloadAccount> account = {});
   static ValueBuffer copyOf(std::span<const std::uint8_t> bytes,
                             std::shared_ptr<PayloadAccount> account = {});
 
@@ -61,16 +60,13 @@ class ValueBuffer {
     return *this;
   }
   ~ValueBuffer() {
-    if (header_ &&
-        header_->references.fetch_sub(1, std::memory_order_acq_rel) == 1) {
+    if (header_ && header_->references.fetch_sub(1, std::memory_order_acq_rel) == 1) {
       destroy(header_);
     }
   }
 
   explicit operator bool() const { return header_ != nullptr; }
-  std::uint8_t* data() {
-    return reinterpret_cast<std::uint8_t*>(header_ + 1);
-  }
+  std::uint8_t* data() { return reinterpret_cast<std::uint8_t*>(header_ + 1); }
   const std::uint8_t* data() const {
     return reinterpret_cast<const std::uint8_t*>(header_ + 1);
   }
@@ -172,8 +168,7 @@ class ArrayView {
     std::size_t left_;
   };
 
-  ArrayView(const std::uint8_t* first, std::size_t size)
-      : first_(first), size_(size) {}
+  ArrayView(const std::uint8_t* first, std::size_t size) : first_(first), size_(size) {}
   std::size_t size() const { return size_; }
   bool empty() const { return size_ == 0; }
   Iterator begin() const { return {first_, size_}; }
@@ -200,9 +195,7 @@ class DictionaryView {
     using pointer = void;
     using reference = Entry;
 
-    Iterator(const std::uint8_t* at, std::size_t left) : left_(left) {
-      moveTo(at);
-    }
+    Iterator(const std::uint8_t* at, std::size_t left) : left_(left) { moveTo(at); }
     Entry operator*() const { return {ValueView(at_), ValueView(value_)}; }
     Iterator& operator++() {
       --left_;
@@ -258,24 +251,21 @@ class Value {
   Value(const char* text) : Value(std::string_view(text)) {}
   Value(const std::string& text) : Value(std::string_view(text)) {}
   template <typename T>
-    requires(std::is_integral_v<T> && !std::is_same_v<T, bool>)
-  Value(T integer) : Value(makeInteger(integer)) {}
+  requires(std::is_integral_v<T> && !std::is_same_v<T, bool>) Value(T integer)
+      : Value(makeInteger(integer)) {}
   Value(const Array& array);
   Value(const Dictionary& dictionary);
   /// A copy of what the view shows.
   explicit Value(ValueView view);
   /// What `view` shows, kept alive by the buffer that it points into.
-  Value(ValueBuffer owner, ValueView view)
-      : owner_(std::move(owner)), view_(view) {}
+  Value(ValueBuffer owner, ValueView view) : owner_(std::move(owner)), view_(view) {}
 
   ValueView view() const { return view_; }
   operator ValueView() const { return view_; }
   const ValueView* operator->() const { return &view_; }
   const ValueBuffer& owner() const { return owner_; }
 
-  friend bool operator==(const Value& a, const Value& b) {
-    return a.view_ == b.view_;
-  }
+  friend bool operator==(const Value& a, const Value& b) { return a.view_ == b.view_; }
 
  private:
   explicit Value(std::span<const std::uint8_t> encoded);
@@ -332,6 +322,8 @@ class Dictionary {
   Dictionary(std::initializer_list<std::pair<std::string_view, Value>> entries);
   /// None when the value is not a dictionary.
   static std::optional<Dictionary> from(const Value& value);
+  /// A copy of a dictionary that a `ValueEncoder` wrote.
+  static Dictionary copyOf(std::string_view encoded);
 
   DictionaryView view() const { return *ValueView(item_).dictionary(); }
   ValueView value() const { return ValueView(item_); }
@@ -342,9 +334,7 @@ class Dictionary {
   auto end() const { return view().end(); }
 
   /// Valid as long as this dictionary.
-  std::optional<ValueView> find(std::string_view key) const {
-    return view().find(key);
-  }
+  std::optional<ValueView> find(std::string_view key) const { return view().find(key); }
   /// As `find`, kept alive.
   std::optional<Value> get(std::string_view key) const;
   bool contains(std::string_view key) const { return find(key).has_value(); }
@@ -396,6 +386,8 @@ class ArrayBuilder {
 class DictionaryBuilder {
  public:
   DictionaryBuilder();
+  /// Empty; what is built is charged to `account`, which may be none.
+  explicit DictionaryBuilder(std::shared_ptr<PayloadAccount> account);
   /// Begins with the entries of `start` and bears its account.
   explicit DictionaryBuilder(const Dictionary& start);
   DictionaryBuilder(const DictionaryBuilder&) = delete;
@@ -405,9 +397,6 @@ class DictionaryBuilder {
   DictionaryBuilder& set(ValueView key, ValueView value);
   /// Adds all entries of `other`; equal keys are replaced.
   DictionaryBuilder& merge(const Dictionary& other);
-
-  /// Appends an entry whose key is known not to be there yet.
-  void appendUnique(std::string_view key, ValueView value);
 
   bool contains(std::string_view key) const;
   std::size_t size() const { return entries_.size(); }
@@ -431,19 +420,20 @@ class DictionaryBuilder {
   };
 
   std::string_view keyBytes(std::size_t index) const {
-    return std::string_view(scratch_).substr(
-        entries_[index].key, entries_[index].value - entries_[index].key);
+    return std::string_view(scratch_).substr(entries_[index].key,
+                                             entries_[index].value - entries_[index].key);
   }
   std::optional<std::size_t> indexOf(std::string_view encodedKey) const;
 
-  std::string scratch_;         // Encoded keys and values, replaced ones too.
-  std::vector<Entry> entries_;  // Offsets into `scratch_`.
+  std::string scratch_;                    // Encoded keys and values, replaced ones too.
+  std::vector<Entry> entries_;             // Offsets into `scratch_`.
   std::set<std::size_t, KeyOrder> order_;  // Filled once a walk would be slow.
   std::shared_ptr<PayloadAccount> account_;
 };
 
 /// Appends the text that stands for a value in log lines, summaries and
-/// comparison keys: text as it is, "true" and "false", numbers in decimal, dates as ISO 8601,
+/// comparison keys: text as it is, "true" and "false", numbers in decimal, dates as ISO
+/// 8601,
 /// "[a, b]" and "{key: value}" in the order of the entries. The same for the
 /// same value in one process.
 void appendDescription(std::string& out, ValueView value);

@@ -22,7 +22,7 @@ enum class JSONStrictness {
 /// `indent` is the depth at which a pretty value stands. On an error nothing is
 /// appended. Safe at any nesting.
 std::optional<ErrorObject> appendJSON(std::string& out, ValueView value,
-                                      JSONLayout layout,
-                                      JSONStrictness strictness, int indent);
+                                      JSONLayout layout, JSONStrictness strictness,
+                                      int indent);
 
 }  // namespace ostrel

@@ -59,9 +59,9 @@ class WorkQueueFactory {
 
   /// A new serial queue. Queues may share a label. `relativePriority` is 0 or
   /// below; lower runs later within its class.
-  virtual std::shared_ptr<WorkQueue> makeSerialQueue(
-      std::string_view label, QualityOfService qualityOfService,
-      int relativePriority) = 0;
+  virtual std::shared_ptr<WorkQueue> makeSerialQueue(std::string_view label,
+                                                     QualityOfService qualityOfService,
+                                                     int relativePriority) = 0;
 
   /// The process's one concurrent queue of background priority.
   virtual ConcurrentQueue& backgroundQueue() = 0;

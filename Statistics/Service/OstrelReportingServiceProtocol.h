@@ -19,14 +19,12 @@ class OstrelReportingServiceProtocol {
 
   /// Makes a session of this client's under `reporterID`, in place of an
   /// earlier one of this client's. Always replies true.
-  virtual void createReportingSession(ReporterID reporterID,
-                                      BoolReply reply) = 0;
+  virtual void createReportingSession(ReporterID reporterID, BoolReply reply) = 0;
 
   /// Sets the type of this client's session; a started session restarts when
   /// its type changes. Replies true, also when there is no such session; no
   /// reply at all for ID 0.
-  virtual void setServiceType(ServiceType serviceType,
-                              ReporterID reportingSession,
+  virtual void setServiceType(ServiceType serviceType, ReporterID reportingSession,
                               BoolReply reply) = 0;
 
   /// Replies the type of any client's session, or `kServiceTypeUnknown` when
@@ -42,32 +40,26 @@ class OstrelReportingServiceProtocol {
   /// Starts any client's session. Replies false at once when there is no such
   /// session; otherwise true when the session stops, at each of its stops. No
   /// reply for ID 0, nor for a session that is started already.
-  virtual void startReportingSessionForID(ReporterID reporterID,
-                                          BoolReply reply) = 0;
+  virtual void startReportingSessionForID(ReporterID reporterID, BoolReply reply) = 0;
 
   /// Sends a message to the sessions named, whoever made them; IDs that name
   /// none are passed over. No list (none, not an empty one) sends it to every
   /// started session or, when there is none, out by itself. Replies no error
   /// once the message is accepted, or an error while reporting is switched off.
-  virtual void sendMessage(Dictionary message, MessageCategory category,
-                           MessageType type,
-                           std::optional<ReporterIDs> reportingIDs,
-                           ErrorReply reply) = 0;
+  virtual void sendMessage(Dictionary message, MessageCategory category, MessageType type,
+                           std::optional<ReporterIDs> reportingIDs, ErrorReply reply) = 0;
 
   /// Stops any client's session. Replies true, also when there is none; no
   /// reply for ID 0.
-  virtual void stopReportingSessionForID(ReporterID reporterID,
-                                         BoolReply reply) = 0;
+  virtual void stopReportingSessionForID(ReporterID reporterID, BoolReply reply) = 0;
 
   /// Stops this client's session if it is started, and drops it. Replies true,
   /// also when there is none; no reply for ID 0.
-  virtual void destroyReportingSession(ReporterID reporterID,
-                                       BoolReply reply) = 0;
+  virtual void destroyReportingSession(ReporterID reporterID, BoolReply reply) = 0;
 
   /// Replies {"reporterID", "serviceType"} of any client's session, 0 and
   /// 65535 when there is none.
-  virtual void reporterIDValid(ReporterID reporterID,
-                               DictionaryReply reply) = 0;
+  virtual void reporterIDValid(ReporterID reporterID, DictionaryReply reply) = 0;
 
   /// Replies the IDs of every session of every client.
   virtual void getAllReporters(ReporterIDsReply reply) = 0;

@@ -1,0 +1,485 @@
+// A session is its queue: start, stop, changes of type, merges of defaults and
+// deliveries are steps on it and follow one another in the order of the calls.
+// What a message meets is decided by the state when its step runs, not when its
+// client called.
+//
+// Starting waits for the telemetry backend. The wait suspends the queue and
+// holds no thread, so that thousands of sessions may wait at once; the rest of
+// the start then runs before everything that was queued meanwhile. The backend
+// answers on its own thread and sets `started` under the condition's lock.
+//
+// A stopped session has no aggregation list. Orientation callbacks that come
+// late append to the list they still find, or to none.
+#include "Statistics/Service/OstrelReportingSession.h"
+
+#include <chrono>
+#include <mutex>
+#include <utility>
+
+#include "Statistics/OstrelReportingTallyraBridge.h"
+#include "Statistics/OstrelReportingUtility.h"
+#include "Statistics/OstrelReportingWattlogUtility.h"
+#include "Statistics/Service/OstrelReportingSessionSummary.h"
+#include "platform/AnalyticsSink.h"
+#include "platform/Clock.h"
+#include "platform/DeviceInfo.h"
+#include "platform/FileSystem.h"
+#include "platform/JSONSerialization.h"
+#include "platform/KernelTrace.h"
+#include "platform/Logging.h"
+#include "platform/Random.h"
+
+namespace ostrel {
+namespace {
+
+LogScope logScope("osrr", "reporting_rtc_verbose");
+
+constexpr MessageCategory kSummaryCategory{0xFFFFFFFF};
+constexpr MessageType kSummaryType{0xFFFF};
+constexpr int kClientType = 19;
+constexpr double kClientVersion = 1.0;
+constexpr std::string_view kClientName = "com.orbisk.ostrel";
+constexpr std::int64_t kNoSessionID = -1;
+constexpr std::uint32_t kAlarmSpreadSeconds = 60;
+constexpr std::int32_t kDeviceClassWithoutOrientation = 6;
+constexpr std::string_view kHostApplicationKey = "HostApplicationDisplayID";
+constexpr std::uint32_t kLogDirectoryPermissions = 0777;
+
+// Kept: the backend gets the low half of the category, log lines get all of it.
+// [KeepsFullCategoryInLogAndLow16BitsOnTheWire]
+std::uint16_t categoryOnTheWire(MessageCategory category) {
+  return static_cast<std::uint16_t>(static_cast<std::uint32_t>(category) & 0xFFFF);
+}
+
+void call(const ErrorReply& reply, const std::optional<ErrorObject>& error) {
+  if (reply) reply(error);
+}
+
+void sendSingleMessageStep(const OstrelReportingPlatform& platform,
+                           const Dictionary& message, MessageCategory category,
+                           MessageType type, ServiceType serviceType,
+                           const ErrorReply& reply) {
+  platform.kernelTrace->trace(TraceCode::kMessageDelivery);
+  OSTREL_LOG_DEBUG(logScope, "sending single message");
+  const Dictionary sessionInfo{{kTelvarSessionInfoClientType, kClientType},
+                               {kTelvarSessionInfoClientVersion, kClientVersion},
+                               {kTelvarSessionInfoSessionID, kNoSessionID}};
+  const Dictionary userInfo{{kTelvarUserInfoClientName, kClientName},
+                            {kTelvarUserInfoServiceName, ServiceTypeName(serviceType)}};
+  const Success sent = platform.telemetryBackend->sendOneMessage(
+      sessionInfo, userInfo, categoryOnTheWire(category),
+      static_cast<std::uint16_t>(type), SanitisedPayload(message));
+  if (sent.succeeded) {
+    OSTREL_LOG_DEBUG(logScope, "message %@ : category %i : type %i", message, category,
+                     type);
+  } else if (sent.error) {
+    OSTREL_LOG_ERROR(logScope, "sendOneMessageWithSessionInfo %@",
+                     sent.error->description);
+  }
+  call(reply, sent.error);
+}
+
+}  // namespace
+
+std::shared_ptr<OstrelReportingSession> OstrelReportingSession::initWithID(
+    ReporterID reporterID, std::vector<ProcessID> processIdentifiers,
+    const OstrelReportingPlatform& platform) {
+  static std::once_flag registered;
+  std::call_once(registered, [] { registerLogScope(logScope); });
+  auto session = std::make_shared<OstrelReportingSession>(
+      Passkey{}, reporterID, std::move(processIdentifiers), platform);
+  OSTREL_LOG_INFO(logScope, "created reporting session for ID: %lli", reporterID);
+  platform.kernelTrace->trace(TraceCode::kSessionCreated);
+  return session;
+}
+
+OstrelReportingSession::OstrelReportingSession(Passkey, ReporterID reporterID,
+                                               std::vector<ProcessID> processIdentifiers,
+                                               const OstrelReportingPlatform& platform)
+    : platform_(platform),
+      reporterID_(reporterID),
+      processIdentifiers_(std::move(processIdentifiers)),
+      sessionReportingQueue_(platform.workQueues->makeSerialQueue(
+          "com.orbisk.ostrel.reporting.session", QualityOfService::kUtility,
+          /*relativePriority=*/0)),
+      userInfo_(std::make_shared<MutableDictionary>()),
+      serviceName_("unknown"),
+      aggregatedPayloadData_(std::make_shared<AggregatedPayloadData>()) {}
+
+OstrelReportingSession::~OstrelReportingSession() {
+  platform_.kernelTrace->trace(TraceCode::kSessionTeardown);
+  OSTREL_LOG_INFO(logScope, "deallocing this session %lli", reporterID_);
+}
+
+void OstrelReportingSession::setServiceType(ServiceType serviceType) {
+  sessionReportingQueue_->async(
+      [self = shared_from_this(), serviceType, before = this->serviceType()] {
+        self->sessionReportingQueue_->assertCurrent();
+        self->setServiceTypeStep(serviceType, before);
+      });
+}
+
+void OstrelReportingSession::setServiceTypeStep(ServiceType serviceType,
+                                                ServiceType before) {
+  if (!started()) {
+    applyServiceType(serviceType);
+  } else if (before != serviceType) {
+    stopSync(/*sync=*/true);
+    applyServiceType(serviceType);
+    startSync(/*sync=*/true);
+  }
+}
+
+void OstrelReportingSession::applyServiceType(ServiceType serviceType) {
+  const std::string name(ServiceTypeName(serviceType));
+  serviceType_.store(serviceType, std::memory_order_release);
+  serviceName_.set(name);
+  OSTREL_LOG_INFO(logScope, "setting service type %@", name);
+}
+
+void OstrelReportingSession::setConfiguration(
+    const std::optional<Dictionary>& configuration) {
+  if (configuration) userInfo_->merge(*configuration);
+}
+
+void OstrelReportingSession::updateDefaults(std::optional<Dictionary> defaults) {
+  sessionReportingQueue_->async(
+      [self = shared_from_this(), defaults = std::move(defaults)] {
+        self->sessionReportingQueue_->assertCurrent();
+        self->updateDefaultsStep(defaults);
+      });
+}
+
+// Kept: a default that is gone from the store stays in the user info.
+// [KeepsDefaultsMergeNeverRemoving]
+void OstrelReportingSession::updateDefaultsStep(
+    const std::optional<Dictionary>& defaults) {
+  if (defaults) userInfo_->merge(*defaults);
+}
+
+void OstrelReportingSession::startSync(bool sync) {
+  OSTREL_LOG_DEBUG(logScope, "starting session owned by %lli", reporterID_);
+  if (sync) {
+    sessionReportingQueue_->assertCurrent();
+    startStep();
+    return;
+  }
+  sessionReportingQueue_->async([self = shared_from_this()] {
+    self->sessionReportingQueue_->assertCurrent();
+    self->startStep();
+  });
+}
+
+void OstrelReportingSession::startStep() {
+  if (started()) {
+    OSTREL_LOG_INFO(logScope, "%lli is already started", reporterID_);
+    return;
+  }
+  orientationCallbackID_.set(format("OstrelReportingService %lli", reporterID_));
+  startDate_.set(platform_.clock->now());
+  aggregatedPayloadData_.set(std::make_shared<AggregatedPayloadData>());
+  platform_.kernelTrace->trace(TraceCode::kSessionStart);
+  if (serviceType() == kServiceTypeTest) {
+    setStarted(true);
+    return;
+  }
+  const HierarchyToken token =
+      platform_.telemetryBackend->makeHierarchyToken(/*parent=*/std::nullopt);
+  reportingAgentToken_.set(token);
+  reportingSession_.set(makeReportingSession(token));
+  findBackends();
+}
+
+std::shared_ptr<TelemetrySession> OstrelReportingSession::makeReportingSession(
+    const HierarchyToken& token) const {
+  const Dictionary sessionInfo{
+      {kTelvarSessionInfoClientType, kClientType},
+      {kTelvarSessionInfoClientVersion, kClientVersion},
+      {kTelvarSessionInfoSessionID, static_cast<std::int64_t>(reporterID_)},
+      {kTelvarSessionInfoBatchEvent, true},
+      {kTelvarSessionInfoHierarchyToken, token}};
+  DictionaryBuilder userInfo;
+  userInfo.set(kTelvarUserInfoClientName, kClientName);
+  userInfo.set(kTelvarUserInfoServiceName, serviceName_.get() + "_session");
+  userInfo.merge(userInfo_->snapshot());
+  return platform_.telemetryBackend->createSession(sessionInfo, userInfo.build(),
+                                                   /*frameworksToCheck=*/{});
+}
+
+void OstrelReportingSession::findBackends() {
+  const std::shared_ptr<OstrelReportingSession> self = shared_from_this();
+  const std::shared_ptr<Condition> condition = platform_.conditions->makeCondition();
+  reportingSession_.get()->startConfiguration(
+      [self, condition](std::optional<Array> backends) {
+        self->backendCallback(backends, *condition);
+      });
+  OstrelReportingUtilityWait(std::make_shared<const BackendWait>(BackendWait{
+      logScope, *sessionReportingQueue_, condition, [self] { return self->started(); },
+      [self](bool foundBackends) {
+        self->sessionReportingQueue_->assertCurrent();
+        self->finishStartStep(foundBackends);
+      }}));
+}
+
+void OstrelReportingSession::backendCallback(const std::optional<Array>& backends,
+                                             Condition& condition) {
+  if (!backends) {
+    OSTREL_LOG_ERROR(logScope,
+                     "No backends found, this session won't get sent to the server");
+    return;
+  }
+  OSTREL_LOG_DEFAULT(logScope, "List of backends %@", *backends);
+  condition.lock();
+  setStarted(true);
+  condition.signal();
+  condition.unlock();
+}
+
+void OstrelReportingSession::finishStartStep(bool foundBackends) {
+  if (!foundBackends) {
+    reportingSession_.set(nullptr);
+    setStarted(true);
+  }
+  if (shouldReportOrientation()) registerOrientationObservers();
+}
+
+void OstrelReportingSession::stopSync(bool sync) {
+  OSTREL_LOG_DEBUG(logScope, "ending session %lli", reporterID_);
+  if (sync) {
+    sessionReportingQueue_->assertCurrent();
+    stopStep();
+    return;
+  }
+  sessionReportingQueue_->async([self = shared_from_this()] {
+    self->sessionReportingQueue_->assertCurrent();
+    self->stopStep();
+  });
+}
+
+void OstrelReportingSession::stopStep() {
+  if (shouldReportOrientation()) {
+    const std::string id = orientationCallbackID_.get().value_or("");
+    platform_.orientationService->unregisterDeviceOrientationObserver(id);
+    platform_.orientationService->unregisterInterfaceOrientationObserver(id);
+  }
+  if (!started()) return;
+  // Kept: a stop says so twice, when it is asked for and when it begins.
+  // [KeepsDoubledLineOfAStop]
+  OSTREL_LOG_DEBUG(logScope, "ending session %lli", reporterID_);
+  platform_.kernelTrace->trace(TraceCode::kSessionStop);
+  if (auto summary = createSummaryEventForSession()) {
+    OSTREL_LOG_DEFAULT(logScope, "sending summary event for reporter %lli", reporterID_);
+    sendMessage(*std::move(summary), kSummaryCategory, kSummaryType, /*sync=*/true,
+                /*reply=*/nullptr);
+  }
+  if (serviceType() != kServiceTypeTest) flushStep();
+  if (const auto list = aggregatedPayloadData_.get()) {
+    const auto locked = list->lock();
+    aggregatedPayloadData_.set(nullptr);
+  }
+  setStarted(false);
+  // Kept: a start is answered here, at each stop, and nowhere else.
+  // [KeepsStartReplyAtEveryStop]
+  if (const BoolReply complete = transactionCompleteBlock_.get()) complete(true);
+}
+
+// The flush is issued before the handle is released.
+void OstrelReportingSession::flushStep() {
+  if (const auto session = reportingSession_.get()) {
+    session->flush([](const std::optional<ErrorObject>& error) {
+      if (error) OSTREL_LOG_ERROR(logScope, "flush error %@", error->description);
+    });
+  }
+  reportingSession_.set(nullptr);
+}
+
+void OstrelReportingSession::sendMessage(Dictionary message, MessageCategory category,
+                                         MessageType type, bool sync, ErrorReply reply) {
+  OSTREL_LOG_DEBUG(logScope, "sending message for session owned by %lli", reporterID_);
+  if (sync) {
+    sessionReportingQueue_->assertCurrent();
+    deliverStep(message, category, type, reply);
+    return;
+  }
+  sessionReportingQueue_->async([self = shared_from_this(), message = std::move(message),
+                                 category, type, reply = std::move(reply)] {
+    self->sessionReportingQueue_->assertCurrent();
+    self->deliverStep(message, category, type, reply);
+  });
+}
+
+void OstrelReportingSession::deliverStep(const Dictionary& message,
+                                         MessageCategory category, MessageType type,
+                                         const ErrorReply& reply) {
+  const Dictionary userInfo = userInfo_->snapshot();
+  OstrelReportingTallyraBridge::handleEvent(platform_, &message, category, type,
+                                            userInfo);
+  OstrelReportingWattlogUtility::handleEvent(platform_, &message, category, type,
+                                             userInfo);
+  const Dictionary payload = SanitisedPayload(message);
+  aggregate(payload, category, type);
+  platform_.kernelTrace->trace(TraceCode::kMessageDelivery);
+  if (started()) {
+    sendToBackend(message, payload, category, type, reply);
+    return;
+  }
+  OSTREL_LOG_DEBUG(logScope, "session not started, will send as a single message");
+  sendSingleMessage(platform_, payload, category, type, serviceType(), userInfo, reply);
+}
+
+// Kept: each entry is a dictionary of its own with the one identifier.
+// [KeepsOneElementEntriesOfMessages]
+void OstrelReportingSession::aggregate(const Dictionary& payload,
+                                       MessageCategory category, MessageType type) {
+  const std::string identifier = messageIdForCategory(category, type);
+  if (const auto list = aggregatedPayloadData_.get()) {
+    list->lock()->append(identifier, payload);
+  }
+}
+
+// Kept: the count belongs to the name; codes with equal names share it.
+// [KeepsSharedCounterForEqualNames]
+std::string OstrelReportingSession::messageIdForCategory(MessageCategory category,
+                                                         MessageType type) {
+  std::string identifier = CategoryName(category);
+  identifier += '_';
+  identifier += MessageTypeName(type);
+  const std::int64_t count = ++messageTypeCounts_[identifier];
+  identifier += '_';
+  identifier += std::to_string(count);
+  return identifier;
+}
+
+void OstrelReportingSession::sendToBackend(const Dictionary& message,
+                                           const Dictionary& payload,
+                                           MessageCategory category, MessageType type,
+                                           const ErrorReply& reply) {
+  if (serviceType() == kServiceTypeTest) {
+    OSTREL_LOG_INFO(logScope, "transactions aren't allowed on this platform");
+    call(reply, /*error=*/std::nullopt);
+    return;
+  }
+  const std::shared_ptr<TelemetrySession> session = reportingSession_.get();
+  if (!session) {
+    const ErrorObject error{std::string(kGeneralErrorDomain), /*code=*/-1,
+                            "No valid TelvarSession"};
+    OSTREL_LOG_ERROR(logScope, "%@", error.description);
+    call(reply, error);
+    return;
+  }
+  const Success sent = session->sendMessage(categoryOnTheWire(category),
+                                            static_cast<std::uint16_t>(type), payload);
+  if (sent.succeeded) {
+    OSTREL_LOG_DEBUG(logScope, "TelvarAgent %@ : message %@ : category %i : type %i",
+                     *session, message, category, type);
+  } else if (sent.error) {
+    OSTREL_LOG_ERROR(logScope, "error sending message %@", sent.error->description);
+  }
+  call(reply, sent.error);
+}
+
+// Kept: what the caller gives as user info reaches nobody.
+// [KeepsIgnoringUserInfoOfSingleMessages]
+void OstrelReportingSession::sendSingleMessage(
+    const OstrelReportingPlatform& platform, Dictionary message, MessageCategory category,
+    MessageType type, ServiceType serviceType,
+    const std::optional<Dictionary>& /*userInfo*/, ErrorReply reply) {
+  const std::int64_t delay = serviceType == kServiceTypeAlarms
+                                 ? platform.random->uniform(kAlarmSpreadSeconds)
+                                 : 0;
+  OSTREL_LOG_DEBUG(logScope, "sending single message after delta %lli for service %i",
+                   delay, serviceType);
+  platform.workQueues->backgroundQueue().asyncAfter(
+      std::chrono::seconds(delay), [&platform, message = std::move(message), category,
+                                    type, serviceType, reply = std::move(reply)] {
+        sendSingleMessageStep(platform, message, category, type, serviceType, reply);
+      });
+}
+
+std::optional<Dictionary> OstrelReportingSession::createSummaryEventForSession() {
+  const auto list = aggregatedPayloadData_.get();
+  if (!list || list->lock()->empty()) return std::nullopt;
+  const auto delivered = list->lock()->snapshot();
+  Dictionary summary = summaryEvent(serviceType(), delivered);
+  // Kept: the user info goes in at the front on every build, at every call, and
+  // after the summary is made. [KeepsUserInfoInsertedAtEverySummary]
+  list->lock()->insertFront(userInfo_);
+  if (IsInternalBuild(platform_)) writeSessionLog(*list);
+  return summary;
+}
+
+// Kept: one error slot serves all three calls, so that an earlier error is
+// logged again as one of the write. [KeepsSecondLogOfAnEarlierErrorAsWriteError]
+void OstrelReportingSession::writeSessionLog(const AggregatedPayloadData& list) {
+  std::optional<ErrorObject> error;
+  const auto entries = list.lock()->snapshot();
+  Outcome<TextSource> json = platform_.json->prettyPrintedArray(
+      [entries](const std::function<void(ValueView)>& element) {
+        entries.forEach(element);
+      });
+  if (json.error) error = json.error;
+  if (error) OSTREL_LOG_ERROR(logScope, "dataWithJSONObject: %@", error->description);
+
+  const std::string directory =
+      platform_.fileSystem->diagnosticLogDirectory() + "/Audio/Reporting";
+  const Success created =
+      platform_.fileSystem->createDirectory(directory, kLogDirectoryPermissions);
+  if (!created.succeeded) {
+    if (created.error) error = created.error;
+    OSTREL_LOG_ERROR(logScope, "can't create logging directory at %@: %@", directory,
+                     error);
+  }
+
+  const std::string name =
+      sessionLogFileName(*platform_.clock, platform_.clock->now(),
+                         userInfo_->snapshot().get(kHostApplicationKey), serviceType());
+  const Success written =
+      platform_.fileSystem->writeFileAtomically(directory, name, json.value);
+  if (!written.succeeded && written.error) error = written.error;
+  if (error) OSTREL_LOG_ERROR(logScope, "jsonOutput writeToURL: %@", error->description);
+}
+
+bool OstrelReportingSession::shouldReportOrientation() const {
+  if (!orientationCallbackID_.get()) return false;
+  if (!IsInternalBuild(platform_)) return false;
+  const ServiceType type = serviceType();
+  if (type != kServiceTypeLongFormAudio && type != kServiceTypeTelephony) return false;
+  return platform_.deviceInfo->deviceClass() != kDeviceClassWithoutOrientation;
+}
+
+// The callbacks hold the session until they are unregistered.
+void OstrelReportingSession::registerOrientationObservers() {
+  const std::shared_ptr<OstrelReportingSession> self = shared_from_this();
+  const std::string id = orientationCallbackID_.get().value_or("");
+  platform_.orientationService->registerDeviceOrientationObserver(
+      id, [self](OrientationService::OrientationCode code) {
+        self->orientationChanged("device", code);
+      });
+  platform_.orientationService->registerInterfaceOrientationObserver(
+      id, [self](OrientationService::OrientationCode code) {
+        self->orientationChanged("ui", code);
+      });
+}
+
+void OstrelReportingSession::orientationChanged(
+    std::string_view mode, OrientationService::OrientationCode code) {
+  const std::string name = platform_.orientationService->orientationName(code);
+  const Date start = startDate_.get().value_or(Date{});
+  const double time = platform_.clock->now().secondsSince1970 - start.secondsSince1970;
+  OSTREL_LOG_DEBUG(logScope,
+                   "Orientation handler callback mode=%@ orientation=\"%@\" app=\"%@\", "
+                   "time=%f, id=\"%@\"",
+                   mode, name, userInfo_->snapshot().get(kHostApplicationKey), time,
+                   orientationCallbackID_.get());
+  // Kept: name and time stand in one entry. [KeepsTwoElementEntriesOfOrientation]
+  const std::string key = std::string(mode) + "_orientation";
+  if (const auto list = aggregatedPayloadData_.get()) {
+    list->lock()->append(Dictionary{{key, name}, {key + "_time", time}});
+  }
+}
+
+std::string OstrelReportingSession::description() const {
+  return format("<OstrelReportingSession: %lli>", reporterID_);
+}
+
+}  // namespace ostrel

@@ -1,0 +1,220 @@
+#pragma once
+
+#include <array>
+#include <atomic>
+#include <cstdint>
+#include <map>
+#include <memory>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "Statistics/OstrelReportingDriverUtility.h"
+#include "Statistics/OstrelReportingTypes.h"
+#include "Statistics/Service/OstrelReportingAggregatedPayloads.h"
+#include "Statistics/Support/AtomicProperty.h"
+#include "Statistics/Support/MutableDictionary.h"
+#include "platform/Condition.h"
+#include "platform/IPCListener.h"
+#include "platform/OrientationService.h"
+#include "platform/OstrelReportingPlatform.h"
+#include "platform/TelemetryBackend.h"
+#include "platform/WorkQueue.h"
+
+namespace ostrel {
+
+/// One reporting session of one client, named by a `reporterID`.
+///
+/// Operations may be called from any thread and only queue their work on the
+/// session's own queue, except that `sync` true runs it before the call
+/// returns; the caller must then already be on `sessionReportingQueue`.
+///
+/// | state             | started | reportingSession | entered by                 |
+/// |-------------------|---------|------------------|----------------------------|
+/// | created           | no      | none             | `initWithID`               |
+/// | started, live     | yes     | present          | start with backends        |
+/// | started, detached | yes     | none             | start without, after 9.0 s |
+/// | started, test     | yes     | none             | start with service type 11 |
+/// | stopped           | no      | none             | stop; no aggregation list  |
+///
+/// Releasing a started session does not stop it: its summary and its flush are
+/// then lost.
+class OstrelReportingSession final
+    : public std::enable_shared_from_this<OstrelReportingSession> {
+ public:
+  /// Makes a session that is not started. `processIdentifiers` are the pids of
+  /// the client processes that own it. `platform` outlives the session.
+  static std::shared_ptr<OstrelReportingSession> initWithID(
+      ReporterID reporterID, std::vector<ProcessID> processIdentifiers,
+      const OstrelReportingPlatform& platform);
+
+  ~OstrelReportingSession();
+
+  /// Sets type and name. A started session whose type was another when this was
+  /// called is stopped and started again around the change.
+  void setServiceType(ServiceType serviceType);
+
+  /// Merges the entries into the user info at once, on the calling thread. A
+  /// live telemetry session does not learn of it. None changes nothing.
+  void setConfiguration(const std::optional<Dictionary>& configuration);
+
+  /// Merges the service's defaults into the user info, on the session's queue.
+  void updateDefaults(std::optional<Dictionary> defaults);
+
+  /// Starts the session; when it is already started, only logs. Holds the
+  /// session's queue back for up to `BackendWaitTimeout` without holding a
+  /// thread. Finding no backend is not a failure: the session is then detached.
+  void startSync(bool sync);
+  void start() { startSync(/*sync=*/false); }
+
+  /// Ends the session: summary, flush, release of the telemetry session, then
+  /// `transactionCompleteBlock`. Nothing of these when it is not started.
+  void stopSync(bool sync);
+  void stop() { stopSync(/*sync=*/false); }
+
+  /// Delivers one message. The backend gets the low 16 bits of `category`;
+  /// bridges and log lines get all 32. `reply` may be empty; otherwise it is
+  /// called once, on this session's queue or on the background queue, with the
+  /// backend's error or none.
+  void sendMessage(Dictionary message, MessageCategory category, MessageType type,
+                   bool sync, ErrorReply reply);
+  void sendMessage(Dictionary message, MessageCategory category, MessageType type,
+                   ErrorReply reply) {
+    sendMessage(std::move(message), category, type, /*sync=*/false, std::move(reply));
+  }
+
+  /// Sends a message outside any session, on the background queue; those of the
+  /// alarms service after 0 to 59 seconds. `userInfo` is not used. `reply` may
+  /// be empty; otherwise it is called once with the backend's error or none.
+  static void sendSingleMessage(const OstrelReportingPlatform& platform,
+                                Dictionary message, MessageCategory category,
+                                MessageType type, ServiceType serviceType,
+                                const std::optional<Dictionary>& userInfo,
+                                ErrorReply reply);
+
+  /// The numbered identifier of the next message with these codes, such as
+  /// "Routing_RouteChange_Start_1". Counts from 1 for the session's life.
+  std::string messageIdForCategory(MessageCategory category, MessageType type)
+      OSTREL_ON_QUEUE(*sessionReportingQueue_);
+
+  /// The summary of what was delivered, or none when nothing was. Puts the user
+  /// info at the front of the list; on internal builds writes the session log,
+  /// whose failures are only logged.
+  std::optional<Dictionary> createSummaryEventForSession();
+
+  /// Whether orientation changes belong into this session's record.
+  bool shouldReportOrientation() const;
+
+  bool started() const { return started_.load(std::memory_order_acquire); }
+  void setStarted(bool started) { started_.store(started, std::memory_order_release); }
+  ServiceType serviceType() const { return serviceType_.load(std::memory_order_acquire); }
+  std::string serviceName() const { return serviceName_.get(); }
+  ReporterID reporterID() const { return reporterID_; }
+  const std::vector<ProcessID>& processIdentifiers() const { return processIdentifiers_; }
+  Dictionary userInfo() const { return userInfo_->snapshot(); }
+  const std::shared_ptr<WorkQueue>& sessionReportingQueue() const {
+    return sessionReportingQueue_;
+  }
+  std::shared_ptr<const DriverSnapShot> driverSnapShot() const {
+    return driverSnapShot_.get();
+  }
+  void setDriverSnapShot(std::shared_ptr<const DriverSnapShot> snapShot) {
+    driverSnapShot_.set(std::move(snapShot));
+  }
+  BoolReply transactionCompleteBlock() const { return transactionCompleteBlock_.get(); }
+  /// Called with true as the last step of every stop of the started session;
+  /// may be empty.
+  void setTransactionCompleteBlock(BoolReply block) {
+    transactionCompleteBlock_.set(std::move(block));
+  }
+  /// None from a stop until the next start.
+  std::shared_ptr<AggregatedPayloadData> aggregatedPayloadData() const {
+    return aggregatedPayloadData_.get();
+  }
+  void setAggregatedPayloadData(std::shared_ptr<AggregatedPayloadData> list) {
+    aggregatedPayloadData_.set(std::move(list));
+  }
+  std::optional<std::string> orientationCallbackID() const {
+    return orientationCallbackID_.get();
+  }
+  void setOrientationCallbackID(std::optional<std::string> id) {
+    orientationCallbackID_.set(std::move(id));
+  }
+  std::optional<Date> startDate() const { return startDate_.get(); }
+  void setStartDate(std::optional<Date> date) { startDate_.set(date); }
+  std::shared_ptr<TelemetrySession> reportingSession() const {
+    return reportingSession_.get();
+  }
+  std::optional<HierarchyToken> reportingAgentToken() const {
+    return reportingAgentToken_.get();
+  }
+
+  /// How many messages had each name, without their numbers.
+  const std::map<std::string, std::int64_t>& messageTypeCounts() const
+      OSTREL_ON_QUEUE(*sessionReportingQueue_) {
+    return messageTypeCounts_;
+  }
+
+  /// "<OstrelReportingSession: 42>".
+  std::string description() const;
+
+ private:
+  struct Passkey {};
+
+ public:
+  OstrelReportingSession(Passkey, ReporterID reporterID,
+                         std::vector<ProcessID> processIdentifiers,
+                         const OstrelReportingPlatform& platform);
+
+ private:
+  void setServiceTypeStep(ServiceType serviceType, ServiceType before)
+      OSTREL_ON_QUEUE(*sessionReportingQueue_);
+  void applyServiceType(ServiceType serviceType) OSTREL_ON_QUEUE(*sessionReportingQueue_);
+  void updateDefaultsStep(const std::optional<Dictionary>& defaults)
+      OSTREL_ON_QUEUE(*sessionReportingQueue_);
+  void startStep() OSTREL_ON_QUEUE(*sessionReportingQueue_);
+  std::shared_ptr<TelemetrySession> makeReportingSession(
+      const HierarchyToken& token) const;
+  void findBackends() OSTREL_ON_QUEUE(*sessionReportingQueue_);
+  void backendCallback(const std::optional<Array>& backends, Condition& condition);
+  void finishStartStep(bool foundBackends) OSTREL_ON_QUEUE(*sessionReportingQueue_);
+  void stopStep() OSTREL_ON_QUEUE(*sessionReportingQueue_);
+  void flushStep() OSTREL_ON_QUEUE(*sessionReportingQueue_);
+  void deliverStep(const Dictionary& message, MessageCategory category, MessageType type,
+                   const ErrorReply& reply) OSTREL_ON_QUEUE(*sessionReportingQueue_);
+  void aggregate(const Dictionary& payload, MessageCategory category, MessageType type)
+      OSTREL_ON_QUEUE(*sessionReportingQueue_);
+  void sendToBackend(const Dictionary& message, const Dictionary& payload,
+                     MessageCategory category, MessageType type, const ErrorReply& reply)
+      OSTREL_ON_QUEUE(*sessionReportingQueue_);
+  void writeSessionLog(const AggregatedPayloadData& list);
+  void registerOrientationObservers();
+  void orientationChanged(std::string_view mode,
+                          OrientationService::OrientationCode code);
+
+  // Constant after construction.
+  const OstrelReportingPlatform& platform_;
+  const ReporterID reporterID_;
+  const std::vector<ProcessID> processIdentifiers_;
+  const std::shared_ptr<WorkQueue> sessionReportingQueue_;
+  const std::shared_ptr<MutableDictionary> userInfo_;
+
+  // On the queue.
+  std::map<std::string, std::int64_t> messageTypeCounts_
+      OSTREL_GUARDED_BY(*sessionReportingQueue_);
+
+  // Shared, each with its own lock. The list carries its own monitor:
+  // orientation callbacks append from their own thread.
+  std::atomic<bool> started_{false};  // The backend's thread sets it too.
+  std::atomic<ServiceType> serviceType_{kServiceTypeUnknown};
+  AtomicProperty<std::string> serviceName_;
+  AtomicProperty<std::shared_ptr<const DriverSnapShot>> driverSnapShot_;
+  AtomicProperty<BoolReply> transactionCompleteBlock_;
+  AtomicProperty<std::shared_ptr<AggregatedPayloadData>> aggregatedPayloadData_;
+  AtomicProperty<std::optional<std::string>> orientationCallbackID_;
+  AtomicProperty<std::optional<Date>> startDate_;
+  AtomicProperty<std::shared_ptr<TelemetrySession>> reportingSession_;
+  AtomicProperty<std::optional<HierarchyToken>> reportingAgentToken_;
+};
+
+}  // namespace ostrel
