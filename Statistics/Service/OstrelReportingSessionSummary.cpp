@@ -24,7 +24,8 @@ class Grouping {
            const OstrelReportingAggregatedPayloads::Snapshot& entries) {
     add(firstKey, firstValue);
     entries.forEach([this](ValueView entry) {
-      for (const auto& [key, value] : *entry.dictionary()) add(key, value);
+      const DictionaryView dictionary = *entry.dictionary();
+      for (const auto& [key, value] : dictionary) add(key, value);
     });
   }
 

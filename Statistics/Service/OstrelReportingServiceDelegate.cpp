@@ -1,0 +1,588 @@
+// The service host. Client requests arrive on the listener's thread, are logged
+// there and queued on `serverQueue`; all that this file keeps of clients and
+// their sessions is touched on that queue only, so requests of all clients are
+// handled one at a time in the order of their arrival. Sessions have queues of
+// their own; from here they are only handed work.
+//
+// Some requests are answered twice and some never. Those places say so.
+#include "Statistics/Service/OstrelReportingServiceDelegate.h"
+
+#include <algorithm>
+#include <cmath>
+#include <limits>
+#include <mutex>
+#include <utility>
+
+#include "Statistics/OstrelReportingUtility.h"
+#include "platform/AnalyticsSink.h"
+#include "platform/Clock.h"
+#include "platform/KernelTrace.h"
+#include "platform/Logging.h"
+#include "platform/ProcessInfo.h"
+#include "platform/UserDefaults.h"
+
+namespace ostrel {
+
+ServerQueueRole serverQueueRole;
+
+namespace {
+
+LogScope logScope("osrs", "reporting_server_verbose");
+
+constexpr std::string_view kDefaultsSuite = "com.orbisk.ostrel";
+constexpr std::string_view kDefaultsNotification = "com.orbisk.ostrel.reporting";
+constexpr std::string_view kDeviceNameKey = "device_name";
+constexpr std::string_view kDisableReportingKey = "disable_reporting";
+constexpr MessageCategory kDriverStatisticsCategory{9};
+constexpr MessageType kDriverStatisticsType{0};
+constexpr int kKilledExitStatus = 2;
+
+AtomicProperty<std::shared_ptr<WorkQueue>>& serverQueueProperty() {
+  static auto& property = *new AtomicProperty<std::shared_ptr<WorkQueue>>;
+  return property;
+}
+
+std::atomic<int> defaultsNotifyToken{-1};
+
+template <typename Reply, typename... Values>
+void call(const Reply& reply, const Values&... values) {
+  if (reply) reply(values...);
+}
+
+std::int64_t truncated(double seconds) {
+  constexpr double kLimit = 9007199254740992.0;  // Exact in a double.
+  if (std::isnan(seconds)) return 0;
+  return static_cast<std::int64_t>(std::clamp(seconds, -kLimit, kLimit));
+}
+
+/// How long the client was there, for its uptime event.
+struct Uptime {
+  Value seconds{-1};  // An integer when it is not known, else a double.
+  std::int64_t wholeSeconds = -1;
+};
+
+Uptime uptimeOf(const OstrelReportingServerInstance* client, ProcessID pid, Date now) {
+  const auto name = client != nullptr ? client->clientProcessName() : std::nullopt;
+  const auto start = client != nullptr ? client->clientStartDate() : std::nullopt;
+  if (!start) {
+    OSTREL_LOG_DEFAULT(logScope,
+                       "clientStartDate is nil. clientpid=%d clientprocessname=%@", pid,
+                       name.value_or("unknown"));
+    return {};
+  }
+  const double sinceStart = now.secondsSince1970 - start->secondsSince1970;
+  // Kept: the text says past where the start lies in the future.
+  // [KeepsInThePastTextForAFutureStartDate]
+  if (sinceStart < 0) {
+    OSTREL_LOG_DEFAULT(logScope,
+                       "clientStartDate is in the past. clientpid=%d "
+                       "clientprocessname=%@",
+                       pid, name.value_or("unknown"));
+  }
+  return {Value(std::abs(sinceStart)), truncated(std::abs(sinceStart))};
+}
+
+void connectionInvalidated(const OstrelReportingPlatform& platform,
+                           const std::weak_ptr<OstrelReportingServerInstance>& weak,
+                           ProcessID pid) {
+  const auto client = weak.lock();
+  if (client) client->handleConnectionError();
+  const Uptime uptime = uptimeOf(client.get(), pid, platform.clock->now());
+  const auto name = client ? client->clientProcessName() : std::nullopt;
+  OSTREL_LOG_DEFAULT(logScope,
+                     "InvalidationHandler: connection exited process=%@ uptime_sec=%d",
+                     name, uptime.wholeSeconds);
+  if (!name) {
+    OSTREL_LOG_DEFAULT(logScope, "clientProcessName is nil. clientpid=%d", pid);
+    return;
+  }
+  platform.analyticsSink->sendEventLazy(
+      "com.orbisk.ostrel.ostrelreportingclientuptime",
+      [event = Dictionary{{"processName", *name}, {"seconds", uptime.seconds}}] {
+        return event;
+      });
+}
+
+void connectionInterrupted(const std::weak_ptr<OstrelReportingServerInstance>& weak) {
+  OSTREL_LOG_DEFAULT(logScope, "InterruptionHandler: connection exited");
+  if (const auto client = weak.lock()) client->handleConnectionError();
+}
+
+}  // namespace
+
+std::shared_ptr<WorkQueue> serverQueue() { return serverQueueProperty().get(); }
+
+void assertOnServerQueue() {
+  if (const auto queue = serverQueue()) queue->assertCurrent();
+}
+
+std::shared_ptr<OstrelReportingServiceDelegate> OstrelReportingServiceDelegate::init(
+    const OstrelReportingPlatform& platform) {
+  registerLogScope(logScope);
+  auto root = std::make_shared<OstrelReportingServiceDelegate>(Passkey{}, platform);
+  serverQueueProperty().set(platform.workQueues->makeSerialQueue(
+      "com.orbisk.ostrel.reporting.server", QualityOfService::kUserInteractive,
+      /*relativePriority=*/0));
+  root->listenForDefaultsNotification();
+  root->driverUtility_ = OstrelReportingDriverUtility::init(platform);
+  return root;
+}
+
+OstrelReportingServiceDelegate::OstrelReportingServiceDelegate(
+    Passkey, const OstrelReportingPlatform& platform)
+    : platform_(platform) {}
+
+std::string OstrelReportingServiceDelegate::description() const {
+  return "<OstrelReportingServiceDelegate>";
+}
+
+bool OstrelReportingServiceDelegate::listenerShouldAcceptNewConnection(
+    IPCListener& /*listener*/, const std::shared_ptr<IPCConnection>& newConnection) {
+  const ProcessID pid = newConnection->processIdentifier();
+  OSTREL_LOG_DEFAULT(logScope, "newConnection: %@", *newConnection);
+  newConnection->setExportedObject(OstrelReportingServerInstance::initWithMasterAndID(
+      shared_from_this(), pid, /*outError=*/nullptr));
+  const std::weak_ptr<OstrelReportingServerInstance> weak =
+      std::static_pointer_cast<OstrelReportingServerInstance>(
+          newConnection->exportedObject());
+  serverQueue()->async([self = shared_from_this(), weak, pid] {
+    assertOnServerQueue();
+    self->registerClientStep(weak.lock(), pid);
+  });
+  newConnection->setInterruptionHandler([weak] { connectionInterrupted(weak); });
+  newConnection->setInvalidationHandler(
+      [&platform = platform_, weak, pid] { connectionInvalidated(platform, weak, pid); });
+  newConnection->resume();
+  return true;
+}
+
+void OstrelReportingServiceDelegate::registerClientStep(
+    const std::shared_ptr<OstrelReportingServerInstance>& client, ProcessID pid) {
+  if (!client) return;  // Its connection ended before this step ran.
+  clients_.push_back(client);
+  client->registration_ = ++registrations_;
+  for (const auto& [reporterID, session] : client->clientReportingSessionMap_) {
+    indexSession(reporterID, *client);
+  }
+  client->clientStartDate_.set(platform_.clock->now());
+  client->clientProcessName_.set(processName(pid));
+}
+
+std::optional<std::string> OstrelReportingServiceDelegate::processName(
+    ProcessID pid) const {
+  if (pid == platform_.processInfo->processIdentifier()) {
+    return platform_.processInfo->processName();
+  }
+  if (pid >= 1) return platform_.processInfo->commandName(pid);
+  return std::nullopt;
+}
+
+void OstrelReportingServiceDelegate::removeClientStep(
+    OstrelReportingServerInstance& client) {
+  const auto found =
+      std::find_if(clients_.begin(), clients_.end(),
+                   [&](const auto& registered) { return registered.get() == &client; });
+  if (found == clients_.end()) return;
+  for (const auto& [reporterID, session] : client.clientReportingSessionMap_) {
+    forgetSession(reporterID, client);
+  }
+  client.registration_ = 0;
+  clients_.erase(found);
+  OSTREL_LOG_DEFAULT(logScope, "removing %i from the server client list",
+                     client.clientID());
+}
+
+void OstrelReportingServiceDelegate::indexSession(ReporterID reporterID,
+                                                  OstrelReportingServerInstance& client) {
+  if (client.registration_ == 0) return;
+  auto& owners = clientsByReporter_[reporterID];
+  const auto place =
+      std::lower_bound(owners.begin(), owners.end(), &client,
+                       [](const auto* a, const auto* b) OSTREL_ON_QUEUE(serverQueueRole) {
+                         return a->registration_ < b->registration_;
+                       });
+  if (place == owners.end() || *place != &client) owners.insert(place, &client);
+}
+
+void OstrelReportingServiceDelegate::forgetSession(
+    ReporterID reporterID, OstrelReportingServerInstance& client) {
+  const auto found = clientsByReporter_.find(reporterID);
+  if (found == clientsByReporter_.end()) return;
+  std::erase(found->second, &client);
+  if (found->second.empty()) clientsByReporter_.erase(found);
+}
+
+std::shared_ptr<OstrelReportingSession>
+OstrelReportingServiceDelegate::findReportingSessionForID(ReporterID reporterID) const {
+  if (reporterID == kNoReporter || !reportingEnabled()) return nullptr;
+  const auto found = clientsByReporter_.find(reporterID);
+  if (found == clientsByReporter_.end()) {
+    OSTREL_LOG_ERROR(logScope, "failed to find reporting session %lli", reporterID);
+    return nullptr;
+  }
+  const OstrelReportingServerInstance& client = *found->second.front();
+  OSTREL_LOG_INFO(logScope, "found reporting session %lli for client %i", reporterID,
+                  client.clientID());
+  return client.ownSession(reporterID);
+}
+
+void OstrelReportingServiceDelegate::listenForDefaultsNotification() {
+  const std::weak_ptr<OstrelReportingServiceDelegate> weak = weak_from_this();
+  const ChangeNotification::Registration registration =
+      platform_.notifications->registerDispatch(kDefaultsNotification, serverQueue(),
+                                                [weak](int token) {
+                                                  assertOnServerQueue();
+                                                  if (const auto self = weak.lock())
+                                                    self->defaultsChangedStep(token);
+                                                });
+  defaultsNotifyToken = registration.token;
+  OSTREL_LOG_DEFAULT(logScope, "notify setup result %i", registration.status);
+}
+
+Dictionary OstrelReportingServiceDelegate::OstrelReportingDefaults() const {
+  const auto suite = platform_.userDefaults->openSuite(kDefaultsSuite);
+  DictionaryBuilder defaults;
+  if (suite->objectForKey(kDeviceNameKey)) {
+    if (const auto name = suite->stringForKey(kDeviceNameKey)) {
+      defaults.set(kDeviceNameKey, *name);
+    }
+  }
+  if (suite->objectForKey(kDisableReportingKey)) {
+    defaults.set(kDisableReportingKey, suite->boolForKey(kDisableReportingKey));
+  } else {
+    defaults.set(kDisableReportingKey, 0);
+  }
+  return defaults.build();
+}
+
+void OstrelReportingServiceDelegate::defaultsChangedStep(int token) {
+  if (token != defaultsNotifyToken) return;
+  OSTREL_LOG_DEFAULT(logScope, "re-reading ostrel defaults");
+  const Dictionary defaults = OstrelReportingDefaults();
+  defaults_.set(defaults);
+  OSTREL_LOG_INFO(logScope, "defaults %@", defaults);
+  for (const auto& client : clients_) {
+    for (const auto& session : client->sessionsInOrder()) {
+      session->updateDefaults(defaults);
+    }
+  }
+  if (const auto disabled = defaults.find(kDisableReportingKey)) {
+    reportingEnabled_.store(disabled->number().value_or(0) == 0,
+                            std::memory_order_release);
+  }
+}
+
+std::shared_ptr<OstrelReportingServerInstance>
+OstrelReportingServerInstance::initWithMasterAndID(
+    std::shared_ptr<OstrelReportingServiceDelegate> master, ProcessID clientID,
+    std::optional<ErrorObject>* /*outError*/) {
+  OSTREL_LOG_DEFAULT(logScope, "%@, %lu", *master, clientID);
+  return std::make_shared<OstrelReportingServerInstance>(Passkey{}, std::move(master),
+                                                         clientID);
+}
+
+OstrelReportingServerInstance::OstrelReportingServerInstance(
+    Passkey, std::shared_ptr<OstrelReportingServiceDelegate> master, ProcessID clientID)
+    : master_(std::move(master)), clientID_(clientID) {}
+
+void OstrelReportingServerInstance::handleConnectionError() {
+  serverQueue()->async([self = shared_from_this()] {
+    assertOnServerQueue();
+    self->master_->removeClientStep(*self);
+  });
+}
+
+std::shared_ptr<OstrelReportingSession> OstrelReportingServerInstance::ownSession(
+    ReporterID reporterID) const {
+  const auto found = clientReportingSessionMap_.find(reporterID);
+  return found != clientReportingSessionMap_.end() ? found->second : nullptr;
+}
+
+std::vector<std::shared_ptr<OstrelReportingSession>>
+OstrelReportingServerInstance::sessionsInOrder() const {
+  std::vector<std::shared_ptr<OstrelReportingSession>> sessions;
+  sessions.reserve(clientReportingSessionMap_.size());
+  for (const auto& [reporterID, session] : clientReportingSessionMap_) {
+    sessions.push_back(session);
+  }
+  std::sort(sessions.begin(), sessions.end(), [](const auto& a, const auto& b) {
+    return a->reporterID() < b->reporterID();
+  });
+  return sessions;
+}
+
+void OstrelReportingServerInstance::createReportingSession(ReporterID reporterID,
+                                                           BoolReply reply) {
+  OSTREL_LOG_DEBUG(logScope, "creating session for reporter %lli", reporterID);
+  serverQueue()->async([self = shared_from_this(), reporterID, reply = std::move(reply)] {
+    assertOnServerQueue();
+    self->createStep(reporterID, reply);
+  });
+}
+
+void OstrelReportingServerInstance::createStep(ReporterID reporterID,
+                                               const BoolReply& reply) {
+  master_->platform_.kernelTrace->trace(TraceCode::kCreate);
+  clientReportingSessionMap_[reporterID] = OstrelReportingSession::initWithID(
+      reporterID, /*processIdentifiers=*/{clientID_}, master_->platform_);
+  master_->indexSession(reporterID, *this);
+  OSTREL_LOG_DEFAULT(logScope, "session created for reporter %lli", reporterID);
+  call(reply, true);
+}
+
+void OstrelReportingServerInstance::setServiceType(ServiceType serviceType,
+                                                   ReporterID reportingSession,
+                                                   BoolReply reply) {
+  OSTREL_LOG_DEBUG(logScope, "setting service type %i for reporter %lli", serviceType,
+                   reportingSession);
+  serverQueue()->async([self = shared_from_this(), serviceType, reportingSession,
+                        reply = std::move(reply)] {
+    assertOnServerQueue();
+    self->setServiceTypeStep(serviceType, reportingSession, reply);
+  });
+}
+
+// Kept: ID 0 gets no reply here, nor from start, stop and destroy.
+// [KeepsSilenceForReporterZeroOnStartStopDestroySetType]
+void OstrelReportingServerInstance::setServiceTypeStep(ServiceType serviceType,
+                                                       ReporterID reporterID,
+                                                       const BoolReply& reply) {
+  if (reporterID == kNoReporter) return;
+  if (const auto session = ownSession(reporterID)) {
+    session->setServiceType(serviceType);
+    OSTREL_LOG_DEFAULT(logScope, "service type %i set for reporter  %lli", serviceType,
+                       reporterID);
+  }
+  call(reply, true);
+}
+
+// Kept: some texts are misspelt, here and elsewhere. [KeepsMisspeltLogTexts]
+void OstrelReportingServerInstance::getServiceNameForReporterID(ReporterID reporterID,
+                                                                ServiceTypeReply reply) {
+  OSTREL_LOG_DEBUG(logScope, "fetching seviceType");
+  serverQueue()->async([self = shared_from_this(), reporterID, reply = std::move(reply)] {
+    assertOnServerQueue();
+    self->getServiceNameStep(reporterID, reply);
+  });
+}
+
+void OstrelReportingServerInstance::getServiceNameStep(ReporterID reporterID,
+                                                       const ServiceTypeReply& reply) {
+  // Kept: ID 0 is answered here and again below. [KeepsDoubleReplyForReporterZero]
+  if (reporterID == kNoReporter) call(reply, kServiceTypeUnknown);
+  const auto session = master_->findReportingSessionForID(reporterID);
+  const ServiceType serviceType = session ? session->serviceType() : kServiceTypeUnknown;
+  call(reply, serviceType);
+  OSTREL_LOG_DEFAULT(logScope, "returnning service type %i for reporter  %lli",
+                     serviceType, reporterID);
+}
+
+void OstrelReportingServerInstance::setConfiguration(
+    std::optional<Dictionary> configuration, ReporterID reporterID, BoolReply reply) {
+  OSTREL_LOG_DEBUG(logScope, "setting configuration");
+  serverQueue()->async([self = shared_from_this(),
+                        configuration = std::move(configuration), reporterID,
+                        reply = std::move(reply)] {
+    assertOnServerQueue();
+    self->setConfigurationStep(configuration, reporterID, reply);
+  });
+}
+
+void OstrelReportingServerInstance::setConfigurationStep(
+    const std::optional<Dictionary>& configuration, ReporterID reporterID,
+    const BoolReply& reply) {
+  if (const auto session = master_->findReportingSessionForID(reporterID)) {
+    session->setConfiguration(configuration);
+  }
+  call(reply, true);
+}
+
+void OstrelReportingServerInstance::startReportingSessionForID(ReporterID reporterID,
+                                                               BoolReply reply) {
+  OSTREL_LOG_DEBUG(logScope, "starting session for reporter %lli", reporterID);
+  serverQueue()->async(
+      [self = shared_from_this(), reporterID, reply = std::move(reply)]() mutable {
+        assertOnServerQueue();
+        self->startStep(reporterID, std::move(reply));
+      });
+}
+
+void OstrelReportingServerInstance::startStep(ReporterID reporterID, BoolReply reply) {
+  const OstrelReportingPlatform& platform = master_->platform_;
+  platform.kernelTrace->trace(TraceCode::kStart);
+  if (reporterID == kNoReporter) return;
+  const auto session = master_->findReportingSessionForID(reporterID);
+  if (!session) {
+    call(reply, false);
+    return;
+  }
+  // Kept: starting what is started is not answered.
+  // [KeepsSilenceOnStartOfAStartedSession]
+  if (session->started()) return;
+  session->start();
+  session->setDriverSnapShot(master_->driverUtility_->getSnapShot());
+  session->setTransactionCompleteBlock(std::move(reply));
+}
+
+void OstrelReportingServerInstance::sendMessage(Dictionary message,
+                                                MessageCategory category,
+                                                MessageType type,
+                                                std::optional<ReporterIDs> reportingIDs,
+                                                ErrorReply reply) {
+  OSTREL_LOG_DEBUG(logScope, "sending message for reporter %@", reportingIDs);
+  serverQueue()->async([self = shared_from_this(), message = std::move(message), category,
+                        type, reportingIDs = std::move(reportingIDs),
+                        reply = std::move(reply)] {
+    assertOnServerQueue();
+    self->sendMessageStep(message, category, type, reportingIDs, reply);
+  });
+}
+
+void OstrelReportingServerInstance::sendMessageStep(
+    const Dictionary& message, MessageCategory category, MessageType type,
+    const std::optional<ReporterIDs>& reportingIDs, const ErrorReply& reply) {
+  master_->platform_.kernelTrace->trace(TraceCode::kSend);
+  if (!master_->reportingEnabled()) {
+    call(reply, ErrorObject{std::string(kOstrelErrorDomain), /*code=*/1,
+                            "reporting is switched off"});
+    return;
+  }
+  if (!reportingIDs) {
+    sendToActiveSessions(message, category, type);
+  } else {
+    for (const ReporterID reporterID : *reportingIDs) {
+      if (reporterID == kNoReporter) continue;
+      if (const auto session = master_->findReportingSessionForID(reporterID)) {
+        session->sendMessage(message, category, type, /*reply=*/nullptr);
+      }
+    }
+  }
+  call(reply, std::optional<ErrorObject>());
+}
+
+void OstrelReportingServerInstance::sendToActiveSessions(const Dictionary& message,
+                                                         MessageCategory category,
+                                                         MessageType type) {
+  std::vector<std::shared_ptr<OstrelReportingSession>> active;
+  for (const auto& client : master_->clients()) {
+    const auto sessions = client->sessionsInOrder();
+    OSTREL_LOG_DEFAULT(logScope, "sessions for client %i : %@", client->clientID(),
+                       sessions);
+    std::copy_if(sessions.begin(), sessions.end(), std::back_inserter(active),
+                 [](const auto& session) { return session->started(); });
+  }
+  OSTREL_LOG_DEFAULT(logScope, "active reporting sessions %lu : %@", active.size(),
+                     active);
+  for (const auto& session : active) {
+    session->sendMessage(message, category, type, /*reply=*/nullptr);
+  }
+  if (!active.empty()) return;
+  OSTREL_LOG_DEFAULT(logScope,
+                     "no active reporting sessions found, sending as standalone");
+  OstrelReportingSession::sendSingleMessage(master_->platform_, message, category, type,
+                                            kServiceTypeStandalone, master_->defaults(),
+                                            /*reply=*/nullptr);
+}
+
+void OstrelReportingServerInstance::stopReportingSessionForID(ReporterID reporterID,
+                                                              BoolReply reply) {
+  OSTREL_LOG_DEBUG(logScope, "stopping session for reporter %lli", reporterID);
+  serverQueue()->async([self = shared_from_this(), reporterID, reply = std::move(reply)] {
+    assertOnServerQueue();
+    self->stopStep(reporterID, reply);
+  });
+}
+
+// The statistics are handed to the session before it is stopped, so that they
+// travel in the same session.
+void OstrelReportingServerInstance::stopStep(ReporterID reporterID,
+                                             const BoolReply& reply) {
+  master_->platform_.kernelTrace->trace(TraceCode::kStop);
+  if (reporterID == kNoReporter) return;
+  const auto session = master_->findReportingSessionForID(reporterID);
+  const auto statistics = master_->driverUtility_->getDriverStatisticsRelativeToSnapShot(
+      session ? session->driverSnapShot() : nullptr);
+  if (statistics) {
+    if (session) {
+      session->sendMessage(*statistics, kDriverStatisticsCategory, kDriverStatisticsType,
+                           /*reply=*/nullptr);
+    }
+    OSTREL_LOG_DEFAULT(logScope, "fetching driver logs %@", *statistics);
+  } else {
+    OSTREL_LOG_DEFAULT(logScope, "nothing interesting to fetch from the drivers");
+  }
+  if (session) {
+    session->setDriverSnapShot(nullptr);
+    session->stop();
+  }
+  OSTREL_LOG_DEFAULT(logScope, "stopping %lli", reporterID);
+  call(reply, true);
+}
+
+void OstrelReportingServerInstance::destroyReportingSession(ReporterID reporterID,
+                                                            BoolReply reply) {
+  OSTREL_LOG_DEBUG(logScope, "destroying session for reporter %lli", reporterID);
+  serverQueue()->async([self = shared_from_this(), reporterID, reply = std::move(reply)] {
+    assertOnServerQueue();
+    self->destroyStep(reporterID, reply);
+  });
+}
+
+void OstrelReportingServerInstance::destroyStep(ReporterID reporterID,
+                                                const BoolReply& reply) {
+  master_->platform_.kernelTrace->trace(TraceCode::kDestroy);
+  if (reporterID == kNoReporter) return;
+  if (const auto session = ownSession(reporterID)) {
+    if (session->started()) session->stop();
+    master_->forgetSession(reporterID, *this);
+    clientReportingSessionMap_.erase(reporterID);
+  }
+  OSTREL_LOG_DEFAULT(logScope, "destroying %lli", reporterID);
+  call(reply, true);
+}
+
+void OstrelReportingServerInstance::reporterIDValid(ReporterID reporterID,
+                                                    DictionaryReply reply) {
+  OSTREL_LOG_DEBUG(logScope, "validating reporter %lli", reporterID);
+  serverQueue()->async([self = shared_from_this(), reporterID, reply = std::move(reply)] {
+    assertOnServerQueue();
+    self->validateStep(reporterID, reply);
+  });
+}
+
+void OstrelReportingServerInstance::validateStep(ReporterID reporterID,
+                                                 const DictionaryReply& reply) {
+  DictionaryBuilder answer;
+  answer.set("reporterID", static_cast<std::int64_t>(kNoReporter));
+  answer.set("serviceType", static_cast<std::uint16_t>(kServiceTypeUnknown));
+  if (const auto session = master_->findReportingSessionForID(reporterID)) {
+    answer.set("reporterID", static_cast<std::int64_t>(reporterID));
+    answer.set("serviceType", static_cast<std::uint16_t>(session->serviceType()));
+  }
+  OSTREL_LOG_DEFAULT(logScope, "validating reporter %lli", reporterID);
+  call(reply, answer.build());
+}
+
+void OstrelReportingServerInstance::getAllReporters(ReporterIDsReply reply) {
+  serverQueue()->async([self = shared_from_this(), reply = std::move(reply)] {
+    assertOnServerQueue();
+    self->getAllReportersStep(reply);
+  });
+}
+
+void OstrelReportingServerInstance::getAllReportersStep(const ReporterIDsReply& reply) {
+  ReporterIDs reporters;
+  for (const auto& client : master_->clients()) {
+    for (const auto& session : client->sessionsInOrder()) {
+      reporters.push_back(session->reporterID());
+    }
+  }
+  call(reply, reporters);
+}
+
+void OstrelReportingServerInstance::killService(BoolReply /*reply*/) {
+  OSTREL_LOG_DEFAULT(logScope, "DESTROYING SERVICE");
+  master_->platform_.processInfo->endProcess(kKilledExitStatus);
+}
+
+}  // namespace ostrel
