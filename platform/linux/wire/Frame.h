@@ -2,6 +2,7 @@
 // CBOR item. `docs/protocol.md` is the reference.
 //
 //   request  = [operation, number, arguments...]   number 0: no reply wanted
+//                                                  (`OperationTable.h`)
 //   farewell = [0]                                 the client ends well
 //   reply    = [number, value] / [number, null, [domain, code, description]]
 //   closing  = [0, reason]                         the service ends the connection
@@ -39,6 +40,12 @@ enum class Operation : std::uint8_t {
 
 inline constexpr std::size_t kFrameHeaderSize = 4;
 
+/// The length that the `kFrameHeaderSize` bytes at `header` say.
+inline std::uint32_t frameLength(const std::uint8_t* header) {
+  return std::uint32_t{header[0]} | std::uint32_t{header[1]} << 8 |
+         std::uint32_t{header[2]} << 16 | std::uint32_t{header[3]} << 24;
+}
+
 /// Names a request among those of its connection; 0 asks for no reply.
 using RequestNumber = std::uint64_t;
 
@@ -56,18 +63,19 @@ struct Request {
 
 /// Decodes the item of one frame (without its length). Anything but exactly one
 /// well-formed request with arguments in range is an error.
-DecodeError decodeRequest(std::span<const std::uint8_t> item,
-                          const PayloadLimits& limits, std::size_t mostIDs,
+DecodeError decodeRequest(std::span<const std::uint8_t> item, const PayloadLimits& limits,
+                          std::size_t mostIDs,
                           const std::shared_ptr<PayloadAccount>& account,
                           Request& request);
 
-/// Each appends one whole frame, length included.
+/// Each appends one whole frame, length included. Texts must be UTF-8.
 void appendRequest(std::string& out, const Request& request);
 void appendFarewell(std::string& out);
 
-/// What a reply holds: null, boolean, service type, dictionary, IDs or error.
-using ReplyValue = std::variant<std::monostate, bool, ServiceType, Dictionary,
-                                ReporterIDs, ErrorObject>;
+/// What a reply holds: nothing (null), boolean, service type, dictionary, IDs or
+/// error.
+using ReplyValue =
+    std::variant<std::monostate, bool, ServiceType, Dictionary, ReporterIDs, ErrorObject>;
 
 void appendReply(std::string& out, RequestNumber number, const ReplyValue& value);
 void appendClosing(std::string& out, std::string_view reason);
@@ -80,18 +88,19 @@ struct Reply {
   std::string closingReason;
 };
 
-/// `operationOf` names the operation that a number was sent for, so that the
-/// value is read as that operation's; none for a number that was never sent.
+/// Decodes the item of one frame from the service. `operationOf` names the
+/// operation that a number was sent for, so that the value is read as that
+/// operation's; a reply to a number that was never sent (none) is an error.
 DecodeError decodeReply(
     std::span<const std::uint8_t> item, const PayloadLimits& limits,
     const std::function<std::optional<Operation>(RequestNumber)>& operationOf,
     Reply& reply);
 
-/// Finds whole frames in a stream of bytes. Keeps what is not whole yet.
+/// Finds whole frames in a stream of bytes, where they were read. Keeps what is
+/// not whole yet.
 class FrameReader {
  public:
-  explicit FrameReader(std::size_t mostFrameBytes)
-      : mostFrameBytes_(mostFrameBytes) {}
+  explicit FrameReader(std::size_t mostFrameBytes) : mostFrameBytes_(mostFrameBytes) {}
 
   /// Room for at least `size` more bytes, to be read into; `added` says how many
   /// came. Views from `next` end here.

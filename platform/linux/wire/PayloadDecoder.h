@@ -18,22 +18,39 @@ struct PayloadLimits {
   std::size_t keyBytes;  // Of one text key.
 };
 
+/// No `PayloadLimits` allow more nesting than this: a check keeps its place in
+/// each open array and dictionary on the stack.
+inline constexpr std::size_t kDeepestNesting = 64;
+
 /// Why bytes are not a value. A static sentence; none: they are.
 using DecodeError = std::optional<std::string_view>;
 
 /// Checks one item at the start of `bytes`; `size` becomes its length in bytes.
 /// `hasRepeatedKeys` becomes true when a dictionary in it holds a key twice.
-DecodeError checkItem(std::span<const std::uint8_t> bytes,
-                      const PayloadLimits& limits, std::size_t& size,
-                      bool& hasRepeatedKeys);
+/// Takes time in proportion to the bytes, and no memory while no dictionary has
+/// more than 16 entries; larger ones cost 8 bytes a key until the call returns,
+/// and a sort. On an error neither result means anything.
+DecodeError checkItem(std::span<const std::uint8_t> bytes, const PayloadLimits& limits,
+                      std::size_t& size, bool& hasRepeatedKeys);
+
+/// Whether `text` is well-formed UTF-8: no overlong form, no surrogate, nothing
+/// above U+10FFFF.
+bool isUTF8(std::span<const std::uint8_t> text);
 
 struct DecodedDictionary {
   std::optional<Dictionary> dictionary;
   DecodeError error;
+  std::size_t size = 0;  // Of the encoding that was decoded.
 };
 
-/// A payload from outside: checked, copied once, and of repeated keys the later
-/// one kept. The memory is charged to `account`, which may be none.
+/// A payload at the start of `bytes`: checked, copied once, and of entries with
+/// one key the last one kept. The memory is charged to `account`, which may be
+/// none. Bytes behind the payload are left alone.
+DecodedDictionary decodeLeadingDictionary(std::span<const std::uint8_t> bytes,
+                                          const PayloadLimits& limits,
+                                          std::shared_ptr<PayloadAccount> account);
+
+/// As `decodeLeadingDictionary`, of the whole of `bytes`.
 DecodedDictionary decodeDictionary(std::span<const std::uint8_t> bytes,
                                    const PayloadLimits& limits,
                                    std::shared_ptr<PayloadAccount> account);

@@ -1,0 +1,578 @@
+// One pass over the bytes, without recursion: the open arrays and dictionaries
+// are a small stack of places. Every count is compared with the bytes that are
+// left and with the limits before anything is done with it.
+//
+// Repeated keys. A small dictionary keeps a mask of 64 bits, one set by the hash
+// of each key; only a key that meets a set bit is compared with the earlier
+// ones, first by hash, then byte by byte. A large one notes hash and place of
+// each key and sorts them when it ends. That hash begins with a number that the
+// sender cannot know, so that it cannot make the keys collide.
+#include "platform/linux/wire/PayloadDecoder.h"
+
+#include <algorithm>
+#include <bit>
+#include <string>
+#include <vector>
+
+#include "platform/linux/wire/Head.h"
+
+namespace ostrel::wire {
+namespace {
+
+constexpr std::size_t kSmallDictionary = 16;
+constexpr std::uint64_t kHighBits = 0x8080808080808080;
+constexpr std::uint64_t kDateTag = 1;
+
+using Byte = std::uint8_t;
+using Bytes = std::span<const Byte>;
+
+constexpr std::string_view kTooDeep = "the payload is nested too deeply";
+constexpr std::string_view kTooManyValues = "the payload has too many values";
+constexpr std::string_view kKeyTooLong = "a key is too long";
+constexpr std::string_view kWrongKey = "a key is neither text nor an integer";
+constexpr std::string_view kIntegerTooLow = "an integer is below -9223372036854775808";
+constexpr std::string_view kWrongText = "a text is not UTF-8";
+constexpr std::string_view kByteStringFound = "a byte string is not allowed";
+constexpr std::string_view kWrongTag = "a tag other than 1 is not allowed";
+constexpr std::string_view kWrongDate = "a date is not a finite number";
+constexpr std::string_view kWrongSimple = "a simple value is neither true nor false";
+constexpr std::string_view kNotADictionary = "the payload is not a dictionary";
+constexpr std::string_view kTrailingBytes = "bytes follow the payload";
+
+std::uint64_t loadWord(const Byte* at) {
+  std::uint64_t word;
+  std::memcpy(&word, at, sizeof word);
+  return word;
+}
+
+// The words that a short hash of a text is made of, and whether any byte is
+// outside ASCII.
+struct TextGlance {
+  std::uint64_t first;
+  std::uint64_t last;
+  bool isASCII;
+};
+
+// `size` bytes at `at`, `end` the end of all bytes.
+[[gnu::always_inline]] inline TextGlance glance(const Byte* at, std::size_t size,
+                                                const Byte* end) {
+  if (size >= sizeof(std::uint64_t)) {
+    const std::uint64_t first = loadWord(at);
+    const std::uint64_t last = loadWord(at + size - sizeof last);
+    std::uint64_t high = first | last;
+    for (std::size_t i = sizeof first; i + sizeof last < size; i += sizeof first) {
+      high |= loadWord(at + i);
+    }
+    return {first, last, (high & kHighBits) == 0};
+  }
+  std::uint64_t word = 0;
+  if (static_cast<std::size_t>(end - at) >= sizeof word) [[likely]] {
+    const std::uint64_t mask = (std::uint64_t{1} << (8 * size)) - 1;
+    if constexpr (std::endian::native == std::endian::little) {
+      word = loadWord(at) & mask;
+    } else {
+      word = __builtin_bswap64(loadWord(at)) & mask;
+    }
+  } else {
+    for (std::size_t i = 0; i < size; ++i) word |= std::uint64_t{at[i]} << (8 * i);
+  }
+  return {word, 0, (word & kHighBits) == 0};
+}
+
+[[gnu::always_inline]] inline std::uint32_t mix(std::uint64_t a, std::uint64_t b) {
+  return static_cast<std::uint32_t>(((a ^ std::rotl(b, 29)) * 0x9E3779B97F4A7C15) >> 32);
+}
+
+// A number that differs from process to process.
+std::uint64_t hashSeed() {
+  static const std::uint64_t seed = [] {
+    const auto place = reinterpret_cast<std::uintptr_t>(&kSmallDictionary);
+    const int onStack = 0;
+    const auto stack = reinterpret_cast<std::uintptr_t>(&onStack);
+    return (place * 0xD6E8FEB86659FD93) ^ (stack * 0xA0761D6478BD642F);
+  }();
+  return seed;
+}
+
+std::uint64_t fold(std::uint64_t a, std::uint64_t b) {
+  a *= b | 1;
+  return a ^ std::rotl(a, 32) ^ (b >> 7);
+}
+
+// Reads a key that was checked, and moves `at` behind it.
+struct Key {
+  std::uint8_t majorType;
+  std::uint64_t argument;  // The number, or the size of the text.
+  const Byte* text;
+};
+
+Key readKey(const Byte*& at, const Byte* end) {
+  Head head{};
+  readHead(at, end, head);
+  const Byte* text = at;
+  if (head.majorType == kTextString) at += head.argument;
+  return {head.majorType, head.argument, text};
+}
+
+Key keyAt(const Byte* at, const Byte* end) { return readKey(at, end); }
+
+// Any order in which equal keys, and no others, are equal.
+int compare(const Key& a, const Key& b) {
+  if (a.majorType != b.majorType) return a.majorType < b.majorType ? -1 : 1;
+  if (a.argument != b.argument) return a.argument < b.argument ? -1 : 1;
+  if (a.majorType != kTextString) return 0;
+  return std::memcmp(a.text, b.text, a.argument);
+}
+
+std::uint32_t seededHash(const Key& key) {
+  std::uint64_t hash = fold(hashSeed() + key.majorType, key.argument);
+  if (key.majorType == kTextString) {
+    std::size_t i = 0;
+    for (; i + sizeof hash <= key.argument; i += sizeof hash) {
+      hash = fold(hash ^ loadWord(key.text + i), hashSeed() + i);
+    }
+    std::uint64_t rest = 0;
+    for (; i < key.argument; ++i) rest = rest << 8 | key.text[i];
+    hash = fold(hash ^ rest, hashSeed());
+  }
+  return static_cast<std::uint32_t>(hash >> 32);
+}
+
+// A key of a large dictionary.
+struct KeyNote {
+  std::uint32_t hash;
+  std::uint32_t offset;
+};
+
+class ItemCheck {
+ public:
+  ItemCheck(Bytes bytes, const PayloadLimits& limits)
+      : begin_(bytes.data()),
+        end_(begin_ + bytes.size()),
+        keyBytes_(limits.keyBytes),
+        nesting_(std::min(limits.nesting, kDeepestNesting)),
+        nodesLeft_(limits.nodes) {}
+
+  DecodeError run(std::size_t& size, bool& hasRepeatedKeys);
+
+ private:
+  struct Level {
+    std::size_t left;  // Elements or entries to come.
+    bool isMap;
+    bool isLarge;
+    std::uint8_t keys;      // In the two tables below.
+    std::uint64_t keyBits;  // Of a small dictionary.
+    std::size_t firstNote;  // Of a large dictionary, in `notes_`.
+    std::uint32_t hashes[kSmallDictionary];
+    std::uint32_t offsets[kSmallDictionary];
+  };
+
+  // Each moves `at` on and returns null, or why it cannot.
+  const char* checkValue(const Byte*& at, std::size_t& depth);
+  const char* checkKey(const Byte*& at, Level& level);
+  const char* open(const Byte*& at, const Head& head, std::size_t& depth);
+  const char* checkDate(const Byte*& at) const;
+  void close(Level& level);
+
+  void noteSmallKey(Level& level, std::uint32_t hash, const Byte* key);
+  void noteLargeKey(const Byte* key);
+
+  const Byte* const begin_;
+  const Byte* const end_;
+  const std::size_t keyBytes_;
+  const std::size_t nesting_;
+  std::size_t nodesLeft_;
+  bool hasRepeatedKeys_ = false;
+  std::vector<KeyNote> notes_;  // Of the large dictionaries that are open.
+  Level levels_[kDeepestNesting];
+};
+
+[[gnu::always_inline]] inline const char* ItemCheck::checkValue(const Byte*& at,
+                                                                std::size_t& depth) {
+  Head head;
+  if (const char* error = readHead(at, end_, head)) return error;
+  switch (head.majorType) {
+    case kUnsignedInteger:
+      return nullptr;
+    case kNegativeInteger:
+      return head.argument >> 63 ? kIntegerTooLow.data() : nullptr;
+    case kTextString: {
+      const std::size_t size = head.argument;
+      if (size > static_cast<std::size_t>(end_ - at)) return kTruncated.data();
+      if (!glance(at, size, end_).isASCII && !isUTF8({at, size})) {
+        return kWrongText.data();
+      }
+      at += size;
+      return nullptr;
+    }
+    case kArrayItem:
+    case kMapItem:
+      return open(at, head, depth);
+    case kTagItem:
+      return head.argument == kDateTag ? checkDate(at) : kWrongTag.data();
+    case kSimpleItem:
+      if (head.additional >= kHalfFloat) return nullptr;
+      if (head.additional == (kTrueItem & 0x1F)) return nullptr;
+      if (head.additional == (kFalseItem & 0x1F)) return nullptr;
+      return kWrongSimple.data();
+    default:
+      return kByteStringFound.data();
+  }
+}
+
+[[gnu::always_inline]] inline const char* ItemCheck::checkKey(const Byte*& at,
+                                                              Level& level) {
+  const Byte* const key = at;
+  Head head;
+  if (const char* error = readHead(at, end_, head)) return error;
+  std::uint32_t hash;
+  if (head.majorType == kTextString) [[likely]] {
+    const std::size_t size = head.argument;
+    if (size > keyBytes_) return kKeyTooLong.data();
+    if (size > static_cast<std::size_t>(end_ - at)) return kTruncated.data();
+    const TextGlance seen = glance(at, size, end_);
+    if (!seen.isASCII && !isUTF8({at, size})) return kWrongText.data();
+    at += size;
+    hash = mix(seen.first + size, seen.last);
+  } else if (head.majorType == kUnsignedInteger || head.majorType == kNegativeInteger) {
+    if (head.majorType == kNegativeInteger && head.argument >> 63) {
+      return kIntegerTooLow.data();
+    }
+    hash = mix(head.argument, head.majorType);
+  } else {
+    return kWrongKey.data();
+  }
+  if (level.isLarge) [[unlikely]] {
+    noteLargeKey(key);
+  } else {
+    noteSmallKey(level, hash, key);
+  }
+  return nullptr;
+}
+
+[[gnu::always_inline]] inline void ItemCheck::noteSmallKey(Level& level,
+                                                           std::uint32_t hash,
+                                                           const Byte* key) {
+  const std::uint64_t bit = std::uint64_t{1} << (hash >> 26);
+  if (level.keyBits & bit) {
+    for (std::size_t i = 0; i < level.keys; ++i) {
+      if (level.hashes[i] != hash) continue;
+      const Byte* const other = begin_ + level.offsets[i];
+      if (compare(keyAt(other, end_), keyAt(key, end_)) == 0) hasRepeatedKeys_ = true;
+    }
+  }
+  level.keyBits |= bit;
+  level.hashes[level.keys] = hash;
+  level.offsets[level.keys] = static_cast<std::uint32_t>(key - begin_);
+  ++level.keys;
+}
+
+[[gnu::noinline]] void ItemCheck::noteLargeKey(const Byte* key) {
+  notes_.push_back(
+      {seededHash(keyAt(key, end_)), static_cast<std::uint32_t>(key - begin_)});
+}
+
+const char* ItemCheck::open(const Byte*& at, const Head& head, std::size_t& depth) {
+  const bool isMap = head.majorType == kMapItem;
+  if (depth == nesting_) return kTooDeep.data();
+  // Each element takes a byte at least, each entry two.
+  const auto bytesLeft = static_cast<std::size_t>(end_ - at);
+  if (head.argument > (isMap ? bytesLeft / 2 : bytesLeft)) return kTruncated.data();
+  const std::size_t values = isMap ? 2 * head.argument : head.argument;
+  if (values > nodesLeft_) return kTooManyValues.data();
+  nodesLeft_ -= values;
+  if (values == 0) return nullptr;
+  Level& level = levels_[depth++];
+  level.left = head.argument;
+  level.isMap = isMap;
+  level.isLarge = isMap && level.left > kSmallDictionary;
+  level.keys = 0;
+  level.keyBits = 0;
+  level.firstNote = notes_.size();
+  return nullptr;
+}
+
+[[gnu::noinline]] const char* ItemCheck::checkDate(const Byte*& at) const {
+  Head head;
+  if (const char* error = readHead(at, end_, head)) return error;
+  switch (head.majorType) {
+    case kUnsignedInteger:
+      return nullptr;
+    case kNegativeInteger:
+      return head.argument >> 63 ? kIntegerTooLow.data() : nullptr;
+    case kSimpleItem: {
+      // Not finite: all bits of the exponent are set.
+      std::uint64_t exponent = 1;
+      if (head.additional == kTwoBytesFollow) exponent = ~head.argument & 0x7C00;
+      if (head.additional == kFourBytesFollow) exponent = ~head.argument & 0x7F800000;
+      if (head.additional == kEightBytesFollow) {
+        exponent = ~head.argument & 0x7FF0000000000000;
+      }
+      const bool isFloat = head.additional >= kHalfFloat;
+      return isFloat && exponent != 0 ? nullptr : kWrongDate.data();
+    }
+    default:
+      return kWrongDate.data();
+  }
+}
+
+[[gnu::noinline]] void ItemCheck::close(Level& level) {
+  const auto first = notes_.begin() + static_cast<std::ptrdiff_t>(level.firstNote);
+  const auto less = [this](const KeyNote& a, const KeyNote& b) {
+    if (a.hash != b.hash) return a.hash < b.hash;
+    return compare(keyAt(begin_ + a.offset, end_), keyAt(begin_ + b.offset, end_)) < 0;
+  };
+  const auto equal = [this](const KeyNote& a, const KeyNote& b) {
+    return a.hash == b.hash &&
+           compare(keyAt(begin_ + a.offset, end_), keyAt(begin_ + b.offset, end_)) == 0;
+  };
+  if (!hasRepeatedKeys_) {
+    std::sort(first, notes_.end(), less);
+    hasRepeatedKeys_ = std::adjacent_find(first, notes_.end(), equal) != notes_.end();
+  }
+  notes_.erase(first, notes_.end());
+}
+
+DecodeError ItemCheck::run(std::size_t& size, bool& hasRepeatedKeys) {
+  if (begin_ == end_) return kTruncated;
+  if (nodesLeft_ == 0) return kTooManyValues;
+  --nodesLeft_;
+  const Byte* at = begin_;
+  std::size_t depth = 0;
+  const char* error = checkValue(at, depth);
+  while (error == nullptr && depth != 0) {
+    Level& level = levels_[depth - 1];
+    if (level.left == 0) {
+      if (level.isLarge) close(level);
+      --depth;
+      continue;
+    }
+    --level.left;
+    if (level.isMap) {
+      error = checkKey(at, level);
+      if (error != nullptr) break;
+    }
+    error = checkValue(at, depth);
+  }
+  if (error != nullptr) return error;
+  size = static_cast<std::size_t>(at - begin_);
+  hasRepeatedKeys = hasRepeatedKeys_;
+  return std::nullopt;
+}
+
+// Writes a checked item again without the entries that a later one of the same
+// key replaces.
+class RepeatedKeyRemover {
+ public:
+  explicit RepeatedKeyRemover(Bytes item)
+      : begin_(item.data()), end_(begin_ + item.size()) {}
+
+  std::string run() {
+    findEntries();
+    markReplaced();
+    return write();
+  }
+
+ private:
+  struct Map {
+    std::uint32_t offset;   // Of its head.
+    std::uint32_t entries;  // That stay.
+    bool isChanged;
+  };
+  struct Entry {
+    std::uint32_t map;  // In `maps_`.
+    std::uint32_t hash;
+    std::uint32_t begin;
+    std::uint32_t end = 0;
+    bool isReplaced = false;
+  };
+  struct Level {
+    std::size_t left;
+    bool isMap;
+    std::uint32_t map;
+    std::size_t entry;  // The one that is being read, in `entries_`.
+  };
+
+  std::uint32_t offset(const Byte* at) const {
+    return static_cast<std::uint32_t>(at - begin_);
+  }
+
+  void findEntries() {
+    std::vector<Level> open;
+    const Byte* at = begin_;
+    do {
+      // A value begins here, or, within a dictionary, an entry.
+      if (!open.empty() && open.back().isMap) {
+        Level& level = open.back();
+        level.entry = entries_.size();
+        const std::uint32_t begin = offset(at);
+        entries_.push_back({level.map, seededHash(readKey(at, end_)), begin});
+      }
+      passValue(at, open);
+      while (!open.empty() && open.back().left == 0) {
+        open.pop_back();
+        endEntry(at, open);
+      }
+      if (!open.empty()) --open.back().left;
+    } while (!open.empty());
+  }
+
+  void passValue(const Byte*& at, std::vector<Level>& open) {
+    const std::uint32_t begin = offset(at);
+    Head head{};
+    readHead(at, end_, head);
+    if (head.majorType == kTagItem) readHead(at, end_, head);
+    if (head.majorType == kArrayItem || head.majorType == kMapItem) {
+      const bool isMap = head.majorType == kMapItem;
+      open.push_back({head.argument, isMap, static_cast<std::uint32_t>(maps_.size()), 0});
+      if (isMap) {
+        maps_.push_back({begin, static_cast<std::uint32_t>(head.argument), false});
+      }
+      return;
+    }
+    if (head.majorType == kTextString) at += head.argument;
+    endEntry(at, open);
+  }
+
+  void endEntry(const Byte* at, const std::vector<Level>& open) {
+    if (!open.empty() && open.back().isMap) {
+      entries_[open.back().entry].end = offset(at);
+    }
+  }
+
+  void markReplaced() {
+    std::vector<std::uint32_t> order(entries_.size());
+    for (std::uint32_t i = 0; i < order.size(); ++i) order[i] = i;
+    const auto difference = [this](std::uint32_t a, std::uint32_t b) {
+      const Entry& x = entries_[a];
+      const Entry& y = entries_[b];
+      if (x.map != y.map) return x.map < y.map ? -1 : 1;
+      if (x.hash != y.hash) return x.hash < y.hash ? -1 : 1;
+      return compare(keyAt(begin_ + x.begin, end_), keyAt(begin_ + y.begin, end_));
+    };
+    std::sort(order.begin(), order.end(), [&](std::uint32_t a, std::uint32_t b) {
+      const int sign = difference(a, b);
+      return sign != 0 ? sign < 0 : a < b;
+    });
+    for (std::size_t i = 1; i < order.size(); ++i) {
+      if (difference(order[i - 1], order[i]) != 0) continue;
+      Entry& earlier = entries_[order[i - 1]];
+      earlier.isReplaced = true;
+      --maps_[earlier.map].entries;
+      maps_[earlier.map].isChanged = true;
+    }
+  }
+
+  // Entries and maps both stand in the order of their first bytes.
+  std::string write() const {
+    std::string out;
+    out.reserve(static_cast<std::size_t>(end_ - begin_));
+    const Byte* at = begin_;
+    const auto copyUntil = [&](const Byte* until) {
+      out.append(reinterpret_cast<const char*>(at), static_cast<std::size_t>(until - at));
+      at = until;
+    };
+    auto entry = entries_.begin();
+    for (const Map& map : maps_) {
+      const Byte* const head = begin_ + map.offset;
+      for (; entry != entries_.end() && begin_ + entry->begin < head; ++entry) {
+        skipIfReplaced(*entry, at, copyUntil);
+      }
+      if (!map.isChanged || head < at) continue;
+      copyUntil(head);
+      Head old{};
+      readHead(at, end_, old);
+      ValueEncoder(out).beginDictionary(map.entries);
+    }
+    for (; entry != entries_.end(); ++entry) skipIfReplaced(*entry, at, copyUntil);
+    copyUntil(end_);
+    return out;
+  }
+
+  template <typename CopyUntil>
+  void skipIfReplaced(const Entry& entry, const Byte*& at,
+                      const CopyUntil& copyUntil) const {
+    if (!entry.isReplaced || begin_ + entry.begin < at) return;
+    copyUntil(begin_ + entry.begin);
+    at = begin_ + entry.end;
+  }
+
+  const Byte* const begin_;
+  const Byte* const end_;
+  std::vector<Map> maps_;
+  std::vector<Entry> entries_;
+};
+
+}  // namespace
+
+bool isUTF8(std::span<const std::uint8_t> text) {
+  const auto isContinuation = [](Byte byte) { return (byte & 0xC0) == 0x80; };
+  const Byte* at = text.data();
+  const Byte* const end = at + text.size();
+  while (at != end) {
+    const Byte first = *at;
+    const auto left = end - at;
+    if (first < 0x80) {
+      ++at;
+    } else if (first < 0xC2) {
+      return false;
+    } else if (first < 0xE0) {
+      if (left < 2 || !isContinuation(at[1])) return false;
+      at += 2;
+    } else if (first < 0xF0) {
+      if (left < 3 || !isContinuation(at[1]) || !isContinuation(at[2])) return false;
+      if (first == 0xE0 && at[1] < 0xA0) return false;   // Overlong.
+      if (first == 0xED && at[1] >= 0xA0) return false;  // A surrogate.
+      at += 3;
+    } else {
+      if (first > 0xF4 || left < 4 || !isContinuation(at[1]) || !isContinuation(at[2]) ||
+          !isContinuation(at[3])) {
+        return false;
+      }
+      if (first == 0xF0 && at[1] < 0x90) return false;   // Overlong.
+      if (first == 0xF4 && at[1] >= 0x90) return false;  // Above U+10FFFF.
+      at += 4;
+    }
+  }
+  return true;
+}
+
+DecodeError checkItem(std::span<const std::uint8_t> bytes, const PayloadLimits& limits,
+                      std::size_t& size, bool& hasRepeatedKeys) {
+  ItemCheck check(bytes, limits);
+  return check.run(size, hasRepeatedKeys);
+}
+
+DecodedDictionary decodeLeadingDictionary(std::span<const std::uint8_t> bytes,
+                                          const PayloadLimits& limits,
+                                          std::shared_ptr<PayloadAccount> account) {
+  if (bytes.empty()) return {std::nullopt, kTruncated};
+  if (bytes[0] >> 5 != kMapItem) return {std::nullopt, kNotADictionary};
+  std::size_t size = 0;
+  bool hasRepeatedKeys = false;
+  if (auto error = checkItem(bytes, limits, size, hasRepeatedKeys)) {
+    return {std::nullopt, error};
+  }
+  ValueBuffer buffer;
+  if (hasRepeatedKeys) {
+    const std::string rewritten = RepeatedKeyRemover(bytes.first(size)).run();
+    const auto* first = reinterpret_cast<const Byte*>(rewritten.data());
+    buffer = ValueBuffer::copyOf({first, rewritten.size()}, std::move(account));
+  } else {
+    buffer = ValueBuffer::copyOf(bytes.first(size), std::move(account));
+  }
+  const Byte* item = std::as_const(buffer).data();
+  return {Dictionary(std::move(buffer), item), std::nullopt, size};
+}
+
+DecodedDictionary decodeDictionary(std::span<const std::uint8_t> bytes,
+                                   const PayloadLimits& limits,
+                                   std::shared_ptr<PayloadAccount> account) {
+  DecodedDictionary decoded = decodeLeadingDictionary(bytes, limits, std::move(account));
+  if (!decoded.error && decoded.size != bytes.size()) {
+    return {std::nullopt, kTrailingBytes};
+  }
+  return decoded;
+}
+
+}  // namespace ostrel::wire
