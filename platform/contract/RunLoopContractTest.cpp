@@ -156,20 +156,46 @@ TYPED_TEST(RunLoopContract, CountsTheDelayFromTheMaking) {
             (std::vector<std::string>{"overdue", "later", "end"}));
 }
 
-TYPED_TEST(RunLoopContract, MovesTheDateOfATimerThatWaits) {
+TYPED_TEST(RunLoopContract, MovesTheDatesOfTimersThatWait) {
   const auto sooner = this->timer(std::chrono::hours(1), "sooner");
-  const auto later = this->timer(milliseconds(40), "later");
+  const auto later = this->timer(milliseconds(1), "later");
+  const auto mover = this->time.runLoops->makeTimer(milliseconds(0), [=] {
+    later->setFireDate(milliseconds(60));
+    sooner->setFireDate(milliseconds(30));
+  });
+
   this->start([=](RunLoop& loop) {
-    loop.add(sooner);
-    loop.add(later);
+    for (const auto& timer : {sooner, later, mover}) loop.add(timer);
+    loop.run();
+  });
+
+  EXPECT_EQ(this->eventsAtTheEnd(), (std::vector<std::string>{"sooner", "later", "end"}));
+}
+
+TYPED_TEST(RunLoopContract, WakesForATimerThatAnotherThreadMadeDue) {
+  const auto timer = this->timer(std::chrono::hours(1), "fired");
+  this->start([=](RunLoop& loop) {
+    loop.add(timer);
     loop.run();
   });
   this->time.pass(milliseconds(5));
 
-  later->setFireDate(milliseconds(120));
-  sooner->setFireDate(milliseconds(60));
+  timer->setFireDate(milliseconds(0));
 
-  EXPECT_EQ(this->eventsAtTheEnd(), (std::vector<std::string>{"sooner", "later", "end"}));
+  EXPECT_EQ(this->eventsAtTheEnd(), (std::vector<std::string>{"fired", "end"}));
+}
+
+TYPED_TEST(RunLoopContract, WakesForATimerThatAnotherThreadInvalidated) {
+  const auto timer = this->timer(std::chrono::hours(1), "fired");
+  this->start([=](RunLoop& loop) {
+    loop.add(timer);
+    loop.run();
+  });
+  this->time.pass(milliseconds(5));
+
+  timer->invalidate();
+
+  EXPECT_EQ(this->eventsAtTheEnd(), (std::vector<std::string>{"end"}));
 }
 
 TYPED_TEST(RunLoopContract, MovesTheDateOfATimerThatWasNotAddedYet) {

@@ -9,8 +9,6 @@ namespace ostrel {
 ManualCondition::ManualCondition(std::shared_ptr<ManualClock> clock)
     : clock_(std::move(clock)) {}
 
-ManualCondition::~ManualCondition() { clock_->cancel(timer_); }
-
 void ManualCondition::lock() OSTREL_NO_THREAD_SAFETY_ANALYSIS {
   checkFakeUse(!isHeld(), "a condition's lock is not taken twice");
   lock_.lock();
@@ -30,10 +28,11 @@ void ManualCondition::unlock() OSTREL_NO_THREAD_SAFETY_ANALYSIS {
 void ManualCondition::wait(std::chrono::nanoseconds timeout, Waiter waiter) {
   checkFakeUse(isHeld(), "waiting needs the condition's lock");
   checkFakeUse(!hasWaiter(), "a condition has one waiter at a time");
+  // The timer keeps the condition: a waiter is called even when nobody else
+  // holds it any more.
   const auto timer =
-      clock_->scheduleAt(clock_->monotonicNow() + timeout, [weak = weak_from_this()] {
-        if (const auto self = weak.lock()) self->wake(Wake::kTimedOut);
-      });
+      clock_->scheduleAt(clock_->monotonicNow() + timeout,
+                         [self = shared_from_this()] { self->wake(Wake::kTimedOut); });
   const std::lock_guard guard(mutex_);
   waiter_ = std::move(waiter);
   timer_ = timer;

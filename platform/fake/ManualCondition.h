@@ -17,7 +17,6 @@ class ManualCondition final : public Condition,
                               public std::enable_shared_from_this<ManualCondition> {
  public:
   explicit ManualCondition(std::shared_ptr<ManualClock> clock);
-  ~ManualCondition() override;
 
   void lock() OSTREL_ACQUIRE() override;
   void unlock() OSTREL_RELEASE() override;

@@ -1,0 +1,57 @@
+#pragma once
+
+#include <array>
+#include <chrono>
+#include <cstddef>
+#include <memory>
+
+#include "platform/WorkQueue.h"
+#include "platform/linux/TimerThread.h"
+
+namespace ostrel {
+
+/// Serial queues over a few shared threads: one pool for each quality of
+/// service, its threads made when they are first needed and as nice as the
+/// class asks. Threads take no signals.
+///
+/// A burst of steps for one queue costs one wake-up. When nothing is queued,
+/// nothing wakes up. A step must not throw.
+class ThreadPoolWorkQueues final : public WorkQueueFactory {
+ public:
+  static constexpr std::size_t kMostInteractiveThreads = 2;
+  static constexpr std::size_t kMostUtilityThreads = 2;
+  static constexpr std::size_t kMostBackgroundThreads = 4;
+
+  explicit ThreadPoolWorkQueues(std::shared_ptr<TimerThread> timers);
+  /// Waits up to 2 s for what is queued, then ends the threads; a step that runs
+  /// is waited for. Steps queued later are dropped. May run inside a step, and
+  /// does not wait then.
+  ~ThreadPoolWorkQueues() override;
+  ThreadPoolWorkQueues(const ThreadPoolWorkQueues&) = delete;
+  ThreadPoolWorkQueues& operator=(const ThreadPoolWorkQueues&) = delete;
+
+  std::shared_ptr<WorkQueue> makeSerialQueue(std::string_view label,
+                                             QualityOfService qualityOfService,
+                                             int relativePriority) override;
+  ConcurrentQueue& backgroundQueue() override;
+
+  /// Waits until every queue has run all of its steps; true when that came
+  /// before `deadline`. Steps that wait for their delay, and those of suspended
+  /// queues, do not count. Called on none of the queues.
+  bool drain(std::chrono::steady_clock::time_point deadline);
+
+  /// How many threads the pools have now.
+  std::size_t threadCount() const;
+
+ private:
+  struct Shared;
+  class Background;
+  class Pool;
+  class Strand;
+
+  const std::shared_ptr<Shared> shared_;
+  const std::array<std::shared_ptr<Pool>, 3> pools_;  // By quality of service.
+  const std::unique_ptr<Background> background_;
+};
+
+}  // namespace ostrel
