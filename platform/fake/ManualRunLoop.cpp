@@ -143,7 +143,13 @@ class ManualRunLoopFactory::Timer final : public RunLoopTimer {
     if (const std::shared_ptr<Loop> loop = loop_.lock()) loop->wakeAt(due_);
   }
 
-  void invalidate() override { action_ = {}; }
+  void invalidate() override {
+    if (!isValid()) return;
+    action_ = {};
+    if (const std::shared_ptr<Loop> loop = loop_.lock()) {
+      loop->wakeAt(clock_->monotonicNow());
+    }
+  }
 
   void fire() { std::exchange(action_, {})(); }
 
