@@ -1,0 +1,320 @@
+#include "platform/linux/store/Store.h"
+
+#include <pthread.h>
+#include <signal.h>
+
+#include <algorithm>
+#include <new>
+
+#include "platform/Logging.h"
+
+namespace ostrel {
+namespace {
+
+// Operations that make it worth writing before the commit is due.
+constexpr std::size_t kWriteAhead = 512;
+
+// Payload bytes that make it worth committing early: clients are held back while
+// about four times as much of theirs is not durable.
+constexpr std::size_t kCommitBytes = 1024 * 1024;
+
+// Operations kept through a fault.
+constexpr std::size_t kKeptThroughFault = 16384;
+
+constexpr int kNotUsable = 1;
+constexpr int kQueueIsFull = 2;
+constexpr int kStopped = 3;
+
+ErrorObject makeError(int code, std::string_view description) {
+  return {std::string(kOstrelErrorDomain), code, std::string(description)};
+}
+
+std::int64_t systemMicroseconds() {
+  return std::chrono::duration_cast<std::chrono::microseconds>(
+             std::chrono::system_clock::now().time_since_epoch())
+      .count();
+}
+
+StoreOptions complete(StoreOptions options) {
+  if (!options.now) options.now = systemMicroseconds;
+  return options;
+}
+
+}  // namespace
+
+std::shared_ptr<Store> Store::open(std::string path) {
+  return open(std::move(path), StoreOptions());
+}
+
+std::shared_ptr<Store> Store::open(std::string path, StoreOptions options) {
+  return std::shared_ptr<Store>(new Store(std::move(path), complete(std::move(options))));
+}
+
+Store::Store(std::string path, StoreOptions options)
+    : options_(std::move(options)),
+      writer_(std::move(path), options_.vfs, options_.now, counters_),
+      retryPause_(options_.firstRetry) {
+  // Signals are for the main thread.
+  sigset_t all;
+  sigset_t before;
+  ::sigfillset(&all);
+  ::pthread_sigmask(SIG_SETMASK, &all, &before);
+  thread_ = std::thread([this] { runWriter(); });
+  ::pthread_sigmask(SIG_SETMASK, &before, /*oldmask=*/nullptr);
+}
+
+Store::~Store() {
+  shutdown(Clock::time_point::max());
+  if (thread_.joinable()) thread_.join();
+}
+
+bool Store::shutdown(Clock::time_point deadline) {
+  std::unique_lock lock(mutex_);
+  isStopping_ = true;
+  state_ = State::kStopped;
+  faultError_ = makeError(kStopped, "the store is closed");
+  wakeWriter();
+  const auto hasEnded = [this] { return hasEnded_; };
+  if (deadline == Clock::time_point::max()) {
+    writerEnded_.wait(lock, hasEnded);
+  } else if (!writerEnded_.wait_until(lock, deadline, hasEnded)) {
+    OSTREL_LOG_ERROR(processLogScope, "the store was not written in time");
+    return false;
+  }
+  return true;
+}
+
+std::optional<ErrorObject> Store::addMessage(StoreSession* session,
+                                             std::uint16_t category, std::uint16_t type,
+                                             const Dictionary& payload) {
+  if (auto refused = refusal()) return refused;
+  const std::int64_t now = options_.now();
+  if (push({now, SessionMessage{session, category, type, payload}})) {
+    return std::nullopt;
+  }
+  counters_.refused.fetch_add(1, std::memory_order_relaxed);
+  return makeError(kQueueIsFull, "too much waits to be stored");
+}
+
+std::optional<ErrorObject> Store::addLoneMessage(LoneMessage message) {
+  if (auto refused = refusal()) return refused;
+  if (push({options_.now(), std::move(message)})) return std::nullopt;
+  counters_.refused.fetch_add(1, std::memory_order_relaxed);
+  return makeError(kQueueIsFull, "too much waits to be stored");
+}
+
+StoreSession* Store::beginSession(const Dictionary& sessionInfo,
+                                  const Dictionary& userInfo) {
+  auto* session = new StoreSession;
+  session->sessionInfo = sessionInfo;
+  session->userInfo = userInfo;
+  session->startedAt = options_.now();
+  push({session->startedAt, SessionBegin{session}});
+  return session;
+}
+
+void Store::endSession(StoreSession* session) {
+  push({options_.now(), SessionEnd{std::unique_ptr<StoreSession>(session)}});
+}
+
+void Store::flush(StoreSession* session, TelemetrySession::FlushCallback completion) {
+  {
+    const std::lock_guard lock(mutex_);
+    if (!isStopping_) {
+      if (queue_.empty()) firstQueuedAt_ = Clock::now();
+      queue_.push({options_.now(), SessionFlush{session, std::move(completion)}});
+      isUrgent_ = true;
+      wakeWriter();
+      return;
+    }
+  }
+  completion(makeError(kStopped, "the store is closed"));
+}
+
+void Store::addAnalyticsEvent(std::string name, AnalyticsSink::PayloadProvider provider) {
+  const State state = state_.load(std::memory_order_relaxed);
+  if ((state == State::kUsable || state == State::kOpening) &&
+      push({options_.now(),
+            AnalyticsEvent{std::move(name), std::move(provider), std::nullopt}})) {
+    return;
+  }
+  counters_.droppedAnalytics.fetch_add(1, std::memory_order_relaxed);
+}
+
+void Store::addPowerEvent(PowerEvent event) {
+  const State state = state_.load(std::memory_order_relaxed);
+  if ((state == State::kUsable || state == State::kOpening) &&
+      push({options_.now(), std::move(event)})) {
+    return;
+  }
+  counters_.droppedPower.fetch_add(1, std::memory_order_relaxed);
+}
+
+void Store::whenKnown(Answer answer) {
+  bool isUsable;
+  {
+    const std::lock_guard lock(mutex_);
+    if (state_ == State::kOpening) {
+      waitingAnswers_.push_back(std::move(answer));
+      return;
+    }
+    isUsable = state_ == State::kUsable;
+  }
+  answer(isUsable);
+}
+
+std::optional<ErrorObject> Store::refusal() {
+  const State state = state_.load(std::memory_order_relaxed);
+  if (state == State::kUsable || state == State::kOpening) return std::nullopt;
+  counters_.refused.fetch_add(1, std::memory_order_relaxed);
+  const std::lock_guard lock(mutex_);
+  return faultError_;
+}
+
+// False when there is no room; the steps of sessions always find room, since what
+// is queued points to their session.
+bool Store::push(StoreOperation operation) {
+  const bool isSessionStep = std::holds_alternative<SessionBegin>(operation.what) ||
+                             std::holds_alternative<SessionEnd>(operation.what);
+  const bool isEvent = std::holds_alternative<AnalyticsEvent>(operation.what);
+  bool mustWake;
+  {
+    const std::lock_guard lock(mutex_);
+    if (!isSessionStep && (isStopping_ || queue_.bytes() >= options_.queuedBytes)) {
+      return false;
+    }
+    if (isEvent && queuedEvents_ >= options_.queuedEvents) return false;
+    if (queue_.empty()) firstQueuedAt_ = Clock::now();
+    // A writer that sleeps until something is due needs no call for a few more.
+    mustWake = writerIsIdle_ || queue_.size() == kWriteAhead - 1;
+    if (isEvent) ++queuedEvents_;
+    if (!isSessionStep) counters_.accepted.fetch_add(1, std::memory_order_relaxed);
+    queue_.push(std::move(operation));
+  }
+  if (mustWake) wakeWriter();
+  return true;
+}
+
+void Store::runWriter() {
+  ::pthread_setname_np(::pthread_self(), "ostrel-store");
+  writer_.recover();
+  if (writer_.fault()) retryLater();
+  publishState();
+  while (waitForWork()) {
+    work();
+    publishState();
+  }
+  finish();
+}
+
+// Returns when there is something to do; false when the store is to end.
+bool Store::waitForWork() {
+  std::unique_lock lock(mutex_);
+  for (;;) {
+    if (isStopping_) return false;
+    if (isUrgent_) return true;
+    std::optional<Clock::time_point> due;
+    if (writer_.fault()) {
+      due = retryAt_;
+    } else if (queue_.size() >= kWriteAhead) {
+      return true;
+    } else if (writer_.hasUncommitted()) {
+      due = commitAt_;
+    } else if (!queue_.empty()) {
+      due = firstQueuedAt_ + options_.commitWindow;
+    }
+    if (!due) {
+      writerIsIdle_ = true;
+      workIsThere_.wait(lock);
+      writerIsIdle_ = false;
+    } else if (Clock::now() >= *due) {
+      return true;
+    } else {
+      workIsThere_.wait_until(lock, *due);
+    }
+  }
+}
+
+// Hands what is queued to the writer; true when it is wanted durable at once.
+bool Store::handOver() {
+  std::vector<StoreBatch> batches;
+  bool isUrgent;
+  {
+    const std::lock_guard lock(mutex_);
+    if (!writer_.hasUncommitted()) commitAt_ = firstQueuedAt_ + options_.commitWindow;
+    isUrgent = std::exchange(isUrgent_, false);
+    queuedEvents_ = 0;
+    batches = queue_.take();
+  }
+  writer_.add(std::move(batches));
+  return isUrgent;
+}
+
+void Store::work() {
+  bool isUrgent = handOver();
+  if (writer_.fault() && Clock::now() >= retryAt_) {
+    writer_.recover();
+    if (!writer_.fault()) isUrgent = true;
+  }
+  if (!writer_.fault() && (isUrgent || Clock::now() >= commitAt_ ||
+                           writer_.uncommittedBytes() >= kCommitBytes)) {
+    std::vector<StoreBatch> done = writer_.commit();
+    const std::lock_guard lock(mutex_);
+    for (StoreBatch& batch : done) queue_.recycle(std::move(batch));
+  }
+  if (writer_.fault()) {
+    retryLater();
+    writer_.failFlushes();
+    writer_.keepAtMost(kKeptThroughFault);
+  } else {
+    retryPause_ = options_.firstRetry;
+    retryAt_ = {};
+  }
+}
+
+void Store::retryLater() {
+  const auto now = Clock::now();
+  if (now < retryAt_) return;
+  if (writer_.fault()->kind == StoreFault::Kind::kDamaged &&
+      retryPause_ == options_.firstRetry) {
+    retryAt_ = now;  // It is out of the way by now.
+  } else {
+    retryAt_ = now + retryPause_;
+  }
+  retryPause_ = std::min(retryPause_ * 2, options_.longestRetry);
+}
+
+void Store::publishState() {
+  std::vector<Answer> answers;
+  const bool isUsable = !writer_.fault();
+  {
+    const std::lock_guard lock(mutex_);
+    if (isStopping_) return;
+    state_ = isUsable ? State::kUsable : State::kFaulty;
+    if (!isUsable) faultError_ = StoreWriter::errorOf(*writer_.fault());
+    answers.swap(waitingAnswers_);
+  }
+  for (const Answer& answer : answers) answer(isUsable);
+}
+
+void Store::finish() {
+  handOver();
+  if (writer_.fault()) writer_.recover();
+  if (!writer_.fault()) writer_.commit();
+  if (writer_.hasUncommitted()) {
+    OSTREL_LOG_ERROR(processLogScope, "the end of the reports was not stored");
+  }
+  writer_.failFlushes();
+  writer_.close();
+  std::vector<Answer> answers;
+  {
+    const std::lock_guard lock(mutex_);
+    answers.swap(waitingAnswers_);
+  }
+  for (const Answer& answer : answers) answer(/*isUsable=*/false);
+  const std::lock_guard lock(mutex_);
+  hasEnded_ = true;
+  writerEnded_.notify_all();
+}
+
+}  // namespace ostrel

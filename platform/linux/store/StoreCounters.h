@@ -1,0 +1,21 @@
+#pragma once
+
+#include <atomic>
+#include <cstdint>
+
+namespace ostrel {
+
+/// What the store did since the service started. The table `service_status` shows
+/// all but the first two, as of the last commit.
+struct StoreCounters {
+  std::atomic<std::uint64_t> accepted{0};  // Messages and events taken.
+  std::atomic<std::uint64_t> written{0};   // Of these, durable.
+  std::atomic<std::uint64_t> refused{0};   // Messages answered with an error.
+  std::atomic<std::uint64_t> lost{0};      // Taken, then given up in a long fault.
+  std::atomic<std::uint64_t> droppedAnalytics{0};  // Events.
+  std::atomic<std::uint64_t> droppedPower{0};      // Events.
+  std::atomic<std::uint64_t> failures{0};          // Of the file, as they were found.
+  std::atomic<std::uint64_t> setAside{0};          // Damaged files.
+};
+
+}  // namespace ostrel

@@ -1,0 +1,512 @@
+// The file is written by one connection in WAL mode with synchronous=FULL: a
+// commit is durable when it returns. Commits are few (the writer gathers), so the
+// difference to NORMAL is one fsync a commit: with 8,192 rows in each, 1.17
+// against 1.19 million rows a second here.
+#include "platform/linux/store/StoreDatabase.h"
+
+#include <dirent.h>
+#include <fcntl.h>
+#include <sqlite3.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <cerrno>
+#include <cstdio>
+#include <cstring>
+#include <ctime>
+#include <memory>
+
+#include "platform/Logging.h"
+#include "platform/linux/FileDescriptor.h"
+#include "platform/linux/store/StoreRowTables.h"
+
+namespace ostrel {
+namespace {
+
+constexpr std::int64_t kVersion = 1;
+constexpr const char* kSetVersion =
+    "PRAGMA application_id = 1330860620; PRAGMA user_version = 1";
+
+constexpr const char* kSchema = R"(
+CREATE TABLE telemetry_sessions (
+  id INTEGER PRIMARY KEY, reporter_id INTEGER, hierarchy_token TEXT, session_info TEXT,
+  user_info TEXT, started_at INTEGER, flushed_at INTEGER, ended_at INTEGER);
+CREATE TABLE telemetry_messages (
+  id INTEGER PRIMARY KEY, telemetry_session_id INTEGER, session_info TEXT,
+  user_info TEXT, category INTEGER, type INTEGER, payload TEXT, created_at INTEGER);
+CREATE TABLE analytics_events (
+  id INTEGER PRIMARY KEY, name TEXT, payload TEXT, created_at INTEGER);
+CREATE TABLE power_events (
+  id INTEGER PRIMARY KEY, client_id INTEGER, name TEXT, event TEXT, created_at INTEGER,
+  attachment TEXT);
+CREATE TABLE analytics_interest (pattern TEXT PRIMARY KEY);
+INSERT INTO analytics_interest VALUES ('*');
+CREATE TABLE service_status (key TEXT PRIMARY KEY, value);
+)";
+
+// Larger files are checked where they are touched.
+constexpr off_t kCheckedAtOpenBytes = 4 * 1024 * 1024;
+
+constexpr int kBusyMilliseconds = 100;
+constexpr std::size_t kFilesSetAside = 2;
+constexpr std::string_view kSetAsideSuffix = ".damaged-";
+
+std::string directoryOf(const std::string& path) {
+  const auto slash = path.rfind('/');
+  return slash == std::string::npos ? "." : slash == 0 ? "/" : path.substr(0, slash);
+}
+
+std::string nameOf(const std::string& path) { return path.substr(path.rfind('/') + 1); }
+
+StoreFault systemFault(int error, std::string_view action, const std::string& path) {
+  return {StoreFault::Kind::kTransient, SQLITE_CANTOPEN,
+          "cannot " + std::string(action) + " " + path + ": " + std::strerror(error)};
+}
+
+StoreDatabase::Result makeDirectories(const std::string& path) {
+  for (std::size_t end = path.find('/', 1);; end = path.find('/', end + 1)) {
+    const std::string directory = path.substr(0, end);
+    if (::mkdir(directory.c_str(), 0700) != 0 && errno != EEXIST) {
+      return systemFault(errno, "make the directory", directory);
+    }
+    if (end == std::string::npos) return std::nullopt;
+  }
+}
+
+// The version that stands in the file itself; 0 when it is too short to have one.
+std::uint32_t versionInHeader(int file) {
+  constexpr off_t kVersionOffset = 60;
+  std::uint8_t bytes[4];
+  if (::pread(file, bytes, sizeof bytes, kVersionOffset) != sizeof bytes) return 0;
+  return static_cast<std::uint32_t>(bytes[0]) << 24 |
+         static_cast<std::uint32_t>(bytes[1]) << 16 |
+         static_cast<std::uint32_t>(bytes[2]) << 8 | bytes[3];
+}
+
+bool isSQLite(int file) {
+  constexpr std::string_view kMagic("SQLite format 3\0", 16);
+  char bytes[16];
+  return ::pread(file, bytes, sizeof bytes, /*offset=*/0) == sizeof bytes &&
+         std::string_view(bytes, sizeof bytes) == kMagic;
+}
+
+StoreFault damaged(std::string description) {
+  return {StoreFault::Kind::kDamaged, SQLITE_CORRUPT, std::move(description)};
+}
+
+StoreFault newer(std::int64_t version) {
+  return {StoreFault::Kind::kNewer, SQLITE_ERROR,
+          "the store has version " + std::to_string(version) +
+              ", written by a later service; this one knows " + std::to_string(kVersion)};
+}
+
+}  // namespace
+
+// A prepared statement. Text given to it must live until the next step.
+class StoreDatabase::Statement {
+ public:
+  Statement() = default;
+  Statement(const Statement&) = delete;
+  Statement& operator=(const Statement&) = delete;
+  ~Statement() { sqlite3_finalize(statement_); }
+
+  int prepare(sqlite3* connection, const char* sql) {
+    return sqlite3_prepare_v3(connection, sql, /*nByte=*/-1, SQLITE_PREPARE_PERSISTENT,
+                              &statement_, /*pzTail=*/nullptr);
+  }
+
+  void bind(int index, std::int64_t value) {
+    sqlite3_bind_int64(statement_, index, value);
+  }
+  void bind(int index, std::string_view text) {
+    sqlite3_bind_text64(statement_, index, text.data(), text.size(), SQLITE_STATIC,
+                        SQLITE_UTF8);
+  }
+  template <typename T>
+  void bind(int index, const std::optional<T>& value) {
+    if (value) {
+      bind(index, *value);
+    } else {
+      sqlite3_bind_null(statement_, index);
+    }
+  }
+
+  // SQLITE_ROW, or SQLITE_OK at the end.
+  int step() {
+    const int code = sqlite3_step(statement_);
+    return code == SQLITE_DONE ? SQLITE_OK : code;
+  }
+  void reset() { sqlite3_reset(statement_); }
+
+  int run() {
+    const int code = step();
+    reset();
+    return code;
+  }
+
+  std::int64_t integer(int column) { return sqlite3_column_int64(statement_, column); }
+  std::string text(int column) {
+    const unsigned char* text = sqlite3_column_text(statement_, column);
+    if (text == nullptr) return {};
+    return {reinterpret_cast<const char*>(text),
+            static_cast<std::size_t>(sqlite3_column_bytes(statement_, column))};
+  }
+
+ private:
+  sqlite3_stmt* statement_ = nullptr;
+};
+
+struct StoreDatabase::Statements {
+  Statement begin;
+  Statement commit;
+  Statement insertSession;
+  Statement setFlushedAt;
+  Statement setEndedAt;
+  Statement insertMessages;
+  Statement insertAnalytics;
+  Statement insertPowerEvent;
+  Statement setStatus;
+  Statement dataVersion;
+  Statement interest;
+  Statement fingerprint;
+};
+
+StoreDatabase::StoreDatabase(std::string path, const char* vfs)
+    : path_(std::move(path)), vfs_(vfs) {}
+
+StoreDatabase::~StoreDatabase() { close(); }
+
+StoreDatabase::Result StoreDatabase::open() {
+  close();
+  Result result = makeFile();
+  if (!result) result = connect();
+  if (result) close();
+  return result;
+}
+
+void StoreDatabase::close() {
+  statements_.reset();
+  sqlite3_close_v2(connection_);
+  connection_ = nullptr;
+}
+
+StoreDatabase::Result StoreDatabase::makeFile() {
+  if (auto failed = makeDirectories(directoryOf(path_))) return failed;
+  struct stat status;
+  if (::lstat(path_.c_str(), &status) == 0 && !S_ISREG(status.st_mode)) {
+    return damaged("it is not a regular file");
+  }
+  const FileDescriptor file(
+      ::open(path_.c_str(), O_RDWR | O_CREAT | O_NOFOLLOW | O_CLOEXEC, 0600));
+  if (!file) return systemFault(errno, "open", path_);
+  if (::fstat(file.get(), &status) != 0) return systemFault(errno, "look at", path_);
+  if ((status.st_mode & 07777) != 0600 && ::fchmod(file.get(), 0600) != 0) {
+    return systemFault(errno, "set the permissions of", path_);
+  }
+  isAnother_ = device_ != status.st_dev || inode_ != status.st_ino;
+  device_ = status.st_dev;
+  inode_ = status.st_ino;
+  if (status.st_size == 0) return std::nullopt;
+  if (!isSQLite(file.get())) return damaged("it is not a database");
+  const std::uint32_t version = versionInHeader(file.get());
+  if (version > kVersion && version <= INT32_MAX) return newer(version);
+  return std::nullopt;
+}
+
+StoreDatabase::Result StoreDatabase::connect() {
+  const int code = sqlite3_open_v2(path_.c_str(), &connection_,
+                                   SQLITE_OPEN_READWRITE | SQLITE_OPEN_NOMUTEX, vfs_);
+  if (code != SQLITE_OK) return fault(code, "open");
+  sqlite3_extended_result_codes(connection_, /*onoff=*/1);
+  sqlite3_busy_timeout(connection_, kBusyMilliseconds);
+  if (auto failed = run("PRAGMA trusted_schema = OFF; PRAGMA cache_size = -2000;"
+                        "PRAGMA temp_store = MEMORY; PRAGMA synchronous = FULL")) {
+    return failed;
+  }
+  std::int64_t version = 0;
+  if (auto failed = checkVersion(version)) return failed;
+  std::string mode;
+  if (auto failed = readText("PRAGMA journal_mode = WAL", mode)) return failed;
+  if (mode != "wal") return fault(SQLITE_CANTOPEN, "use a write-ahead log");
+  if (auto failed = run("PRAGMA wal_autocheckpoint = 1000;"
+                        "PRAGMA journal_size_limit = 4194304")) {
+    return failed;
+  }
+  if (version == 0) {
+    if (auto failed = makeSchema()) return failed;
+  } else if (auto failed = checkContent()) {
+    return failed;
+  }
+  if (const int registered = registerRowTables(connection_, &rows_)) {
+    return fault(registered, "prepare");
+  }
+  return prepareStatements();
+}
+
+StoreDatabase::Result StoreDatabase::checkVersion(std::int64_t& version) {
+  if (auto failed = readInteger("PRAGMA user_version", version)) return failed;
+  if (version > kVersion) return newer(version);
+  if (version < 0) return damaged("its version is below 0");
+  std::int64_t tables = 0;
+  if (auto failed = readInteger("SELECT count(*) FROM sqlite_schema", tables)) {
+    return failed;
+  }
+  if (version == 0 && tables != 0) return damaged("it holds something else");
+  return std::nullopt;
+}
+
+StoreDatabase::Result StoreDatabase::makeSchema() {
+  isAnother_ = true;
+  if (auto failed = run("BEGIN IMMEDIATE")) return failed;
+  for (const char* sql : {kSchema, kSetVersion, "COMMIT"}) {
+    if (auto failed = run(sql)) {
+      rollback();
+      return failed;
+    }
+  }
+  return std::nullopt;
+}
+
+StoreDatabase::Result StoreDatabase::checkContent() {
+  struct stat status;
+  if (::stat(path_.c_str(), &status) != 0) return systemFault(errno, "look at", path_);
+  if (status.st_size > kCheckedAtOpenBytes) return std::nullopt;
+  std::string finding;
+  if (auto failed = readText("PRAGMA quick_check(1)", finding)) return failed;
+  if (finding != "ok") return damaged(finding);
+  return std::nullopt;
+}
+
+StoreDatabase::Result StoreDatabase::prepareStatements() {
+  auto statements = std::make_unique<Statements>();
+  const struct {
+    Statement& statement;
+    const char* sql;
+  } table[] = {
+      {statements->begin, "BEGIN IMMEDIATE"},
+      {statements->commit, "COMMIT"},
+      {statements->insertSession,
+       "INSERT INTO telemetry_sessions (reporter_id, hierarchy_token, session_info, "
+       "user_info, started_at) VALUES (?, ?, ?, ?, ?)"},
+      {statements->setFlushedAt,
+       "UPDATE telemetry_sessions SET flushed_at = ?2 WHERE id = ?1"},
+      {statements->setEndedAt,
+       "UPDATE telemetry_sessions SET ended_at = ?2 WHERE id = ?1"},
+      {statements->insertMessages,
+       "INSERT INTO telemetry_messages (telemetry_session_id, session_info, user_info, "
+       "category, type, payload, created_at) SELECT * FROM batch_messages"},
+      {statements->insertAnalytics,
+       "INSERT INTO analytics_events (name, payload, created_at) "
+       "SELECT * FROM batch_analytics"},
+      {statements->insertPowerEvent,
+       "INSERT INTO power_events (client_id, name, event, attachment, created_at) "
+       "VALUES (?, ?, ?, ?, ?)"},
+      {statements->setStatus,
+       "INSERT INTO service_status (key, value) VALUES (?, ?) "
+       "ON CONFLICT (key) DO UPDATE SET value = excluded.value"},
+      {statements->dataVersion, "PRAGMA data_version"},
+      {statements->interest, "SELECT pattern FROM analytics_interest"},
+      {statements->fingerprint,
+       "SELECT ifnull((SELECT max(id) FROM telemetry_sessions), 0) + "
+       "ifnull((SELECT max(id) FROM telemetry_messages), 0) + "
+       "ifnull((SELECT max(id) FROM analytics_events), 0) + "
+       "ifnull((SELECT max(id) FROM power_events), 0)"},
+  };
+  for (const auto& [statement, sql] : table) {
+    const int code = statement.prepare(connection_, sql);
+    if (code == SQLITE_ERROR) {
+      return damaged(std::string("its tables are others: ") +
+                     sqlite3_errmsg(connection_));
+    }
+    if (code != SQLITE_OK) return fault(code, "prepare");
+  }
+  statements_ = std::move(statements);
+  dataVersion_ = -1;
+  return std::nullopt;
+}
+
+bool StoreDatabase::isInPlace() const {
+  struct stat status;
+  return ::stat(path_.c_str(), &status) == 0 && status.st_dev == device_ &&
+         status.st_ino == inode_;
+}
+
+StoreDatabase::Result StoreDatabase::setAside(std::string_view reason) {
+  close();
+  const std::time_t now = std::time(nullptr);
+  struct tm calendar;
+  char stamp[32];
+  std::strftime(stamp, sizeof stamp, "%Y%m%dT%H%M%SZ", ::gmtime_r(&now, &calendar));
+  std::string target = path_ + std::string(kSetAsideSuffix) + stamp;
+  struct stat status;
+  for (int i = 2; ::lstat(target.c_str(), &status) == 0; ++i) {
+    target = path_ + std::string(kSetAsideSuffix) + stamp + "-" + std::to_string(i);
+  }
+  if (::rename(path_.c_str(), target.c_str()) != 0) {
+    return systemFault(errno, "set aside", path_);
+  }
+  ::rename((path_ + "-wal").c_str(), (target + "-wal").c_str());
+  ::unlink((path_ + "-shm").c_str());
+  OSTREL_LOG_ERROR(processLogScope, "set the store %@ aside as %@: %@", path_, target,
+                   reason);
+  removeOldestSetAside();
+  return std::nullopt;
+}
+
+void StoreDatabase::removeOldestSetAside() {
+  const std::string directory = directoryOf(path_);
+  const std::string prefix = nameOf(path_) + std::string(kSetAsideSuffix);
+  std::vector<std::string> names;
+  const std::unique_ptr<DIR, int (*)(DIR*)> listing(::opendir(directory.c_str()),
+                                                    ::closedir);
+  if (listing == nullptr) return;
+  while (const dirent* entry = ::readdir(listing.get())) {
+    const std::string_view name(entry->d_name);
+    if (name.starts_with(prefix) && !name.ends_with("-wal")) names.emplace_back(name);
+  }
+  std::sort(names.begin(), names.end());
+  for (std::size_t i = 0; i + kFilesSetAside < names.size(); ++i) {
+    const std::string path = directory + "/" + names[i];
+    ::unlink(path.c_str());
+    ::unlink((path + "-wal").c_str());
+  }
+}
+
+StoreDatabase::Result StoreDatabase::begin() {
+  const int code = statements_->begin.run();
+  return code == SQLITE_OK ? Result() : fault(code, "begin to write");
+}
+
+StoreDatabase::Result StoreDatabase::commit() {
+  const int code = statements_->commit.run();
+  return code == SQLITE_OK ? Result() : fault(code, "commit");
+}
+
+void StoreDatabase::rollback() {
+  if (connection_ != nullptr && sqlite3_get_autocommit(connection_) == 0) {
+    run("ROLLBACK");
+  }
+}
+
+StoreDatabase::Result StoreDatabase::insertSession(const SessionRow& row,
+                                                   std::int64_t& id) {
+  Statement& statement = statements_->insertSession;
+  statement.bind(1, row.reporterID);
+  statement.bind(2, row.hierarchyToken);
+  statement.bind(3, row.sessionInfo);
+  statement.bind(4, row.userInfo);
+  statement.bind(5, row.startedAt);
+  const int code = statement.run();
+  if (code != SQLITE_OK) return fault(code, "insert a session");
+  id = sqlite3_last_insert_rowid(connection_);
+  return std::nullopt;
+}
+
+StoreDatabase::Result StoreDatabase::setFlushedAt(std::int64_t session,
+                                                  std::int64_t time) {
+  statements_->setFlushedAt.bind(1, session);
+  statements_->setFlushedAt.bind(2, time);
+  const int code = statements_->setFlushedAt.run();
+  return code == SQLITE_OK ? Result() : fault(code, "update a session");
+}
+
+StoreDatabase::Result StoreDatabase::setEndedAt(std::int64_t session, std::int64_t time) {
+  statements_->setEndedAt.bind(1, session);
+  statements_->setEndedAt.bind(2, time);
+  const int code = statements_->setEndedAt.run();
+  return code == SQLITE_OK ? Result() : fault(code, "update a session");
+}
+
+StoreDatabase::Result StoreDatabase::insertPowerEvent(const PowerRow& row) {
+  Statement& statement = statements_->insertPowerEvent;
+  statement.bind(1, std::int64_t{row.clientID});
+  statement.bind(2, row.name);
+  statement.bind(3, row.event);
+  statement.bind(4, row.attachment);
+  statement.bind(5, row.createdAt);
+  const int code = statement.run();
+  return code == SQLITE_OK ? Result() : fault(code, "insert a power event");
+}
+
+StoreDatabase::Result StoreDatabase::insertRows(const RowBatch& rows) {
+  rows_ = &rows;
+  int code = SQLITE_OK;
+  if (!rows.messages.empty()) code = statements_->insertMessages.run();
+  if (code == SQLITE_OK && !rows.analytics.empty()) {
+    code = statements_->insertAnalytics.run();
+  }
+  rows_ = nullptr;
+  return code == SQLITE_OK ? Result() : fault(code, "insert rows");
+}
+
+StoreDatabase::Result StoreDatabase::setStatus(std::string_view key, std::int64_t value) {
+  statements_->setStatus.bind(1, key);
+  statements_->setStatus.bind(2, value);
+  const int code = statements_->setStatus.run();
+  return code == SQLITE_OK ? Result() : fault(code, "update the status");
+}
+
+StoreDatabase::Result StoreDatabase::readInterestIfChanged(
+    std::optional<std::vector<std::string>>& patterns) {
+  Statement& dataVersion = statements_->dataVersion;
+  int code = dataVersion.step();
+  const std::int64_t version = code == SQLITE_ROW ? dataVersion.integer(0) : 0;
+  dataVersion.reset();
+  if (code != SQLITE_ROW) return fault(code, "read the version of the data");
+  if (version == dataVersion_) return std::nullopt;
+  std::vector<std::string> read;
+  Statement& interest = statements_->interest;
+  while ((code = interest.step()) == SQLITE_ROW) read.push_back(interest.text(0));
+  interest.reset();
+  if (code != SQLITE_OK) return fault(code, "read the wanted events");
+  dataVersion_ = version;
+  patterns = std::move(read);
+  return std::nullopt;
+}
+
+StoreDatabase::Result StoreDatabase::readFingerprint(std::int64_t& fingerprint) {
+  Statement& statement = statements_->fingerprint;
+  const int code = statement.step();
+  if (code == SQLITE_ROW) fingerprint = statement.integer(0);
+  statement.reset();
+  return code == SQLITE_ROW ? Result() : fault(code, "read the last rows");
+}
+
+bool StoreDatabase::matches(const std::string& pattern, const std::string& text) {
+  return sqlite3_strglob(pattern.c_str(), text.c_str()) == 0;
+}
+
+StoreDatabase::Result StoreDatabase::run(const char* sql) {
+  const int code = sqlite3_exec(connection_, sql, nullptr, nullptr, nullptr);
+  return code == SQLITE_OK ? Result() : fault(code, "set up");
+}
+
+StoreDatabase::Result StoreDatabase::readInteger(const char* sql, std::int64_t& value) {
+  Statement statement;
+  int code = statement.prepare(connection_, sql);
+  if (code == SQLITE_OK) code = statement.step();
+  if (code != SQLITE_ROW) return fault(code, "read");
+  value = statement.integer(0);
+  return std::nullopt;
+}
+
+StoreDatabase::Result StoreDatabase::readText(const char* sql, std::string& value) {
+  Statement statement;
+  int code = statement.prepare(connection_, sql);
+  if (code == SQLITE_OK) code = statement.step();
+  if (code != SQLITE_ROW) return fault(code, "read");
+  value = statement.text(0);
+  return std::nullopt;
+}
+
+StoreFault StoreDatabase::fault(int code, std::string_view action) const {
+  const int primary = code & 0xFF;
+  // An error in statements that were once right: the tables changed below us.
+  const bool isDamaged = primary == SQLITE_CORRUPT || primary == SQLITE_NOTADB ||
+                         primary == SQLITE_ERROR || primary == SQLITE_CONSTRAINT;
+  return {isDamaged ? StoreFault::Kind::kDamaged : StoreFault::Kind::kTransient, code,
+          "cannot " + std::string(action) + " in " + path_ + ": " + sqlite3_errstr(code)};
+}
+
+}  // namespace ostrel

@@ -1,0 +1,126 @@
+#pragma once
+
+#include <sys/types.h>
+
+#include <cstdint>
+#include <memory>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <vector>
+
+#include "platform/linux/store/StoreRows.h"
+
+struct sqlite3;
+struct sqlite3_stmt;
+
+namespace ostrel {
+
+/// Why the database could not do what it was asked.
+struct StoreFault {
+  enum class Kind {
+    kTransient,  // May pass: full, locked, read-only, an error of the disk.
+    kDamaged,    // The file is no store, or no longer one.
+    kNewer,      // A later version wrote it; it is not touched.
+  };
+
+  Kind kind = Kind::kTransient;
+  int code = 0;  // SQLite's.
+  std::string description;
+};
+
+/// The database file: its place, its schema and what is written to it. One
+/// thread at a time. Every operation gives none when it succeeded.
+class StoreDatabase {
+ public:
+  using Result = std::optional<StoreFault>;
+
+  /// `vfs` names the layer below SQLite; none is the system's.
+  StoreDatabase(std::string path, const char* vfs);
+  ~StoreDatabase();
+  StoreDatabase(const StoreDatabase&) = delete;
+  StoreDatabase& operator=(const StoreDatabase&) = delete;
+
+  /// Opens the file, or makes it, with the directories above it. Checks that it
+  /// is sound and of this version.
+  Result open();
+  void close();
+  bool isOpen() const { return connection_ != nullptr; }
+  /// Whether the last `open` made the store or found another file than the one
+  /// before it.
+  bool isAnother() const { return isAnother_; }
+
+  /// Whether the path still names the file that is open.
+  bool isInPlace() const;
+
+  /// Closes the file, renames it to "PATH.damaged-TIME" and logs why. The last two
+  /// files set aside are kept.
+  Result setAside(std::string_view reason);
+
+  Result begin();
+  Result commit();
+  void rollback();
+
+  struct SessionRow {
+    std::optional<std::int64_t> reporterID;
+    std::optional<std::string_view> hierarchyToken;
+    std::string_view sessionInfo;
+    std::string_view userInfo;
+    std::int64_t startedAt = 0;
+  };
+  Result insertSession(const SessionRow& row, std::int64_t& id);
+  Result setFlushedAt(std::int64_t session, std::int64_t time);
+  Result setEndedAt(std::int64_t session, std::int64_t time);
+
+  struct PowerRow {
+    std::int32_t clientID = 0;
+    std::string_view name;
+    std::string_view event;
+    std::optional<std::string_view> attachment;
+    std::int64_t createdAt = 0;
+  };
+  Result insertPowerEvent(const PowerRow& row);
+
+  Result insertRows(const RowBatch& rows);
+
+  /// A number that differs before and after any insertion.
+  Result readFingerprint(std::int64_t& fingerprint);
+
+  Result setStatus(std::string_view key, std::int64_t value);
+
+  /// The patterns of the analytics events that are wanted, when they may have
+  /// changed since the last call. Inside a transaction.
+  Result readInterestIfChanged(std::optional<std::vector<std::string>>& patterns);
+
+  /// Whether `text` matches a pattern with `*`, `?` and `[...]`.
+  static bool matches(const std::string& pattern, const std::string& text);
+
+ private:
+  class Statement;
+  struct Statements;
+
+  Result makeFile();
+  Result connect();
+  Result checkVersion(std::int64_t& version);
+  Result makeSchema();
+  Result checkContent();
+  Result prepareStatements();
+  void removeOldestSetAside();
+
+  Result run(const char* sql);
+  Result readInteger(const char* sql, std::int64_t& value);
+  Result readText(const char* sql, std::string& value);
+  StoreFault fault(int code, std::string_view action) const;
+
+  const std::string path_;
+  const char* const vfs_;
+  sqlite3* connection_ = nullptr;
+  bool isAnother_ = false;
+  dev_t device_ = 0;
+  ino_t inode_ = 0;
+  const RowBatch* rows_ = nullptr;  // What the row tables show.
+  std::int64_t dataVersion_ = -1;
+  std::unique_ptr<Statements> statements_;
+};
+
+}  // namespace ostrel

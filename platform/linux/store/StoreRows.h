@@ -1,0 +1,53 @@
+// Rows on their way into a table, many at a time.
+#pragma once
+
+#include <cstddef>
+#include <cstdint>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <vector>
+
+namespace ostrel {
+
+/// A piece of a batch's text. Not there: NULL.
+struct RowText {
+  std::size_t begin = 0;
+  std::size_t size = 0;
+  bool isThere = false;
+};
+
+struct MessageRow {
+  std::optional<std::int64_t> session;
+  RowText sessionInfo;
+  RowText userInfo;
+  std::uint16_t category = 0;
+  std::uint16_t type = 0;
+  RowText payload;
+  std::int64_t createdAt = 0;
+};
+
+struct AnalyticsRow {
+  RowText name;
+  RowText payload;
+  std::int64_t createdAt = 0;
+};
+
+/// Rows that share one growing text.
+struct RowBatch {
+  std::string text;
+  std::vector<MessageRow> messages;
+  std::vector<AnalyticsRow> analytics;
+
+  std::string_view of(RowText piece) const {
+    return std::string_view(text).substr(piece.begin, piece.size);
+  }
+  bool empty() const { return messages.empty() && analytics.empty(); }
+  void clear() {
+    text.clear();
+    messages.clear();
+    analytics.clear();
+  }
+};
+
+}  // namespace ostrel

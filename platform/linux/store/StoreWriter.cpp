@@ -1,0 +1,415 @@
+// Life of an operation: it is added to `pending_` and written into the open
+// transaction (one begins with the first operation). A commit empties `pending_`.
+// Any fault rolls back; `pending_` stays, and `recover` starts again from its
+// front, in a new file if the old one was damaged. So an operation is either kept
+// here or durable, and written once.
+#include "platform/linux/store/StoreWriter.h"
+
+#include <sqlite3.h>
+
+#include <algorithm>
+#include <iterator>
+#include <new>
+#include <type_traits>
+
+#include "platform/Logging.h"
+#include "platform/ValueJSON.h"
+
+namespace ostrel {
+namespace {
+
+// Rows gathered for one statement.
+constexpr std::size_t kRowsAtOnce = 512;
+constexpr std::size_t kTextAtOnce = 512 * 1024;
+constexpr std::size_t kKnownNames = 4096;
+
+template <typename... Cases>
+struct Overloaded : Cases... {
+  using Cases::operator()...;
+};
+template <typename... Cases>
+Overloaded(Cases...) -> Overloaded<Cases...>;
+
+// Whether a row of its own came of it.
+bool isRow(const StoreOperation& operation) {
+  if (const auto* event = std::get_if<AnalyticsEvent>(&operation.what)) {
+    return event->payload.has_value();
+  }
+  return std::holds_alternative<SessionMessage>(operation.what) ||
+         std::holds_alternative<LoneMessage>(operation.what) ||
+         std::holds_alternative<PowerEvent>(operation.what);
+}
+
+void appendLenientJSON(std::string& out, const Dictionary& value) {
+  appendJSON(out, value.value(), JSONLayout::kCompact, JSONStrictness::kLenient,
+             /*indent=*/0);
+}
+
+}  // namespace
+
+StoreWriter::StoreWriter(std::string path, const char* vfs, Now now,
+                         StoreCounters& counters)
+    : database_(std::move(path), vfs), now_(std::move(now)), counters_(counters) {}
+
+void StoreWriter::recover() {
+  rollback();
+  Result failed = openOrReplace();
+  if (!failed) failed = resolveDoubt();
+  if (!failed) {
+    fault_.reset();
+    failed = writePending();
+  }
+  if (failed) {
+    fail(*failed);
+  } else if (!loggedFault_.empty()) {
+    OSTREL_LOG_DEFAULT(processLogScope, "the store can be used again");
+    loggedFault_.clear();
+  }
+}
+
+StoreWriter::Result StoreWriter::openOrReplace() {
+  if (database_.isOpen() && database_.isInPlace()) return std::nullopt;
+  Result failed = database_.open();
+  if (failed && failed->kind == StoreFault::Kind::kDamaged) {
+    if (Result stuck = database_.setAside(failed->description)) return stuck;
+    counters_.setAside.fetch_add(1, std::memory_order_relaxed);
+    failed = database_.open();
+  }
+  if (!failed && database_.isAnother()) {
+    ++file_;
+    doubt_.reset();
+  }
+  return failed;
+}
+
+// The commit's frames may have reached the log before the error: then what it held
+// must not be written again.
+StoreWriter::Result StoreWriter::resolveDoubt() {
+  if (!doubt_) return std::nullopt;
+  std::int64_t fingerprint = 0;
+  if (Result failed = database_.readFingerprint(fingerprint)) return failed;
+  if (fingerprint == doubt_->fingerprint) {
+    for (const auto& [session, row] : doubt_->rows) {
+      session->row = row;
+      session->file = file_;
+    }
+    takeDone(doubt_->batches);
+  }
+  doubt_.reset();
+  return std::nullopt;
+}
+
+void StoreWriter::add(std::vector<StoreBatch> batches) {
+  for (StoreBatch& batch : batches) {
+    for (const StoreOperation& operation : batch) uncommittedBytes_ += operation.bytes();
+    pending_.push_back(std::move(batch));
+  }
+  if (fault_) return;
+  if (const Result failed = writePending()) fail(*failed);
+}
+
+StoreWriter::Result StoreWriter::writePending() {
+  if (pending_.empty()) return std::nullopt;
+  if (!isInTransaction_) {
+    if (Result failed = database_.begin()) return failed;
+    isInTransaction_ = true;
+    if (Result failed = readInterest()) return failed;
+  }
+  try {
+    for (; written_.batch < pending_.size(); ++written_.batch, written_.operation = 0) {
+      StoreBatch& batch = pending_[written_.batch];
+      for (; written_.operation < batch.size(); ++written_.operation) {
+        if (Result failed = write(batch[written_.operation])) return failed;
+        if (Result failed = writeRows(/*evenIfFew=*/false)) return failed;
+      }
+    }
+    return writeRows(/*evenIfFew=*/true);
+  } catch (const std::bad_alloc&) {
+    return StoreFault{StoreFault::Kind::kTransient, SQLITE_NOMEM, "out of memory"};
+  }
+}
+
+StoreWriter::Result StoreWriter::write(StoreOperation& operation) {
+  const std::int64_t time = operation.time;
+  return std::visit(
+      Overloaded{[&](SessionMessage& message) -> Result {
+                   if (Result failed = insertSession(*message.session)) return failed;
+                   rows_.messages.push_back({message.session->row, RowText(), RowText(),
+                                             message.category, message.type,
+                                             json(message.payload), time});
+                   return std::nullopt;
+                 },
+                 [&](AnalyticsEvent& event) { return write(operation, event); },
+                 [&](LoneMessage& message) -> Result {
+                   rows_.messages.push_back({std::nullopt, json(message.sessionInfo),
+                                             json(message.userInfo), message.category,
+                                             message.type, json(message.payload), time});
+                   return std::nullopt;
+                 },
+                 [&](PowerEvent& event) { return write(time, event); },
+                 [&](SessionBegin& begin) { return insertSession(*begin.session); },
+                 [&](SessionFlush& flush) -> Result {
+                   if (Result failed = insertSession(*flush.session)) return failed;
+                   return database_.setFlushedAt(flush.session->row, time);
+                 },
+                 [&](SessionEnd& end) -> Result {
+                   if (Result failed = insertSession(*end.session)) return failed;
+                   return database_.setEndedAt(end.session->row, time);
+                 }},
+      operation.what);
+}
+
+StoreWriter::Result StoreWriter::write(StoreOperation& operation, AnalyticsEvent& event) {
+  if (event.provider) {
+    const AnalyticsSink::PayloadProvider provider = std::move(event.provider);
+    event.provider = nullptr;
+    if (!wants(event.name)) return std::nullopt;
+    try {
+      event.payload = provider();
+    } catch (...) {
+      counters_.droppedAnalytics.fetch_add(1, std::memory_order_relaxed);
+      OSTREL_LOG_ERROR(processLogScope, "no payload for the analytics event %@",
+                       event.name);
+    }
+    if (event.payload) uncommittedBytes_ += event.payload->owner().size();
+  }
+  if (!event.payload) return std::nullopt;
+  AnalyticsRow row;
+  row.name = {rows_.text.size(), event.name.size(), /*isThere=*/true};
+  rows_.text += event.name;
+  row.payload = json(*event.payload);
+  row.createdAt = operation.time;
+  rows_.analytics.push_back(row);
+  return std::nullopt;
+}
+
+StoreWriter::Result StoreWriter::write(std::int64_t time, const PowerEvent& event) {
+  text_.clear();
+  appendLenientJSON(text_, event.event);
+  const std::size_t end = text_.size();
+  if (event.attachment) appendLenientJSON(text_, *event.attachment);
+  const std::string_view text(text_);
+  StoreDatabase::PowerRow row;
+  row.clientID = event.clientID;
+  row.name = event.name;
+  row.event = text.substr(0, end);
+  if (event.attachment) row.attachment = text.substr(end);
+  row.createdAt = time;
+  return database_.insertPowerEvent(row);
+}
+
+StoreWriter::Result StoreWriter::insertSession(StoreSession& session) {
+  if (session.row != 0 && session.file == file_) return std::nullopt;
+  text_.clear();
+  appendLenientJSON(text_, session.sessionInfo);
+  const std::size_t end = text_.size();
+  appendLenientJSON(text_, session.userInfo);
+  const std::string_view text(text_);
+  StoreDatabase::SessionRow row;
+  if (const auto id = session.sessionInfo.find(kTelvarSessionInfoSessionID)) {
+    row.reporterID = id->signedInteger();
+  }
+  if (const auto token = session.sessionInfo.find(kTelvarSessionInfoHierarchyToken)) {
+    row.hierarchyToken = token->string();
+  }
+  row.sessionInfo = text.substr(0, end);
+  row.userInfo = text.substr(end);
+  row.startedAt = session.startedAt;
+  if (Result failed = database_.insertSession(row, session.row)) {
+    session.row = 0;
+    return failed;
+  }
+  session.file = file_;
+  uncommittedSessions_.push_back(&session);
+  return std::nullopt;
+}
+
+RowText StoreWriter::json(const Dictionary& value) {
+  const std::size_t begin = rows_.text.size();
+  appendLenientJSON(rows_.text, value);
+  return {begin, rows_.text.size() - begin, /*isThere=*/true};
+}
+
+StoreWriter::Result StoreWriter::writeRows(bool evenIfFew) {
+  const std::size_t count = rows_.messages.size() + rows_.analytics.size();
+  if (count == 0) return std::nullopt;
+  if (!evenIfFew && count < kRowsAtOnce && rows_.text.size() < kTextAtOnce) {
+    return std::nullopt;
+  }
+  const Result failed = database_.insertRows(rows_);
+  rows_.clear();
+  return failed;
+}
+
+std::vector<StoreBatch> StoreWriter::commit() {
+  if (fault_ || pending_.empty()) return {};
+  DoubtfulCommit made{0, pending_.size(), {}};
+  Result failed = writeStatus();
+  if (!failed) failed = database_.readFingerprint(made.fingerprint);
+  if (failed) {
+    fail(*failed);
+    return {};
+  }
+  failed = database_.commit();
+  if (!failed && !database_.isInPlace()) {
+    failed = StoreFault{StoreFault::Kind::kTransient, SQLITE_IOERR,
+                        "the store's file was moved or removed"};
+  }
+  if (failed) {
+    for (StoreSession* session : uncommittedSessions_) {
+      made.rows.emplace_back(session, session->row);
+    }
+    doubt_ = std::move(made);
+    fail(*failed);
+    return {};
+  }
+  isInTransaction_ = false;
+  uncommittedSessions_.clear();
+  return takeDone(pending_.size());
+}
+
+// Completes the flushes of the first batches and takes these out, emptied.
+std::vector<StoreBatch> StoreWriter::takeDone(std::size_t batches) {
+  std::vector<StoreBatch> done;
+  done.swap(pending_);
+  pending_.assign(
+      std::make_move_iterator(done.begin() + static_cast<std::ptrdiff_t>(batches)),
+      std::make_move_iterator(done.end()));
+  done.resize(batches);
+  written_ = {};
+  std::uint64_t rows = 0;
+  for (StoreBatch& batch : done) {
+    for (StoreOperation& operation : batch) {
+      uncommittedBytes_ -= std::min(uncommittedBytes_, operation.bytes());
+      if (isRow(operation)) ++rows;
+      auto* flush = std::get_if<SessionFlush>(&operation.what);
+      if (flush != nullptr && flush->completion) {
+        std::exchange(flush->completion, nullptr)(std::nullopt);
+      }
+    }
+    batch.clear();
+  }
+  counters_.written.fetch_add(rows, std::memory_order_relaxed);
+  return done;
+}
+
+StoreWriter::Result StoreWriter::writeStatus() {
+  const struct {
+    const char* key;
+    std::uint64_t value;
+  } rare[] = {
+      {"refused", counters_.refused.load(std::memory_order_relaxed)},
+      {"lost", counters_.lost.load(std::memory_order_relaxed)},
+      {"dropped_analytics", counters_.droppedAnalytics.load(std::memory_order_relaxed)},
+      {"dropped_power", counters_.droppedPower.load(std::memory_order_relaxed)},
+      {"failures", counters_.failures.load(std::memory_order_relaxed)},
+      {"set_aside", counters_.setAside.load(std::memory_order_relaxed)},
+  };
+  std::uint64_t sum = 1;
+  for (const auto& [key, value] : rare) sum += value;
+  if (sum == writtenStatus_) return std::nullopt;
+  for (const auto& [key, value] : rare) {
+    if (Result failed = database_.setStatus(key, static_cast<std::int64_t>(value))) {
+      return failed;
+    }
+  }
+  writtenStatus_ = sum;
+  return std::nullopt;
+}
+
+StoreWriter::Result StoreWriter::readInterest() {
+  std::optional<std::vector<std::string>> patterns;
+  if (Result failed = database_.readInterestIfChanged(patterns)) return failed;
+  if (!patterns) return std::nullopt;
+  wantedPatterns_ = std::move(*patterns);
+  wantedNames_.clear();
+  wantsAll_ = false;
+  for (const std::string& pattern : wantedPatterns_) wantsAll_ |= pattern == "*";
+  return std::nullopt;
+}
+
+bool StoreWriter::wants(const std::string& name) {
+  if (wantsAll_) return true;
+  if (const auto known = wantedNames_.find(name); known != wantedNames_.end()) {
+    return known->second;
+  }
+  bool isWanted = false;
+  for (const std::string& pattern : wantedPatterns_) {
+    isWanted |= StoreDatabase::matches(pattern, name);
+  }
+  if (wantedNames_.size() < kKnownNames) wantedNames_.emplace(name, isWanted);
+  return isWanted;
+}
+
+void StoreWriter::fail(const StoreFault& fault) {
+  counters_.failures.fetch_add(1, std::memory_order_relaxed);
+  rollback();
+  fault_ = fault;
+  if (loggedFault_ != fault.description) {
+    OSTREL_LOG_ERROR(processLogScope, "the store cannot be used: %@", fault.description);
+    loggedFault_ = fault.description;
+  }
+  switch (fault.code & 0xFF) {
+    case SQLITE_FULL:
+    case SQLITE_BUSY:
+    case SQLITE_LOCKED:
+    case SQLITE_NOMEM:
+      break;  // The connection is sound.
+    default:
+      database_.close();
+      break;
+  }
+  if (fault.kind == StoreFault::Kind::kDamaged) {
+    if (!database_.setAside(fault.description)) {
+      counters_.setAside.fetch_add(1, std::memory_order_relaxed);
+    }
+  }
+  failFlushes();
+}
+
+void StoreWriter::rollback() {
+  database_.rollback();
+  isInTransaction_ = false;
+  written_ = {};
+  rows_.clear();
+  writtenStatus_ = 0;
+  for (StoreSession* session : uncommittedSessions_) session->row = 0;
+  uncommittedSessions_.clear();
+}
+
+void StoreWriter::failFlushes() {
+  if (!fault_) return;
+  const ErrorObject error = errorOf(*fault_);
+  for (StoreBatch& batch : pending_) {
+    for (StoreOperation& operation : batch) {
+      auto* flush = std::get_if<SessionFlush>(&operation.what);
+      if (flush != nullptr && flush->completion) {
+        std::exchange(flush->completion, nullptr)(error);
+      }
+    }
+  }
+}
+
+void StoreWriter::keepAtMost(std::size_t count) {
+  std::size_t kept = 0;
+  for (const StoreBatch& batch : pending_) kept += batch.size();
+  std::size_t batches = 0;
+  for (; kept > count && batches < pending_.size(); ++batches) {
+    kept -= pending_[batches].size();
+    counters_.lost.fetch_add(pending_[batches].size(), std::memory_order_relaxed);
+  }
+  if (batches == 0) return;
+  doubt_.reset();
+  pending_.erase(pending_.begin(),
+                 pending_.begin() + static_cast<std::ptrdiff_t>(batches));
+  uncommittedBytes_ = 0;
+  for (const StoreBatch& batch : pending_) {
+    for (const StoreOperation& operation : batch) uncommittedBytes_ += operation.bytes();
+  }
+}
+
+ErrorObject StoreWriter::errorOf(const StoreFault& fault) {
+  return {std::string(kOstrelErrorDomain), fault.code, fault.description};
+}
+
+}  // namespace ostrel

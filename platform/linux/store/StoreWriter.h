@@ -1,0 +1,113 @@
+#pragma once
+
+#include <cstdint>
+#include <functional>
+#include <optional>
+#include <string>
+#include <unordered_map>
+#include <utility>
+#include <vector>
+
+#include "platform/linux/store/StoreCounters.h"
+#include "platform/linux/store/StoreDatabase.h"
+#include "platform/linux/store/StoreOperation.h"
+
+namespace ostrel {
+
+/// Writes operations to the database and bears its faults. What was handed over
+/// is kept until a commit made it durable; after a fault it is written again.
+/// One thread at a time.
+class StoreWriter {
+ public:
+  /// Microseconds since 1970.
+  using Now = std::function<std::int64_t()>;
+
+  StoreWriter(std::string path, const char* vfs, Now now, StoreCounters& counters);
+
+  /// Opens the database, or opens it again, and writes what is not durable yet. A
+  /// damaged file is set aside and a new one begun.
+  void recover();
+
+  /// What keeps the store from being used; none when nothing does.
+  const std::optional<StoreFault>& fault() const { return fault_; }
+
+  /// Takes operations over and, unless there is a fault, writes them into the open
+  /// transaction.
+  void add(std::vector<StoreBatch> batches);
+
+  /// Makes what was added durable and calls the completions of its flushes; on a
+  /// fault calls these with an error. Gives the batches back, emptied.
+  std::vector<StoreBatch> commit();
+
+  /// Whether there is anything to commit.
+  bool hasUncommitted() const { return !pending_.empty(); }
+  std::size_t uncommittedBytes() const { return uncommittedBytes_; }
+
+  /// Calls the completions of the flushes that wait with the fault's error.
+  void failFlushes();
+
+  /// Gives up the oldest operations so that at most `count` are kept. Only during
+  /// a fault.
+  void keepAtMost(std::size_t count);
+
+  /// As a message for clients.
+  static ErrorObject errorOf(const StoreFault& fault);
+
+  void close() { database_.close(); }
+
+ private:
+  using Result = StoreDatabase::Result;
+
+  struct Position {
+    std::size_t batch = 0;
+    std::size_t operation = 0;
+  };
+
+  // A commit that failed and may have been made all the same.
+  struct DoubtfulCommit {
+    std::int64_t fingerprint;  // Of the store with it.
+    std::size_t batches;       // At the front of `pending_`.
+    std::vector<std::pair<StoreSession*, std::int64_t>> rows;
+  };
+
+  Result openOrReplace();
+  Result resolveDoubt();
+  std::vector<StoreBatch> takeDone(std::size_t batches);
+  Result writePending();
+  Result write(StoreOperation& operation);
+  Result write(StoreOperation& operation, AnalyticsEvent& event);
+  Result write(std::int64_t time, const PowerEvent& event);
+  Result insertSession(StoreSession& session);
+  Result writeRows(bool evenIfFew);
+  Result writeStatus();
+  Result readInterest();
+  bool wants(const std::string& name);
+  void fail(const StoreFault& fault);
+  void rollback();
+
+  RowText json(const Dictionary& value);
+
+  StoreDatabase database_;
+  const Now now_;
+  StoreCounters& counters_;
+
+  std::optional<StoreFault> fault_;
+  std::string loggedFault_;
+  std::uint64_t file_ = 0;  // Counts the files opened, so that rows of others are known.
+
+  std::vector<StoreBatch> pending_;
+  Position written_;  // What comes before it is in the open transaction.
+  bool isInTransaction_ = false;
+  std::size_t uncommittedBytes_ = 0;
+  std::vector<StoreSession*> uncommittedSessions_;
+  std::optional<DoubtfulCommit> doubt_;
+  RowBatch rows_;
+  std::string text_;
+
+  bool wantsAll_ = false;
+  std::vector<std::string> wantedPatterns_;
+  std::unordered_map<std::string, bool> wantedNames_;
+  std::uint64_t writtenStatus_ = 0;
+};
+
+}  // namespace ostrel
