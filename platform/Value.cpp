@@ -273,6 +273,10 @@ std::optional<DictionaryView> ValueView::dictionary() const {
   return DictionaryView(head.next, head.argument);
 }
 
+DictionaryView ValueView::entries() const {
+  return dictionary().value_or(DictionaryView(/*first=*/nullptr, /*size=*/0));
+}
+
 std::optional<double> ValueView::number() const {
   const Head head = readHead(item_);
   if (head.majorType == kUnsigned || head.majorType == kNegative) {

@@ -119,6 +119,9 @@ class ValueView {
   std::optional<ArrayView> array() const;
   std::optional<DictionaryView> dictionary() const;
 
+  /// What `dictionary` holds, for a loop over it; nothing for the other kinds.
+  DictionaryView entries() const;
+
   /// A boolean, integer or double as a double; none for the other kinds.
   std::optional<double> number() const;
 

@@ -24,8 +24,7 @@ class Grouping {
            const OstrelReportingAggregatedPayloads::Snapshot& entries) {
     add(firstKey, firstValue);
     entries.forEach([this](ValueView entry) {
-      const DictionaryView dictionary = *entry.dictionary();
-      for (const auto& [key, value] : dictionary) add(key, value);
+      for (const auto& [key, value] : entry.entries()) add(key, value);
     });
   }
 
