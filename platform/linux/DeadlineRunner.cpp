@@ -6,6 +6,8 @@
 #include <system_error>
 #include <thread>
 
+#include "platform/linux/Threads.h"
+
 namespace ostrel {
 
 // A helper holds the state, so that one that hangs may outlive the runner.
@@ -23,7 +25,7 @@ struct DeadlineRunner::State {
     if (idle > jobs.size()) return true;
     if (threads == mostThreads) return false;
     try {
-      std::thread([self] { self->help(); }).detach();
+      startThread("deadline", /*niceness=*/0, [self] { self->help(); }).detach();
     } catch (const std::system_error&) {
       return false;
     }
@@ -80,7 +82,7 @@ DeadlineRunner::Result DeadlineRunner::run(std::function<void()> call,
                                            std::chrono::nanoseconds timeout) {
   State& state = *state_;
   std::unique_lock lock(state.mutex);
-  if (!state.hasHelper(state_)) return Result::kNoHelper;
+  if (!state.hasHelper(state_)) return Result::kNotRun;
   const auto job = std::make_shared<State::Job>();
   job->call = std::move(call);
   state.jobs.push_back(job);
@@ -91,7 +93,7 @@ DeadlineRunner::Result DeadlineRunner::run(std::function<void()> call,
       return Result::kDone;
     case State::Step::kWaiting:
       std::erase(state.jobs, job);
-      return Result::kNoHelper;
+      return Result::kNotRun;
     default:
       job->step = State::Step::kOverrunning;
       ++state.overrunning;

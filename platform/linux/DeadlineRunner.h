@@ -22,7 +22,7 @@ class DeadlineRunner {
   enum class Result {
     kDone,
     kOverrun,  // It still runs.
-    kNoHelper  // Not run: every helper hangs, or none can be started.
+    kNotRun    // Every helper hangs or none can be started. It never will.
   };
 
   /// Runs `call`, which must not throw, and waits for it at most `timeout`. Any

@@ -4,7 +4,6 @@
 #include <poll.h>
 #include <sys/eventfd.h>
 #include <sys/inotify.h>
-#include <sys/prctl.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -19,6 +18,7 @@
 
 #include "platform/Logging.h"
 #include "platform/linux/Places.h"
+#include "platform/linux/Threads.h"
 
 namespace ostrel {
 namespace {
@@ -89,7 +89,7 @@ int InotifyChangeNotification::start() {
   makeDirectory(directory_);
   if (!watch()) return errno;
   try {
-    thread_ = std::thread([this] { run(); });
+    thread_ = startThread("notifications", /*niceness=*/0, [this] { run(); });
   } catch (const std::system_error& error) {
     return error.code().value();
   }
@@ -102,7 +102,6 @@ bool InotifyChangeNotification::watch() {
 }
 
 void InotifyChangeNotification::run() {
-  ::prctl(PR_SET_NAME, "notifications");
   for (;;) {
     pollfd descriptors[] = {{inotify_.get(), POLLIN, 0}, {stopEvent_.get(), POLLIN, 0}};
     ::poll(descriptors, std::size(descriptors), waitMilliseconds());

@@ -11,6 +11,7 @@
 #include <system_error>
 
 #include "platform/Logging.h"
+#include "platform/linux/Threads.h"
 
 namespace ostrel {
 namespace {
@@ -108,7 +109,7 @@ void JournalLog::drainSome() {
 void JournalLog::startWriter() {
   if (!writer_.joinable() && !isStopping_) {
     try {
-      writer_ = std::thread([this] { runWriter(); });
+      writer_ = startThread("log", /*niceness=*/0, [this] { runWriter(); });
     } catch (const std::system_error&) {
       drainSome();  // The next line tries again to start the thread.
     }
