@@ -9,6 +9,7 @@
 #include <cmath>
 #include <cstring>
 #include <memory_resource>
+#include <vector>
 
 namespace ostrel {
 namespace {
@@ -150,8 +151,17 @@ class Output {
 
 enum Code { kNotFinite = 1, kKeyIsNotText = 2, kDateOutOfRange = 3 };
 
-ErrorObject makeError(Code code, std::string_view description) {
-  return {std::string(kGeneralErrorDomain), code, std::string(description)};
+ErrorObject makeError(Code code) {
+  constexpr const char* kThings[] = {"", "a number that is not finite",
+                                     "a key that is not text",
+                                     "a date outside the years 0000 to 9999"};
+  return {std::string(kGeneralErrorDomain), code,
+          std::string(kThings[code]) + " has no form in JSON"};
+}
+
+// What is wrong with a date that has no ISO 8601 text.
+Code codeOf(Date date) {
+  return std::isfinite(date.secondsSince1970) ? kDateOutOfRange : kNotFinite;
 }
 
 class Writer {
@@ -216,7 +226,7 @@ class Writer {
       integer(head);
       output_.character('"');
     } else {
-      error_ = makeError(kKeyIsNotText, "a key that is not text has no form in JSON");
+      error_ = makeError(kKeyIsNotText);
     }
     output_.character(':');
     if (isPretty_) output_.character(' ');
@@ -276,7 +286,7 @@ class Writer {
     if (std::isfinite(number)) {
       output_.floatingPoint(number);
     } else if (!isLenient_) {
-      error_ = makeError(kNotFinite, "a number that is not finite has no form in JSON");
+      error_ = makeError(kNotFinite);
     } else {
       output_.quoted(std::isnan(number) ? "NaN" : number < 0 ? "-Infinity" : "Infinity");
     }
@@ -286,11 +296,10 @@ class Writer {
     const std::string text = iso8601(date);
     if (!text.empty()) {
       output_.quoted(text);
-    } else if (isLenient_ || !std::isfinite(date.secondsSince1970)) {
+    } else if (isLenient_) {
       number(date.secondsSince1970);
     } else {
-      error_ = makeError(kDateOutOfRange,
-                         "a date outside the years 0000 to 9999 has no form in JSON");
+      error_ = makeError(codeOf(date));
     }
   }
 
@@ -308,6 +317,50 @@ class Writer {
 };
 
 }  // namespace
+
+std::optional<ErrorObject> findJSONError(ValueView value) {
+  struct Open {
+    std::uint64_t left;  // Keys and values both count.
+    bool isDictionary;
+  };
+  std::vector<Open> open;
+  const std::uint8_t* at = value.data();
+  for (;;) {
+    const ValueView item(at);
+    const Head head = readHead(at);
+    const bool isKey =
+        !open.empty() && open.back().isDictionary && open.back().left % 2 == 1;
+    if (isKey && head.majorType != kText) return makeError(kKeyIsNotText);
+    at = head.next;
+    switch (head.majorType) {
+      case kUnsigned:
+      case kNegative:
+        break;
+      case kText:
+        at += head.argument;
+        break;
+      case kArrayType:
+        open.push_back({head.argument, /*isDictionary=*/false});
+        break;
+      case kMapType:
+        open.push_back({2 * head.argument, /*isDictionary=*/true});
+        break;
+      case kTag: {
+        if (iso8601(*item.date()).empty()) return makeError(codeOf(*item.date()));
+        at = readHead(at).next;
+        break;
+      }
+      default: {
+        const auto number = item.floatingPoint();
+        if (number && !std::isfinite(*number)) return makeError(kNotFinite);
+        break;
+      }
+    }
+    while (!open.empty() && open.back().left == 0) open.pop_back();
+    if (open.empty()) return std::nullopt;
+    --open.back().left;
+  }
+}
 
 std::optional<ErrorObject> appendJSON(std::string& out, ValueView value,
                                       JSONLayout layout, JSONStrictness strictness,

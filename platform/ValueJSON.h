@@ -25,4 +25,8 @@ std::optional<ErrorObject> appendJSON(std::string& out, ValueView value,
                                       JSONLayout layout, JSONStrictness strictness,
                                       int indent);
 
+/// The error that `appendJSON` with `kError` would give, found without making the
+/// text. Safe at any nesting.
+std::optional<ErrorObject> findJSONError(ValueView value);
+
 }  // namespace ostrel

@@ -32,6 +32,7 @@ std::optional<ErrorObject> errorOf(const Value& value) {
   auto error = appendJSON(out, value, JSONLayout::kCompact, JSONStrictness::kError,
                           /*indent=*/0);
   EXPECT_EQ(out, "before");
+  EXPECT_EQ(findJSONError(value), error);
   return error;
 }
 
@@ -130,6 +131,9 @@ TEST(ValueJSON, RefusesWhatJSONCannotSay) {
   EXPECT_TRUE(errorOf(Value(Date{1e12})));
   EXPECT_TRUE(errorOf(withIntegerKey()));
   EXPECT_TRUE(errorOf(Value(Dictionary{{"deep", withIntegerKey()}})));
+  EXPECT_TRUE(errorOf(Value(Dictionary{
+      {"a", Value(Dictionary{{"b", Value(ArrayBuilder().append(Value(1)).build())}})},
+      {"c", Value(kNaN)}})));
 }
 
 TEST(ValueJSON, LenientlyWritesSubstitutes) {
@@ -222,6 +226,7 @@ TEST(ValueJSON, IsReadBackTheSameByAnotherLibrary) {
   for (int i = 0; i < 20000; ++i) {
     const auto [value, same] = values.make(/*depth=*/4);
     ASSERT_EQ(nlohmann::json::parse(compact(value)), same);
+    ASSERT_EQ(findJSONError(value), std::nullopt);
     std::string pretty;
     appendJSON(pretty, value, JSONLayout::kPretty, JSONStrictness::kError, /*indent=*/0);
     ASSERT_EQ(nlohmann::json::parse(pretty), same);
