@@ -1,0 +1,308 @@
+#include "platform/linux/ThreadPoolWorkQueues.h"
+
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+#include <pthread.h>
+#include <signal.h>
+#include <sys/resource.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <fstream>
+#include <mutex>
+#include <semaphore>
+#include <thread>
+
+namespace ostrel {
+namespace {
+
+using std::chrono::steady_clock;
+
+/// Holds a step back until it is opened.
+class Gate {
+ public:
+  Task holdingStep() {
+    return [this] {
+      entered_.release();
+      open_.acquire();
+    };
+  }
+  void waitUntilHolding() { entered_.acquire(); }
+  void open() { open_.release(); }
+
+ private:
+  std::counting_semaphore<> entered_{0};
+  std::counting_semaphore<> open_{0};
+};
+
+class ThreadPoolWorkQueuesTest : public testing::Test {
+ protected:
+  std::shared_ptr<WorkQueue> makeQueue(
+      QualityOfService qualityOfService = QualityOfService::kUtility,
+      int relativePriority = 0) {
+    return queues_->makeSerialQueue("test", qualityOfService, relativePriority);
+  }
+
+  bool drain() { return queues_->drain(steady_clock::now() + std::chrono::seconds(30)); }
+
+  std::unique_ptr<ThreadPoolWorkQueues> queues_ =
+      std::make_unique<ThreadPoolWorkQueues>(std::make_shared<TimerThread>());
+};
+
+TEST_F(ThreadPoolWorkQueuesTest, HasNoThreadUntilAStepNeedsOne) {
+  const auto queue = makeQueue();
+  EXPECT_EQ(queues_->threadCount(), 0u);
+  queue->async([] {});
+  ASSERT_TRUE(drain());
+  EXPECT_EQ(queues_->threadCount(), 1u);
+}
+
+TEST_F(ThreadPoolWorkQueuesTest, HasAFewThreadsForAnyNumberOfQueues) {
+  std::vector<std::shared_ptr<WorkQueue>> all;
+  std::atomic<int> count{0};
+  for (const auto quality : {QualityOfService::kUserInteractive,
+                             QualityOfService::kUtility, QualityOfService::kBackground}) {
+    for (int i = 0; i < 1000; ++i) {
+      all.push_back(makeQueue(quality));
+      all.back()->async([&count] { ++count; });
+    }
+  }
+  ASSERT_TRUE(drain());
+  EXPECT_EQ(count, 3000);
+  EXPECT_LE(queues_->threadCount(), ThreadPoolWorkQueues::kMostInteractiveThreads +
+                                        ThreadPoolWorkQueues::kMostUtilityThreads +
+                                        ThreadPoolWorkQueues::kMostBackgroundThreads);
+}
+
+TEST_F(ThreadPoolWorkQueuesTest, RunsTwoQueuesOfAClassAtOnce) {
+  Gate gate;
+  std::binary_semaphore ran{0};
+  const auto blocked = makeQueue();
+  const auto other = makeQueue();
+  blocked->async(gate.holdingStep());
+  gate.waitUntilHolding();
+  other->async([&ran] { ran.release(); });
+  ran.acquire();
+  gate.open();
+  EXPECT_TRUE(drain());
+}
+
+TEST_F(ThreadPoolWorkQueuesTest, RunsFourBackgroundStepsAtOnce) {
+  Gate gate;
+  ConcurrentQueue& background = queues_->backgroundQueue();
+  for (std::size_t i = 0; i < ThreadPoolWorkQueues::kMostBackgroundThreads; ++i) {
+    background.asyncAfter(std::chrono::nanoseconds(0), gate.holdingStep());
+  }
+  for (std::size_t i = 0; i < ThreadPoolWorkQueues::kMostBackgroundThreads; ++i) {
+    gate.waitUntilHolding();
+  }
+  for (std::size_t i = 0; i < ThreadPoolWorkQueues::kMostBackgroundThreads; ++i) {
+    gate.open();
+  }
+  EXPECT_TRUE(drain());
+}
+
+TEST_F(ThreadPoolWorkQueuesTest, GivesEachClassItsNiceness) {
+  const int own = getpriority(PRIO_PROCESS, 0);
+  std::map<QualityOfService, int> nicenesses;
+  for (const auto quality : {QualityOfService::kUserInteractive,
+                             QualityOfService::kUtility, QualityOfService::kBackground}) {
+    makeQueue(quality)->async([&nicenesses, quality] {
+      nicenesses[quality] = getpriority(PRIO_PROCESS, static_cast<id_t>(gettid()));
+    });
+    ASSERT_TRUE(drain());
+  }
+  const auto expectNiceness = [&](QualityOfService quality, int wanted) {
+    // Only a privileged process may be less nice than its parent.
+    const int other = own > wanted ? own : wanted;
+    EXPECT_THAT(nicenesses[quality], testing::AnyOf(wanted, other));
+  };
+  expectNiceness(QualityOfService::kUserInteractive, -5);
+  expectNiceness(QualityOfService::kUtility, 5);
+  expectNiceness(QualityOfService::kBackground, 10);
+}
+
+TEST_F(ThreadPoolWorkQueuesTest, NamesItsThreads) {
+  std::string name(16, '\0');
+  makeQueue()->async(
+      [&name] { pthread_getname_np(pthread_self(), name.data(), name.size()); });
+  ASSERT_TRUE(drain());
+  EXPECT_STREQ(name.c_str(), "ostrel-util-1");
+}
+
+TEST_F(ThreadPoolWorkQueuesTest, TakesNoSignals) {
+  bool isBlocked = false;
+  makeQueue()->async([&isBlocked] {
+    sigset_t blocked;
+    pthread_sigmask(SIG_SETMASK, nullptr, &blocked);
+    isBlocked = sigismember(&blocked, SIGTERM) == 1 && sigismember(&blocked, SIGINT) == 1;
+  });
+  ASSERT_TRUE(drain());
+  EXPECT_TRUE(isBlocked);
+}
+
+TEST_F(ThreadPoolWorkQueuesTest, RunsQueuesOfALowerPriorityAfterTheOthers) {
+  Gate gate;
+  std::mutex mutex;
+  std::vector<std::string> seen;
+  const auto note = [&](const char* what) {
+    return [&, what] {
+      const std::lock_guard lock(mutex);
+      seen.push_back(what);
+    };
+  };
+  std::vector<std::shared_ptr<WorkQueue>> blocked;
+  for (std::size_t i = 0; i < ThreadPoolWorkQueues::kMostUtilityThreads; ++i) {
+    blocked.push_back(makeQueue());
+    blocked.back()->async(gate.holdingStep());
+    gate.waitUntilHolding();
+  }
+  const auto low = makeQueue(QualityOfService::kUtility, /*relativePriority=*/-1);
+  const auto normal = makeQueue();
+  const auto other = makeQueue();
+  low->async(note("low"));
+  normal->async(note("normal"));
+  other->async(note("other"));
+  gate.open();  // One thread works all three off.
+  while (true) {
+    const std::lock_guard lock(mutex);
+    if (seen.size() == 3) break;
+  }
+  for (std::size_t i = 1; i < blocked.size(); ++i) gate.open();
+  ASSERT_TRUE(drain());
+  EXPECT_EQ(seen, (std::vector<std::string>{"normal", "other", "low"}));
+}
+
+// Queues itself again until it is told to end.
+struct Endless {
+  std::shared_ptr<WorkQueue> queue;
+  std::atomic<bool>* isEnding;
+
+  void operator()() {
+    if (*isEnding) return;
+    for (int i = 0; i < 1000; ++i) queue->async([] {});
+    queue->async(Endless{queue, isEnding});
+  }
+};
+
+TEST_F(ThreadPoolWorkQueuesTest, LetsOtherQueuesTakeTurnsWithBusyOnes) {
+  std::atomic<bool> isEnding{false};
+  for (std::size_t i = 0; i < ThreadPoolWorkQueues::kMostUtilityThreads + 1; ++i) {
+    const auto busy = makeQueue();
+    busy->async(Endless{busy, &isEnding});
+  }
+  std::binary_semaphore ran{0};
+  makeQueue()->async([&ran] { ran.release(); });
+  ran.acquire();  // Never, were the busy ones to keep their threads.
+  isEnding = true;
+  EXPECT_TRUE(drain());
+}
+
+// How often the calling thread has gone to sleep so far.
+long sleepsOfThisThread() {
+  std::ifstream status("/proc/thread-self/status");
+  std::string line;
+  const std::string key = "voluntary_ctxt_switches:";
+  while (std::getline(status, line)) {
+    if (line.starts_with(key)) return std::stol(line.substr(key.size()));
+  }
+  return -1;
+}
+
+TEST_F(ThreadPoolWorkQueuesTest, WakesNobodyForStepsOfAQueueThatRunsAlready) {
+  Gate gate;
+  const auto queue = makeQueue();
+  long before = 0;
+  long after = 0;
+  pid_t firstThread = 0;
+  bool isOneThread = true;
+  queue->async(gate.holdingStep());
+  gate.waitUntilHolding();
+  queue->async([&] {
+    before = sleepsOfThisThread();
+    firstThread = gettid();
+  });
+  for (int i = 0; i < 100000; ++i) {
+    queue->async([&] { isOneThread = isOneThread && gettid() == firstThread; });
+  }
+  queue->async([&] { after = sleepsOfThisThread(); });
+  EXPECT_EQ(queues_->threadCount(), 1u);
+  gate.open();
+  ASSERT_TRUE(drain());
+  EXPECT_TRUE(isOneThread);
+  ASSERT_GE(before, 0);
+  EXPECT_LE(after - before, 5);  // A page fault may put it to sleep.
+}
+
+TEST_F(ThreadPoolWorkQueuesTest, GivesUpDrainingAtTheDeadline) {
+  Gate gate;
+  makeQueue()->async(gate.holdingStep());
+  gate.waitUntilHolding();
+  EXPECT_FALSE(queues_->drain(steady_clock::now()));
+  gate.open();
+  EXPECT_TRUE(drain());
+}
+
+TEST_F(ThreadPoolWorkQueuesTest, DrainsWhatStepsOfOneClassQueueOnAnother) {
+  std::atomic<int> count{0};
+  const auto server = makeQueue(QualityOfService::kUserInteractive);
+  const auto session = makeQueue(QualityOfService::kUtility);
+  for (int i = 0; i < 1000; ++i) {
+    server->async([&] {
+      session->async([&] {
+        queues_->backgroundQueue().asyncAfter(std::chrono::nanoseconds(0),
+                                              [&] { ++count; });
+      });
+    });
+  }
+  ASSERT_TRUE(drain());
+  EXPECT_EQ(count, 1000);
+}
+
+TEST_F(ThreadPoolWorkQueuesTest, RunsWhatIsQueuedBeforeItEnds) {
+  std::atomic<int> count{0};
+  const auto queue = makeQueue();
+  for (int i = 0; i < 10000; ++i) queue->async([&count] { ++count; });
+  queues_.reset();
+  EXPECT_EQ(count, 10000);
+}
+
+TEST_F(ThreadPoolWorkQueuesTest, DropsStepsThatAreQueuedAfterItsEnd) {
+  bool ran = false;
+  auto held = std::make_shared<int>(0);
+  const std::weak_ptr<int> watch = held;
+  const auto queue = makeQueue();
+  queue->async([] {});
+  queues_.reset();
+  queue->async([&ran, held = std::move(held)] { ran = true; });
+  EXPECT_TRUE(watch.expired());
+  EXPECT_FALSE(ran);
+}
+
+TEST_F(ThreadPoolWorkQueuesTest, MayEndInsideAStepOfItsOwn) {
+  std::binary_semaphore ended{0};
+  const auto queue = makeQueue();
+  queue->async([this, &ended] {
+    queues_.reset();
+    ended.release();
+  });
+  ended.acquire();
+  EXPECT_EQ(queues_, nullptr);
+}
+
+TEST_F(ThreadPoolWorkQueuesTest, KeepsItsTimerThread) {
+  std::binary_semaphore ran{0};
+  queues_->backgroundQueue().asyncAfter(std::chrono::milliseconds(1),
+                                        [&ran] { ran.release(); });
+  ran.acquire();
+}
+
+TEST_F(ThreadPoolWorkQueuesTest, HoldsNoReferenceToAnIdleQueue) {
+  const auto queue = makeQueue();
+  queue->async([] {});
+  ASSERT_TRUE(drain());
+  EXPECT_EQ(queue.use_count(), 1);
+}
+
+}  // namespace
+}  // namespace ostrel
