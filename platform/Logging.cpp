@@ -61,26 +61,46 @@ std::size_t sequenceLength(std::string_view text) {
   return 0;
 }
 
+// Whether the well-formed sequence at the start of `text` may end a line or
+// command a terminal: a control character, or a line separator.
+bool isControl(std::string_view text) {
+  const auto first = static_cast<unsigned char>(text.front());
+  if (first < 0x20 || first == 0x7F) return true;
+  if (first == 0xC2) return static_cast<unsigned char>(text[1]) < 0xA0;
+  return text.starts_with("\xE2\x80\xA8") || text.starts_with("\xE2\x80\xA9");
+}
+
+void appendEscape(std::string& out, char byte) {
+  if (byte == '\n') {
+    out += "\\n";
+    return;
+  }
+  constexpr std::string_view kDigits = "0123456789abcdef";
+  const auto code = static_cast<unsigned char>(byte);
+  out += {'\\', 'x', kDigits[code >> 4], kDigits[code & 0xF]};
+}
+
 void appendEscaped(std::string& out, std::string_view text) {
+  constexpr std::string_view kCut = "...";
   const std::size_t limit = out.size() + kMostArgumentBytes;
+  std::size_t cut = out.size();  // As far as the text goes when it is cut.
   while (!text.empty()) {
-    if (out.size() + 4 > limit) {
-      out += "...";
-      return;
-    }
-    const auto byte = static_cast<unsigned char>(text.front());
     std::size_t length = sequenceLength(text);
-    if (byte == '\n') {
-      out += "\\n";
-    } else if (length == 0 || byte < 0x20 || byte == 0x7F) {
-      std::array<char, 5> escape{};
-      std::snprintf(escape.data(), escape.size(), "\\x%02x", byte);
-      out += escape.data();
+    if (length == 0) {
       length = 1;
+      appendEscape(out, text.front());
+    } else if (isControl(text)) {
+      for (const char byte : text.substr(0, length)) appendEscape(out, byte);
     } else {
       out += text.substr(0, length);
     }
     text.remove_prefix(length);
+    if (out.size() > limit) {
+      out.resize(cut);
+      out += kCut;
+      return;
+    }
+    if (out.size() + kCut.size() <= limit) cut = out.size();
   }
 }
 
