@@ -420,7 +420,7 @@ Array::Array() : item_(&kEmptyArray) {}
 
 std::optional<Array> Array::from(const Value& value) {
   if (value->kind() != ValueKind::kArray) return std::nullopt;
-  return Array(value.owner(), value->bytes().data());
+  return Array(value.owner(), value->data());
 }
 
 Dictionary::Dictionary() : item_(&kEmptyMap) {}
@@ -434,7 +434,7 @@ Dictionary::Dictionary(std::initializer_list<std::pair<std::string_view, Value>>
 
 std::optional<Dictionary> Dictionary::from(const Value& value) {
   if (value->kind() != ValueKind::kDictionary) return std::nullopt;
-  return Dictionary(value.owner(), value->bytes().data());
+  return Dictionary(value.owner(), value->data());
 }
 
 Dictionary Dictionary::copyOf(std::string_view encoded) {
@@ -616,13 +616,12 @@ void appendDescription(std::string& out, ValueView value) {
   const auto enter = [&](ValueView item) {
     if (auto array = item.array()) {
       out += '[';
-      open.push_back({array->empty() ? nullptr : (*array->begin()).bytes().data(),
-                      array->size(), /*isDictionary=*/false});
+      open.push_back({array->empty() ? nullptr : (*array->begin()).data(), array->size(),
+                      /*isDictionary=*/false});
     } else if (auto dictionary = item.dictionary()) {
       out += '{';
-      open.push_back(
-          {dictionary->empty() ? nullptr : (*dictionary->begin()).key.bytes().data(),
-           2 * dictionary->size(), /*isDictionary=*/true});
+      open.push_back({dictionary->empty() ? nullptr : (*dictionary->begin()).key.data(),
+                      2 * dictionary->size(), /*isDictionary=*/true});
     } else {
       appendScalarDescription(out, item);
     }
