@@ -22,6 +22,7 @@ const MessageType kType{0};
 class OstrelReportingBlockThrottleTest : public CoreTest {
  protected:
   OstrelReportingBlockThrottleTest() : begin_(fakes.clock->monotonicNow()) {}
+  ~OstrelReportingBlockThrottleTest() override { runLoops->endThreads(); }
 
   void add(const std::string& name, const Dictionary& payload) {
     throttle->addMessageBlock([this, name] { runs.emplace_back(name, sinceBegin()); },

@@ -70,12 +70,14 @@ class ManualRunLoopFactory::Turns {
 
   /// Ends every thread.
   void end() {
+    std::vector<std::thread> threads;
     {
       const std::lock_guard lock(mutex_);
       isEnding_ = true;
       changed_.notify_all();
+      threads.swap(threads_);
     }
-    for (std::thread& thread : threads_) thread.join();
+    for (std::thread& thread : threads) thread.join();
   }
 
  private:
@@ -203,7 +205,9 @@ std::shared_ptr<ManualRunLoopFactory::Timer> ManualRunLoopFactory::Loop::next() 
 ManualRunLoopFactory::ManualRunLoopFactory(std::shared_ptr<ManualClock> clock)
     : clock_(std::move(clock)), turns_(std::make_shared<Turns>()) {}
 
-ManualRunLoopFactory::~ManualRunLoopFactory() { turns_->end(); }
+ManualRunLoopFactory::~ManualRunLoopFactory() { endThreads(); }
+
+void ManualRunLoopFactory::endThreads() { turns_->end(); }
 
 void ManualRunLoopFactory::startThread(std::string_view,
                                        std::function<void(RunLoop&)> body) {

@@ -16,8 +16,11 @@ namespace ostrel {
 class ManualRunLoopFactory final : public RunLoopFactory {
  public:
   explicit ManualRunLoopFactory(std::shared_ptr<ManualClock> clock);
-  /// Ends all threads where they wait, by unwinding them.
   ~ManualRunLoopFactory() override;
+
+  /// Ends all threads where they wait, by unwinding them. A test whose threads
+  /// keep this factory calls it before it ends.
+  void endThreads();
 
   void startThread(std::string_view name, std::function<void(RunLoop&)> body) override;
   std::shared_ptr<RunLoopTimer> makeTimer(std::chrono::nanoseconds delay,
