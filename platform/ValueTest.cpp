@@ -513,7 +513,7 @@ TEST(ValueNesting, IsSafeAtTheDepthThatTheWireAdmits) {
   useOnSmallStack(33);
 }
 
-TEST(ValueNesting, IsSafeAtThousands) { useOnSmallStack(3000); }
+TEST(ValueNesting, IsSafeAtThousands) { useOnSmallStack(2000); }
 
 TEST(ValueNesting, IsSafeAtAHundredThousandLevelsOfForeignBytes) {
   onSmallStack([] {
