@@ -7,6 +7,7 @@
 #include <system_error>
 
 #include "ostrel/channels.h"
+#include "ostrelctl/Page.h"
 #include "platform/linux/ChannelFile.h"
 #include "platform/linux/ChannelFileFormat.h"
 
@@ -47,10 +48,10 @@ int list(const ChannelsCommand& command, const std::string& directory, std::ostr
       error = values.error;
       continue;
     }
-    if (!command.asJSON) out << groupText(*names) << "\n";
+    if (!command.asJSON) out << printable(groupText(*names)) << "\n";
     auto counters = nlohmann::ordered_json::object();
     for (const ChannelValue& one : *values.value) {
-      if (!command.asJSON) out << "  " << one.name << " " << one.value << "\n";
+      if (!command.asJSON) out << "  " << printable(one.name) << " " << one.value << "\n";
       counters[one.name] = one.value;
     }
     listed.push_back({{"group", names->group},

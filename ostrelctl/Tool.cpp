@@ -4,6 +4,7 @@
 #include <CLI/CLI.hpp>
 #include <functional>
 
+#include "ostrelctl/ChannelsCommand.h"
 #include "ostrelctl/Commands.h"
 
 namespace ostrel {
@@ -22,6 +23,7 @@ struct Arguments {
   std::optional<std::string> key;
   std::string neededKey;
   std::string value;
+  ChannelsCommand channels;
 };
 
 CLI::App* addCommand(CLI::App& parent, Arguments& arguments, const std::string& name,
@@ -118,6 +120,33 @@ void addDefaultsCommands(CLI::App& app, const Tool& tool, Arguments& arguments) 
              [&] { return runNotify(tool); });
 }
 
+void addChannelsCommands(CLI::App& app, const Tool& tool, Arguments& arguments) {
+  auto* channels = app.add_subcommand("channels", "Show or publish driver channels");
+  channels->require_subcommand(1);
+  const auto addGroups = [&arguments](CLI::App* command) {
+    command->add_option("--group", arguments.channels.group, "Of this group");
+    command->add_option("--subgroup", arguments.channels.subgroup, "Of this subgroup");
+  };
+  const auto run = [&] {
+    return runChannels(arguments.channels, tool.channelsDirectory, tool.out, tool.err);
+  };
+
+  auto* list =
+      addCommand(*channels, arguments, "list", "List counters and their values", run);
+  addGroups(list);
+  list->add_flag("--json", arguments.channels.asJSON, "Write JSON");
+
+  auto* publish = addCommand(*channels, arguments, "publish", "Set counters", [&, run] {
+    arguments.channels.action = ChannelsCommand::Action::kPublish;
+    return run();
+  });
+  addGroups(publish);
+  publish
+      ->add_option("NAME=VALUE", arguments.channels.assignments,
+                   "A counter and its value, an integer")
+      ->required();
+}
+
 }  // namespace
 
 int runTool(const Tool& tool, int argc, const char* const* argv) {
@@ -128,6 +157,7 @@ int runTool(const Tool& tool, int argc, const char* const* argv) {
   addServiceCommands(app, tool, arguments);
   addStoreCommands(app, tool, arguments);
   addDefaultsCommands(app, tool, arguments);
+  addChannelsCommands(app, tool, arguments);
   try {
     app.parse(argc, argv);
   } catch (const CLI::ParseError& error) {

@@ -75,7 +75,10 @@ TEST_F(ToolTest, PrintsHelpForEveryCommand) {
                                                           {"notify"},
                                                           {"defaults", "read"},
                                                           {"defaults", "write"},
-                                                          {"defaults", "delete"}};
+                                                          {"defaults", "delete"},
+                                                          {"channels"},
+                                                          {"channels", "list"},
+                                                          {"channels", "publish"}};
   for (auto command : commands) {
     command.push_back("--help");
     EXPECT_EQ(run(command), 0) << ::testing::PrintToString(command);
@@ -294,6 +297,18 @@ TEST_F(ToolTest, FailsWhenTheNotificationCannotBePosted) {
   std::ofstream(directory_ / "run") << "a file";
   EXPECT_EQ(run({"notify"}), 1);
   EXPECT_THAT(err_.str(), HasSubstr("cannot be made"));
+}
+
+// channels
+
+TEST_F(ToolTest, ListsCountersThatItPublished) {
+  EXPECT_EQ(run({"channels", "publish", "--group", "Speaker", "underruns=5", "low=-7"}),
+            0);
+  EXPECT_EQ(run({"channels", "list"}), 0);
+  EXPECT_EQ(takeOutput(), "Speaker -\n  underruns 5\n  low -7\n");
+  EXPECT_EQ(run({"channels", "list", "--group", "Haptics", "--json"}), 0);
+  EXPECT_EQ(takeOutput(), "[]\n");
+  EXPECT_EQ(run({"channels", "publish"}), 2);
 }
 
 // The store
