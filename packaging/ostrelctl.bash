@@ -34,10 +34,9 @@ _ostrelctl() {
       channels)
         if [ "$COMP_CWORD" -eq 2 ]; then
           words='list publish --help'
-        elif [ "$sub" = list ]; then
-          words='--json --help'
         else
           words='--group --subgroup --help'
+          [ "$sub" != list ] || words+=' --json'
         fi
         ;;
     esac
