@@ -56,7 +56,9 @@ class LineSink final : public LogSink {
 
  private:
   void encode(const LogLine& line) {
-    record_ = "<" + std::to_string(static_cast<int>(line.level)) + ">";
+    record_ = '<';
+    record_ += std::to_string(static_cast<int>(line.level));
+    record_ += '>';
     record_ += line.text;
     // One line stays one line, or a text could forge others.
     std::replace(record_.begin(), record_.end(), '\n', ' ');
@@ -129,8 +131,9 @@ class JournalSink final : public LogSink {
  private:
   // Fields are "NAME=text\n"; a text with an end of line in it goes by its length.
   void encode(const LogLine& line) {
-    record_ = "PRIORITY=" + std::to_string(static_cast<int>(line.level)) +
-              "\nSYSLOG_IDENTIFIER=ostrelreportingd\nOSTREL_SCOPE=";
+    record_ = "PRIORITY=";
+    record_ += std::to_string(static_cast<int>(line.level));
+    record_ += "\nSYSLOG_IDENTIFIER=ostrelreportingd\nOSTREL_SCOPE=";
     record_ += line.scopeCode;
     if (line.text.find('\n') == std::string_view::npos) {
       record_ += "\nMESSAGE=";
