@@ -52,7 +52,7 @@ std::shared_ptr<Store> Store::open(std::string path, StoreOptions options) {
 
 Store::Store(std::string path, StoreOptions options)
     : options_(std::move(options)),
-      writer_(std::move(path), options_.vfs, options_.now, counters_),
+      writer_(std::move(path), options_.vfs, counters_),
       retryPause_(options_.firstRetry) {
   // Signals are for the main thread.
   sigset_t all;
@@ -197,8 +197,7 @@ bool Store::push(StoreOperation operation) {
 
 void Store::runWriter() {
   ::pthread_setname_np(::pthread_self(), "ostrel-store");
-  writer_.recover();
-  if (writer_.fault()) retryLater();
+  work();
   publishState();
   while (waitForWork()) {
     work();
@@ -252,36 +251,37 @@ bool Store::handOver() {
 
 void Store::work() {
   bool isUrgent = handOver();
-  if (writer_.fault() && Clock::now() >= retryAt_) {
-    writer_.recover();
-    if (!writer_.fault()) isUrgent = true;
+  // A fault that is new gets a second attempt at once: a file that was removed or
+  // damaged is replaced by then.
+  for (int attempt = 0; attempt < 2; ++attempt) {
+    if (writer_.fault() && Clock::now() >= retryAt_) {
+      writer_.recover();
+      isUrgent = true;
+    }
+    if (!writer_.fault() && (isUrgent || isCommitDue())) commit();
+    if (!writer_.fault()) break;
   }
-  if (!writer_.fault() && (isUrgent || Clock::now() >= commitAt_ ||
-                           writer_.uncommittedBytes() >= kCommitBytes)) {
-    std::vector<StoreBatch> done = writer_.commit();
-    const std::lock_guard lock(mutex_);
-    for (StoreBatch& batch : done) queue_.recycle(std::move(batch));
-  }
-  if (writer_.fault()) {
-    retryLater();
-    writer_.failFlushes();
-    writer_.keepAtMost(kKeptThroughFault);
-  } else {
+  if (!writer_.fault()) {
     retryPause_ = options_.firstRetry;
     retryAt_ = {};
+    return;
   }
+  if (Clock::now() >= retryAt_) {
+    retryAt_ = Clock::now() + retryPause_;
+    retryPause_ = std::min(retryPause_ * 2, options_.longestRetry);
+  }
+  writer_.failFlushes();
+  writer_.keepAtMost(kKeptThroughFault);
 }
 
-void Store::retryLater() {
-  const auto now = Clock::now();
-  if (now < retryAt_) return;
-  if (writer_.fault()->kind == StoreFault::Kind::kDamaged &&
-      retryPause_ == options_.firstRetry) {
-    retryAt_ = now;  // It is out of the way by now.
-  } else {
-    retryAt_ = now + retryPause_;
-  }
-  retryPause_ = std::min(retryPause_ * 2, options_.longestRetry);
+bool Store::isCommitDue() const {
+  return writer_.uncommittedBytes() >= kCommitBytes || Clock::now() >= commitAt_;
+}
+
+void Store::commit() {
+  std::vector<StoreBatch> done = writer_.commit();
+  const std::lock_guard lock(mutex_);
+  for (StoreBatch& batch : done) queue_.recycle(std::move(batch));
 }
 
 void Store::publishState() {

@@ -36,7 +36,7 @@ struct StoreOptions {
   std::chrono::milliseconds longestRetry{5000};
 
   /// Microseconds since 1970; empty: the system's clock.
-  StoreWriter::Now now;
+  std::function<std::int64_t()> now;
 
   /// The layer below SQLite; none: the system's.
   const char* vfs = nullptr;
@@ -103,7 +103,8 @@ class Store {
   bool waitForWork();
   void work();
   bool handOver();
-  void retryLater();
+  bool isCommitDue() const;
+  void commit();
   void publishState();
   void finish();
 

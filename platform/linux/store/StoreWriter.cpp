@@ -47,9 +47,10 @@ void appendLenientJSON(std::string& out, const Dictionary& value) {
 
 }  // namespace
 
-StoreWriter::StoreWriter(std::string path, const char* vfs, Now now,
-                         StoreCounters& counters)
-    : database_(std::move(path), vfs), now_(std::move(now)), counters_(counters) {}
+StoreWriter::StoreWriter(std::string path, const char* vfs, StoreCounters& counters)
+    : database_(std::move(path), vfs), counters_(counters) {
+  fault_ = {StoreFault::Kind::kTransient, SQLITE_CANTOPEN, "the store is not open yet"};
+}
 
 void StoreWriter::recover() {
   rollback();
@@ -278,18 +279,15 @@ std::vector<StoreBatch> StoreWriter::takeDone(std::size_t batches) {
   done.resize(batches);
   written_ = {};
   std::uint64_t rows = 0;
-  for (StoreBatch& batch : done) {
-    for (StoreOperation& operation : batch) {
+  for (const StoreBatch& batch : done) {
+    for (const StoreOperation& operation : batch) {
       uncommittedBytes_ -= std::min(uncommittedBytes_, operation.bytes());
       if (isRow(operation)) ++rows;
-      auto* flush = std::get_if<SessionFlush>(&operation.what);
-      if (flush != nullptr && flush->completion) {
-        std::exchange(flush->completion, nullptr)(std::nullopt);
-      }
     }
-    batch.clear();
   }
   counters_.written.fetch_add(rows, std::memory_order_relaxed);
+  completeFlushes(done, std::nullopt);
+  for (StoreBatch& batch : done) batch.clear();
   return done;
 }
 
@@ -364,7 +362,6 @@ void StoreWriter::fail(const StoreFault& fault) {
       counters_.setAside.fetch_add(1, std::memory_order_relaxed);
     }
   }
-  failFlushes();
 }
 
 void StoreWriter::rollback() {
@@ -378,9 +375,12 @@ void StoreWriter::rollback() {
 }
 
 void StoreWriter::failFlushes() {
-  if (!fault_) return;
-  const ErrorObject error = errorOf(*fault_);
-  for (StoreBatch& batch : pending_) {
+  if (fault_) completeFlushes(pending_, errorOf(*fault_));
+}
+
+void StoreWriter::completeFlushes(std::vector<StoreBatch>& batches,
+                                  const std::optional<ErrorObject>& error) {
+  for (StoreBatch& batch : batches) {
     for (StoreOperation& operation : batch) {
       auto* flush = std::get_if<SessionFlush>(&operation.what);
       if (flush != nullptr && flush->completion) {

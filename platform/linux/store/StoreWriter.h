@@ -1,7 +1,6 @@
 #pragma once
 
 #include <cstdint>
-#include <functional>
 #include <optional>
 #include <string>
 #include <unordered_map>
@@ -19,10 +18,7 @@ namespace ostrel {
 /// One thread at a time.
 class StoreWriter {
  public:
-  /// Microseconds since 1970.
-  using Now = std::function<std::int64_t()>;
-
-  StoreWriter(std::string path, const char* vfs, Now now, StoreCounters& counters);
+  StoreWriter(std::string path, const char* vfs, StoreCounters& counters);
 
   /// Opens the database, or opens it again, and writes what is not durable yet. A
   /// damaged file is set aside and a new one begun.
@@ -35,8 +31,8 @@ class StoreWriter {
   /// transaction.
   void add(std::vector<StoreBatch> batches);
 
-  /// Makes what was added durable and calls the completions of its flushes; on a
-  /// fault calls these with an error. Gives the batches back, emptied.
+  /// Makes what was added durable, calls the completions of its flushes and gives
+  /// the batches back, emptied. Nothing of this on a fault.
   std::vector<StoreBatch> commit();
 
   /// Whether there is anything to commit.
@@ -84,11 +80,12 @@ class StoreWriter {
   bool wants(const std::string& name);
   void fail(const StoreFault& fault);
   void rollback();
+  static void completeFlushes(std::vector<StoreBatch>& batches,
+                              const std::optional<ErrorObject>& error);
 
   RowText json(const Dictionary& value);
 
   StoreDatabase database_;
-  const Now now_;
   StoreCounters& counters_;
 
   std::optional<StoreFault> fault_;
