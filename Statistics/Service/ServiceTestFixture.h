@@ -20,13 +20,18 @@ class ServiceTest : public CoreTest {
  protected:
   using Replies = std::vector<std::string>;
 
-  ServiceTest() : root(OstrelReportingServiceDelegate::init(platform)) {
-    fakes.listener->setDelegate(root.get());
-    forgetRecords();
-  }
+  ServiceTest() { restart(); }
 
   ~ServiceTest() override {
     for (const auto& connection : connections_) connection->releaseCallbacks();
+  }
+
+  /// Makes the service anew, for what it notices only when it starts. Clients of
+  /// the earlier one are not to be used any more.
+  void restart() {
+    root = OstrelReportingServiceDelegate::init(platform);
+    fakes.listener->setDelegate(root.get());
+    forgetRecords();
   }
 
   /// A client of that process, not registered yet.
@@ -85,7 +90,7 @@ class ServiceTest : public CoreTest {
   }
 
   void onServerQueue(const std::function<void()>& action) {
-    fakes.workQueues->queue("com.orbisk.ostrel.reporting.server")->runAs(action);
+    std::static_pointer_cast<ManualWorkQueue>(serverQueue())->runAs(action);
   }
 
   void switchReporting(bool on) {
@@ -134,7 +139,7 @@ class ServiceTest : public CoreTest {
     return [this](const ReporterIDs& ids) { replies.push_back(format("%@", ids)); };
   }
 
-  const std::shared_ptr<OstrelReportingServiceDelegate> root;
+  std::shared_ptr<OstrelReportingServiceDelegate> root;
   Replies replies;
 
  private:
