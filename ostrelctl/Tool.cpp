@@ -162,7 +162,9 @@ int runTool(const Tool& tool, int argc, const char* const* argv) {
     app.parse(argc, argv);
   } catch (const CLI::ParseError& error) {
     // Help and the version are errors to the parser as well.
-    return app.exit(error, tool.out, tool.err) == 0 ? Tool::kDone : Tool::kWrongUsage;
+    if (error.get_exit_code() == 0) return app.exit(error, tool.out, tool.err);
+    tool.fail(std::string(error.what()) + "; see \"ostrelctl --help\"");
+    return Tool::kWrongUsage;
   }
   return arguments.command();
 }
