@@ -198,7 +198,9 @@ TEST_F(ChannelFileReading, SeesWholeValuesWhileTheyChange) {
   });
   int torn = 0;
   for (int i = 0; i < 5000; ++i) {
-    for (const ChannelValue& value : *readChannelFile(path).value) {
+    const auto outcome = readChannelFile(path);
+    ASSERT_TRUE(outcome.value.has_value());
+    for (const ChannelValue& value : *outcome.value) {
       if (value.value != 0 && value.value != -1) ++torn;
     }
   }
