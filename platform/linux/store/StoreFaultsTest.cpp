@@ -1,0 +1,505 @@
+// Faults of the file and of the file system below it.
+#include <fcntl.h>
+#include <sched.h>
+#include <sys/mount.h>
+#include <sys/resource.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <csignal>
+#include <fstream>
+#include <thread>
+
+#include "platform/Logging.h"
+#include "platform/fake/RecordingLog.h"
+#include "platform/linux/store/StoreAnalyticsSink.h"
+#include "platform/linux/store/StoreFaultVFS.h"
+#include "platform/linux/store/StoreTelemetryBackend.h"
+#include "platform/linux/store/StoreTesting.h"
+#include "platform/linux/store/StoreWattlogSink.h"
+
+namespace ostrel {
+namespace {
+
+namespace fs = std::filesystem;
+using std::chrono::milliseconds;
+using SteadyClock = std::chrono::steady_clock;
+
+StoreOptions quickOptions() {
+  StoreOptions options;
+  options.commitWindow = milliseconds(5);
+  options.firstRetry = milliseconds(5);
+  options.longestRetry = milliseconds(20);
+  return options;
+}
+
+class StoreFaults : public ::testing::Test {
+ protected:
+  void SetUp() override { log_ = RecordingLog::install(); }
+  void TearDown() override {
+    FaultVFS::instance().clearPlan();
+    close();
+    log_->uninstall();
+  }
+
+  std::string stateDirectory() const { return directory_.path() + "/state"; }
+  std::string path() const { return stateDirectory() + "/reports.db"; }
+
+  void open() { open(quickOptions()); }
+  void open(const StoreOptions& options) {
+    store_ = Store::open(path(), options);
+    backend_ = std::make_unique<StoreTelemetryBackend>(store_);
+  }
+  void close() {
+    session_.reset();
+    backend_.reset();
+    store_.reset();
+  }
+
+  void makeSession() {
+    session_ = backend_->createSession(sessionInfo(7), userInfo(), {});
+  }
+
+  Success send(int number) { return session_->sendMessage(1, 1, {{"i", Value(number)}}); }
+
+  // Sends until the store takes it.
+  bool sendUntilAccepted(int number) {
+    return eventually([&] { return send(number).succeeded; });
+  }
+
+  // Whether discovery finds the store.
+  bool isFound() {
+    Awaited<bool> found;
+    const auto session = backend_->createSession(sessionInfo(1), userInfo(), {});
+    session->startConfiguration(
+        [&](std::optional<Array> backends) { found.set(backends.has_value()); });
+    return found.get().value_or(false);
+  }
+
+  std::vector<std::string> numbers() {
+    return OtherConnection(path()).rows(
+        "SELECT json_extract(payload, '$.i') FROM telemetry_messages ORDER BY id");
+  }
+
+  std::vector<std::string> setAside() const {
+    std::vector<std::string> names;
+    for (const auto& entry : fs::directory_iterator(stateDirectory())) {
+      const std::string name = entry.path().filename();
+      if (name.starts_with("reports.db.damaged-") && !name.ends_with("-wal")) {
+        names.push_back(name);
+      }
+    }
+    return names;
+  }
+
+  // A store with one session and one message, closed.
+  void makeSoundStore() {
+    open();
+    makeSession();
+    ASSERT_TRUE(send(1).succeeded);
+    close();
+  }
+
+  // The store begins anew within 2 s, whatever stands at its place.
+  void expectNewStore(std::string_view reason) {
+    const auto begin = SteadyClock::now();
+    open();
+    EXPECT_TRUE(isFound());
+    EXPECT_LT(SteadyClock::now() - begin, std::chrono::seconds(2));
+    makeSession();
+    EXPECT_TRUE(send(2).succeeded);
+    EXPECT_EQ(flushed(*session_), std::nullopt);
+    EXPECT_EQ(numbers(), std::vector<std::string>{"2"});
+    EXPECT_EQ(setAside().size(), 1u);
+    EXPECT_EQ(store_->counters().setAside, 1u);
+    const auto texts = log_->texts(LogLevel::kError);
+    ASSERT_EQ(texts.size(), 1u);
+    EXPECT_THAT(texts[0], ::testing::StartsWith("set the store " + path() + " aside as"));
+    EXPECT_THAT(texts[0], ::testing::HasSubstr(std::string(reason)));
+  }
+
+  void overwrite(std::size_t offset, const std::string& bytes) {
+    std::fstream file(path(), std::ios::in | std::ios::out | std::ios::binary);
+    file.seekp(static_cast<std::streamoff>(offset));
+    file << bytes;
+    ASSERT_TRUE(file.good());
+  }
+
+  TemporaryDirectory directory_;
+  std::shared_ptr<RecordingLog> log_;
+  std::shared_ptr<Store> store_;
+  std::unique_ptr<StoreTelemetryBackend> backend_;
+  std::shared_ptr<TelemetrySession> session_;
+};
+
+TEST_F(StoreFaults, BeginsInAnEmptyFile) {
+  fs::create_directories(stateDirectory());
+  std::ofstream(path()).close();
+  open();
+  EXPECT_TRUE(isFound());
+  EXPECT_TRUE(setAside().empty());
+}
+
+TEST_F(StoreFaults, SetsAsideAFileThatIsNoDatabase) {
+  fs::create_directories(stateDirectory());
+  std::ofstream(path()) << "this is a text, and a rather long one at that";
+  expectNewStore("it is not a database");
+}
+
+TEST_F(StoreFaults, SetsAsideAFileOfOneByte) {
+  fs::create_directories(stateDirectory());
+  std::ofstream(path()) << "S";
+  expectNewStore("it is not a database");
+}
+
+TEST_F(StoreFaults, SetsAsideADamagedHeader) {
+  makeSoundStore();
+  overwrite(0, "XXXX");
+  expectNewStore("it is not a database");
+}
+
+TEST_F(StoreFaults, SetsAsideAnImpossiblePageSize) {
+  makeSoundStore();
+  overwrite(16, std::string("\x12\x34", 2));
+  expectNewStore("file is not a database");
+}
+
+TEST_F(StoreFaults, SetsAsideATruncatedFile) {
+  makeSoundStore();
+  fs::resize_file(path(), fs::file_size(path()) / 2 + 100);
+  expectNewStore("malformed");
+}
+
+TEST_F(StoreFaults, SetsAsideAFileCutAfterItsHeader) {
+  makeSoundStore();
+  fs::resize_file(path(), 100);
+  expectNewStore("");
+}
+
+TEST_F(StoreFaults, SetsAsidePagesOfZeros) {
+  makeSoundStore();
+  overwrite(16384, std::string(3 * 16384, '\0'));
+  expectNewStore("");
+}
+
+TEST_F(StoreFaults, SetsAsideAPageOfNoise) {
+  makeSoundStore();
+  std::string noise(16384, '\0');
+  std::mt19937 random(1);
+  for (char& c : noise) c = static_cast<char>(random());
+  overwrite(16384, noise);
+  expectNewStore("");
+}
+
+TEST_F(StoreFaults, SetsAsideADirectoryInPlaceOfTheFile) {
+  fs::create_directories(path() + "/inside");
+  expectNewStore("it is not a regular file");
+}
+
+TEST_F(StoreFaults, SetsAsideALinkInPlaceOfTheFile) {
+  fs::create_directories(stateDirectory());
+  std::ofstream(directory_.path() + "/victim") << "untouched";
+  fs::create_symlink(directory_.path() + "/victim", path());
+  expectNewStore("it is not a regular file");
+  std::string text;
+  std::ifstream(directory_.path() + "/victim") >> text;
+  EXPECT_EQ(text, "untouched");
+}
+
+TEST_F(StoreFaults, SetsAsideAFIFOInPlaceOfTheFile) {
+  fs::create_directories(stateDirectory());
+  ASSERT_EQ(::mkfifo(path().c_str(), 0600), 0);
+  expectNewStore("it is not a regular file");
+}
+
+TEST_F(StoreFaults, SetsAsideADatabaseOfSomethingElse) {
+  fs::create_directories(stateDirectory());
+  OtherConnection(path()).run("CREATE TABLE songs (title TEXT)");
+  expectNewStore("it holds something else");
+}
+
+TEST_F(StoreFaults, SetsAsideAStoreWithOtherTables) {
+  makeSoundStore();
+  OtherConnection(path()).run("ALTER TABLE telemetry_messages DROP COLUMN payload");
+  expectNewStore("its tables are others");
+}
+
+TEST_F(StoreFaults, StandsAForeignLog) {
+  makeSoundStore();
+  std::ofstream(path() + "-wal") << std::string(100'000, 'w');
+  std::ofstream(path() + "-shm") << std::string(32'768, 's');
+  open();
+  EXPECT_TRUE(isFound());
+  makeSession();
+  EXPECT_TRUE(send(2).succeeded);
+  EXPECT_EQ(flushed(*session_), std::nullopt);
+  EXPECT_EQ(numbers(), (std::vector<std::string>{"1", "2"}));
+}
+
+TEST_F(StoreFaults, LeavesAStoreOfALaterVersionUntouched) {
+  makeSoundStore();
+  OtherConnection(path()).run("PRAGMA user_version = 2");
+  std::ifstream before(path(), std::ios::binary);
+  const std::string bytes((std::istreambuf_iterator<char>(before)), {});
+  open();
+  EXPECT_FALSE(isFound());
+  makeSession();
+  const Success result = send(2);
+  EXPECT_FALSE(result.succeeded);
+  EXPECT_THAT(result.error->description, ::testing::HasSubstr("version 2"));
+  close();
+  std::ifstream after(path(), std::ios::binary);
+  EXPECT_TRUE(bytes == std::string((std::istreambuf_iterator<char>(after)), {}));
+  EXPECT_EQ(log_->texts(LogLevel::kError).front(),
+            "the store cannot be used: the store has version 2, written by a later "
+            "service; this one knows 1");
+}
+
+TEST_F(StoreFaults, KeepsOnlyTwoFilesSetAside) {
+  for (int i = 0; i < 4; ++i) {
+    fs::create_directories(stateDirectory());
+    fs::remove(path());
+    std::ofstream(path()) << "damaged " << i;
+    open();
+    EXPECT_TRUE(isFound());
+    close();
+  }
+  EXPECT_EQ(setAside().size(), 2u);
+}
+
+TEST_F(StoreFaults, BeginsAnewWhenTheFileIsDamagedWhileItRuns) {
+  open();
+  makeSession();
+  ASSERT_TRUE(send(1).succeeded);
+  ASSERT_EQ(flushed(*session_), std::nullopt);
+  OtherConnection(path()).run("PRAGMA wal_checkpoint(TRUNCATE)");
+  overwrite(0, std::string(200'000, 'X'));
+  OtherConnection(path()).run("SELECT 1");
+  ASSERT_TRUE(send(2).succeeded);
+  ASSERT_TRUE(eventually([&] { return store_->counters().setAside == 1; }));
+  ASSERT_TRUE(sendUntilAccepted(3));
+  EXPECT_EQ(flushed(*session_), std::nullopt);
+  session_.reset();
+  close();
+  OtherConnection reader(path());
+  EXPECT_EQ(reader.rows("SELECT reporter_id, ended_at IS NULL FROM telemetry_sessions"),
+            std::vector<std::string>{"7|0"});
+  EXPECT_EQ(numbers().back(), "3");
+}
+
+TEST_F(StoreFaults, BeginsAnewWhenItsDirectoryIsRemoved) {
+  open();
+  makeSession();
+  ASSERT_TRUE(send(1).succeeded);
+  ASSERT_EQ(flushed(*session_), std::nullopt);
+  fs::remove_all(stateDirectory());
+  ASSERT_TRUE(send(2).succeeded);
+  EXPECT_EQ(flushed(*session_), std::nullopt);
+  EXPECT_EQ(numbers(), std::vector<std::string>{"2"});
+  OtherConnection reader(path());
+  EXPECT_EQ(reader.one("SELECT reporter_id FROM telemetry_sessions"), "7");
+}
+
+TEST_F(StoreFaults, RefusesWhileAnotherHoldsTheLockAndRecovers) {
+  open();
+  makeSession();
+  ASSERT_TRUE(send(1).succeeded);
+  ASSERT_EQ(flushed(*session_), std::nullopt);
+  {
+    OtherConnection other(path());
+    other.run("BEGIN IMMEDIATE");
+    ASSERT_TRUE(send(2).succeeded);
+    ASSERT_TRUE(eventually([&] { return !send(3).succeeded; }));
+    const Success refused = send(4);
+    ASSERT_TRUE(refused.error);
+    EXPECT_EQ(refused.error->domain, kOstrelErrorDomain);
+    EXPECT_THAT(refused.error->description, ::testing::HasSubstr("locked"));
+    EXPECT_FALSE(isFound());
+    EXPECT_TRUE(flushed(*session_));
+    other.run("ROLLBACK");
+  }
+  ASSERT_TRUE(sendUntilAccepted(5));
+  EXPECT_EQ(flushed(*session_), std::nullopt);
+  const auto all = numbers();
+  EXPECT_EQ(all.front(), "1");
+  EXPECT_EQ(all[1], "2");
+  EXPECT_EQ(all.back(), "5");
+  EXPECT_EQ(std::count(all.begin(), all.end(), "4"), 0);
+  EXPECT_TRUE(log_->contains(LogLevel::kDefault, processLogScope.code(),
+                             "the store can be used again"));
+}
+
+TEST_F(StoreFaults, RefusesOnAFullDiskAndRecovers) {
+  StoreOptions options = quickOptions();
+  options.vfs = FaultVFS::kName;
+  FaultVFS::instance().clearPlan();
+  open(options);
+  makeSession();
+  ASSERT_TRUE(send(1).succeeded);
+  ASSERT_EQ(flushed(*session_), std::nullopt);
+  FaultVFS::instance().setPlan({FaultPlan::Kind::kWrite, SQLITE_FULL, /*after=*/0,
+                                /*isForEver=*/true});
+  ASSERT_TRUE(send(2).succeeded);
+  ASSERT_TRUE(eventually([&] { return !send(3).succeeded; }));
+  EXPECT_THAT(send(4).error->description, ::testing::HasSubstr("full"));
+  EXPECT_EQ(flushed(*session_)->description, send(5).error->description);
+  FaultVFS::instance().clearPlan();
+  ASSERT_TRUE(sendUntilAccepted(6));
+  EXPECT_EQ(flushed(*session_), std::nullopt);
+  const auto all = numbers();
+  EXPECT_EQ(all.front(), "1");
+  EXPECT_EQ(all[1], "2");
+  EXPECT_EQ(all.back(), "6");
+  EXPECT_EQ(OtherConnection(path()).one("SELECT value > 0 FROM service_status WHERE key "
+                                        "= 'refused'"),
+            "1");
+}
+
+TEST_F(StoreFaults, GivesUpTheOldestInALongFaultAndCountsThem) {
+  StoreOptions options = quickOptions();
+  options.vfs = FaultVFS::kName;
+  FaultVFS::instance().setPlan({FaultPlan::Kind::kAny, SQLITE_FULL, /*after=*/0,
+                                /*isForEver=*/true});
+  open(options);
+  for (int i = 0; i < 40'000; ++i) {
+    backend_->createSession(sessionInfo(i), userInfo(), {}).reset();
+  }
+  EXPECT_TRUE(eventually([&] { return store_->counters().lost > 60'000; }));
+  FaultVFS::instance().clearPlan();
+  EXPECT_TRUE(eventually([&] { return isFound(); }));
+  close();
+  EXPECT_EQ(OtherConnection(path()).one(
+                "SELECT count(*) > 5000, max(reporter_id) FROM telemetry_sessions WHERE "
+                "ended_at NOT NULL"),
+            "1|39999");
+}
+
+// What a run of the store wrote although the n-th call below it failed: each
+// accepted message once, in order.
+class StoreFailingCalls : public StoreFaults,
+                          public ::testing::WithParamInterface<bool> {};
+
+TEST_P(StoreFailingCalls, LoseNothingThatWasAccepted) {
+  const bool isForEver = GetParam();
+  StoreOptions options = quickOptions();
+  options.vfs = FaultVFS::kName;
+  options.firstRetry = milliseconds(1);
+  options.longestRetry = milliseconds(2);
+  FaultVFS& vfs = FaultVFS::instance();
+  std::int64_t last = 0;
+  for (std::int64_t call = 0; call < 400; ++call) {
+    fs::remove_all(stateDirectory());
+    vfs.setPlan({FaultPlan::Kind::kAny, call % 2 == 0 ? SQLITE_FULL : SQLITE_IOERR_WRITE,
+                 call, isForEver});
+    open(options);
+    makeSession();
+    std::vector<std::string> accepted;
+    for (int i = 0; i < 12; ++i) {
+      if (send(i).succeeded) accepted.push_back(std::to_string(i));
+      if (i % 4 == 3) flushed(*session_);
+    }
+    last = vfs.failed();
+    vfs.clearPlan();
+    ASSERT_TRUE(sendUntilAccepted(99)) << call;
+    accepted.push_back("99");
+    ASSERT_TRUE(eventually([&] { return !flushed(*session_); })) << call;
+    close();
+    ASSERT_EQ(numbers(), accepted) << call;
+    OtherConnection reader(path());
+    ASSERT_EQ(reader.one("SELECT count(*) FROM telemetry_sessions WHERE ended_at NOT "
+                         "NULL AND flushed_at NOT NULL"),
+              "1")
+        << call;
+    ASSERT_EQ(reader.one("PRAGMA integrity_check"), "ok") << call;
+    ASSERT_TRUE(setAside().empty()) << call;
+    if (last == 0) break;  // The run has fewer calls.
+  }
+  EXPECT_EQ(last, 0) << "the run has more calls than were tried";
+}
+
+INSTANTIATE_TEST_SUITE_P(Once, StoreFailingCalls, ::testing::Values(false));
+INSTANTIATE_TEST_SUITE_P(ForEver, StoreFailingCalls, ::testing::Values(true));
+
+// In a mount namespace of its own, on a file system of 1 MiB. Exit status 0 when all
+// was as expected, 77 when such a file system cannot be had.
+constexpr int kNoNamespace = 77;
+
+int runOnASmallFileSystem(const std::string& place,
+                          int (*body)(const std::string& place)) {
+  if (::unshare(CLONE_NEWNS) != 0 ||
+      ::mount("none", "/", nullptr, MS_REC | MS_PRIVATE, nullptr) != 0 ||
+      ::mount("none", place.c_str(), "tmpfs", 0, "size=1m") != 0) {
+    return kNoNamespace;
+  }
+  return body(place);
+}
+
+void expectOnASmallFileSystem(int (*body)(const std::string& place)) {
+  TemporaryDirectory place;
+  const pid_t child = ::fork();
+  if (child == 0) ::_exit(runOnASmallFileSystem(place.path(), body));
+  int status = 0;
+  ASSERT_EQ(::waitpid(child, &status, /*options=*/0), child);
+  ASSERT_TRUE(WIFEXITED(status));
+  if (WEXITSTATUS(status) == kNoNamespace) {
+    GTEST_SKIP() << "no mount namespace to be had: needs root";
+  }
+  EXPECT_EQ(WEXITSTATUS(status), 0) << "the step that failed";
+}
+
+int fillTheDisk(const std::string& place) {
+  const auto store = Store::open(place + "/reports.db", quickOptions());
+  StoreTelemetryBackend backend(store);
+  const auto session = backend.createSession(sessionInfo(7), userInfo(), {});
+  const Dictionary payload{{"text", Value(std::string(10'000, 'x'))}};
+  Success success{/*succeeded=*/true, std::nullopt};
+  int accepted = 0;
+  for (; success.succeeded && accepted < 10'000; ++accepted) {
+    success = session->sendMessage(1, 1, payload);
+    std::this_thread::sleep_for(milliseconds(1));
+  }
+  if (success.succeeded) return 1;
+  if (success.error->description.find("full") == std::string::npos) return 2;
+  if (::mount("none", place.c_str(), "tmpfs", MS_REMOUNT, "size=64m") != 0) return 3;
+  if (!eventually([&] { return session->sendMessage(1, 1, payload).succeeded; })) {
+    return 4;
+  }
+  if (flushed(*session)) return 5;
+  const auto count = OtherConnection(place + "/reports.db")
+                         .one("SELECT count(*) FROM telemetry_messages");
+  return std::stoul(count) == store->counters().accepted ? 0 : 6;
+}
+
+TEST(StoreOnASmallFileSystem, RefusesWhenTheDiskIsFullAndGoesOnWhenItIsNot) {
+  expectOnASmallFileSystem(fillTheDisk);
+}
+
+int makeItReadOnly(const std::string& place) {
+  const std::string path = place + "/reports.db";
+  { const auto store = Store::open(path, quickOptions()); }
+  if (::mount("none", place.c_str(), "tmpfs", MS_REMOUNT | MS_RDONLY, "size=1m") != 0) {
+    return 1;
+  }
+  const auto store = Store::open(path, quickOptions());
+  StoreTelemetryBackend backend(store);
+  const auto session = backend.createSession(sessionInfo(7), userInfo(), {});
+  if (!eventually([&] { return !session->sendMessage(1, 1, {}).succeeded; })) return 2;
+  const Success refused = session->sendMessage(1, 1, {});
+  if (refused.error->description.find("Read-only") == std::string::npos) return 3;
+  if (::mount("none", place.c_str(), "tmpfs", MS_REMOUNT, "size=1m") != 0) return 4;
+  if (!eventually([&] { return session->sendMessage(1, 2, {}).succeeded; })) return 5;
+  if (flushed(*session)) return 6;
+  return OtherConnection(path).one(
+             "SELECT count(*) > 0 FROM telemetry_messages WHERE type = 2") == "1"
+             ? 0
+             : 7;
+}
+
+TEST(StoreOnASmallFileSystem, RefusesWhileItIsReadOnlyAndGoesOnAfterwards) {
+  expectOnASmallFileSystem(makeItReadOnly);
+}
+
+}  // namespace
+}  // namespace ostrel
