@@ -107,8 +107,8 @@ void OstrelReportingDriverUtility::subscribeToDriver(
     subscription->setSubscribedChannels(std::move(subscribed.subscribedChannels));
     ioChannelSubscriptions_.push_back(subscription);
   }
-  // Kept: written for a group without channels too, with the word doubled.
-  // [KeepsMisspeltLogTexts]
+  // Kept: the line of a subscription doubles a word, and is written for a group
+  // without channels too. [KeepsMisspeltLogTexts]
   OSTREL_LOG_DEFAULT(logScope, "subscribed to group group %@-%@", driver.groupName(),
                      driver.subGroupName());
 }
@@ -175,8 +175,8 @@ std::optional<Dictionary> OstrelReportingDriverUtility::samplesSince(
       channelReportingService_->createSamplesDelta(earlier, current);
   if (delta.error) {
     OSTREL_LOG_ERROR(logScope, "ChanrepCreateSamplesDelta error %li", delta.error->code);
-    // Kept: absolute counters then stand for the difference, unmarked.
-    // [KeepsAbsoluteCountersWhenDeltaFails]
+    // Kept: where a difference cannot be made, absolute counters stand for it,
+    // unmarked. [KeepsAbsoluteCountersWhenDeltaFails]
     return current;
   }
   return std::move(delta.value);

@@ -69,11 +69,11 @@ std::string CategoryName(MessageCategory category) {
 
 void appendCategoryName(std::string& out, MessageCategory category) {
   const auto code = static_cast<std::uint32_t>(category);
-  // Kept: the code of all ones counts as a kind without a domain.
+  // Kept: the category of all ones counts as a kind without a domain.
   // [KeepsAllOnesCategoryWithoutDomain]
   if (code > kKindMask && code != kAllOnes) {
     out += domainName(code & kDomainMask);
-    // Kept: a domain without a name still leaves its "_".
+    // Kept: a category's domain without a name still leaves its "_".
     // [KeepsLeadingUnderscoreForUnnamedDomain]
     out += '_';
   }

@@ -111,6 +111,8 @@ OstrelReportingSession::~OstrelReportingSession() {
   OSTREL_LOG_INFO(logScope, "deallocing this session %lli", reporterID_);
 }
 
+// Kept: the step compares with the type at the time of the call, not with the
+// one that it finds. [KeepsComparisonWithTheTypeAtTheCall]
 void OstrelReportingSession::setServiceType(ServiceType serviceType) {
   sessionReportingQueue_->async(
       [self = shared_from_this(), serviceType, before = this->serviceType()] {

@@ -253,7 +253,7 @@ TEST_F(OstrelReportingSessionLifecycle, RestartsForAnotherType) {
       Value("alarms_session"));
 }
 
-TEST_F(OstrelReportingSessionLifecycle, ComparesWithTheTypeAtTheTimeOfTheCall) {
+TEST_F(OstrelReportingSessionLifecycle, KeepsComparisonWithTheTypeAtTheCall) {
   const auto session = makeStarted(kHaptics);
 
   session->setServiceType(ServiceType{kAlarms});
@@ -702,7 +702,8 @@ TEST_F(OstrelReportingSessionLifecycle, KeepsStartReplyAtEveryStop) {
   EXPECT_EQ(completions, (std::vector<bool>{true, true}));
 }
 
-TEST_F(OstrelReportingSessionLifecycle, LeavesTokenDateAndOrientationIDInPlaceAfterAStop) {
+TEST_F(OstrelReportingSessionLifecycle,
+       LeavesTokenDateAndOrientationIDInPlaceAfterAStop) {
   const auto session = makeStarted(kHaptics);
 
   stop(*session);

@@ -1,0 +1,134 @@
+#!/usr/bin/env python3
+"""Tests of check_includes and check_kept on small trees of their own."""
+
+import pathlib
+import subprocess
+import sys
+import tempfile
+import unittest
+
+SCRIPTS = pathlib.Path(__file__).resolve().parent
+
+
+class CheckTest(unittest.TestCase):
+    script = ""
+
+    def setUp(self):
+        self.directory = tempfile.TemporaryDirectory()
+        self.addCleanup(self.directory.cleanup)
+        self.root = pathlib.Path(self.directory.name)
+
+    def write(self, path, text):
+        target = self.root / path
+        target.parent.mkdir(parents=True, exist_ok=True)
+        target.write_text(text, encoding="utf-8")
+
+    def run_script(self, *arguments):
+        return subprocess.run(
+            [sys.executable, SCRIPTS / self.script, "--root", self.root, *arguments],
+            capture_output=True, text=True, check=False)
+
+    def assert_fine(self, *arguments):
+        done = self.run_script(*arguments)
+        self.assertEqual((done.returncode, done.stderr), (0, ""))
+
+    def assert_fault(self, text, *arguments):
+        done = self.run_script(*arguments)
+        self.assertEqual(done.returncode, 1)
+        self.assertIn(text, done.stderr)
+
+
+class CheckIncludes(CheckTest):
+    script = "check_includes"
+
+    def test_takes_what_points_down(self):
+        self.write("Statistics/A.cpp", '#include "Statistics/A.h"\n'
+                   '#include <vector>\n#include "platform/Value.h"\n')
+        self.write("platform/Value.h", "#include <string>\n")
+        self.write("platform/linux/B.cpp", "#include <unistd.h>\n")
+        self.assert_fine()
+
+    def test_refuses_what_the_core_must_not_know(self):
+        for include in ("<unistd.h>", "<sqlite3.h>", '"platform/linux/Places.h"',
+                        '"platform/fake/ManualClock.h"', "<gtest/gtest.h>",
+                        '"client/ServiceConnection.h"', "MACRO"):
+            self.write("Statistics/Service/A.cpp", f"#include {include}\n")
+            self.assert_fault("Statistics/Service/A.cpp:1: the core must not include "
+                              + include)
+
+    def test_lets_tests_and_fixtures_use_the_fakes(self):
+        text = '#include <gtest/gtest.h>\n#include "platform/fake/EventLog.h"\n'
+        self.write("Statistics/ATest.cpp", text)
+        self.write("Statistics/CoreTestFixture.h", text)
+        self.assert_fine()
+        self.write("Statistics/ATest.cpp", '#include "platform/linux/Places.h"\n')
+        self.assert_fault("the core must not include")
+
+    def test_refuses_roles_that_look_up(self):
+        self.write("platform/Value.h", '#include "platform/linux/Places.h"\n')
+        self.assert_fault("platform/Value.h:1: the roles must not include")
+
+    def test_lets_other_tests_use_what_they_like(self):
+        self.write("platform/ValueTest.cpp", "#include <pthread.h>\n")
+        self.assert_fine()
+
+    def test_refuses_fakes_that_know_a_binding(self):
+        self.write("platform/fake/A.cpp", '#include "platform/linux/Places.h"\n')
+        self.assert_fault("the fakes must not include")
+
+    def test_refuses_sleep_and_conditions_in_the_core(self):
+        self.write("Statistics/A.cpp", "void f() { std::this_thread::sleep_for(1s); }\n")
+        self.assert_fault("the core sleeps")
+        self.write("Statistics/A.cpp", "#ifdef __linux__\n#endif\n")
+        self.assert_fault("the core compiles by condition")
+
+    def test_refuses_a_tree_without_sources(self):
+        self.assert_fault("no source files")
+
+
+class CheckKept(CheckTest):
+    script = "check_kept"
+
+    def setUp(self):
+        super().setUp()
+        self.write("Statistics/A.cpp", "// Kept: the first fact, which\n"
+                   "// goes on. [KeepsOne]\nint a;\n  // Kept: more. [KeepsTwo]\n")
+        self.write("Statistics/ATest.cpp", "TEST(A, KeepsOne) {}\n"
+                   "TEST_F(A,\n       KeepsTwo) {}\n")
+
+    def test_writes_the_document(self):
+        self.assert_fine()
+        text = (self.root / "docs/kept-behaviours.md").read_text(encoding="utf-8")
+        self.assertIn("## KeepsOne\n\n- The first fact, which goes on. "
+                      "(`Statistics/A.cpp`)\n\nTested in `Statistics/ATest.cpp`.", text)
+        self.assert_fine("--check")
+
+    def test_check_writes_nothing_and_notices_an_old_document(self):
+        self.assert_fault("not up to date", "--check")
+        self.assertFalse((self.root / "docs").exists())
+        self.assert_fine()
+        self.write("Statistics/B.cpp", "// Kept: elsewhere too. [KeepsOne]\n")
+        self.assert_fault("not up to date", "--check")
+
+    def test_misses_a_test(self):
+        self.write("Statistics/B.cpp", "// Kept: untested. [KeepsThree]\n")
+        self.assert_fault("Statistics/B.cpp:1: no test is named KeepsThree", "--check")
+
+    def test_misses_a_mark(self):
+        self.write("platform/BTest.cpp", "TEST(B, KeepsOrder) {}\n")
+        self.assert_fine()
+        self.write("Statistics/BTest.cpp", "TEST(B, KeepsThree) {}\n")
+        self.assert_fault("nothing is marked [KeepsThree]", "--check")
+
+    def test_misses_a_name(self):
+        self.write("Statistics/B.cpp", "// Kept: nameless.\nint b;\n")
+        self.assert_fault("Statistics/B.cpp:1: a mark ends with", "--check")
+
+    def test_refuses_a_tree_without_marks(self):
+        self.write("Statistics/A.cpp", "")
+        self.write("Statistics/ATest.cpp", "")
+        self.assert_fault("nothing is marked", "--check")
+
+
+if __name__ == "__main__":
+    unittest.main()
