@@ -5,6 +5,7 @@
 #include <sqlite3.h>
 
 #include <algorithm>
+#include <atomic>
 #include <cstdint>
 #include <cstring>
 #include <map>
@@ -58,6 +59,9 @@ class FaultVFS {
     const std::lock_guard lock(mutex_);
     return failed_;
   }
+
+  /// A sync does nothing: for tests that do not cut.
+  void setSkipsSync(bool skips) { skipsSync_ = skips; }
 
   void startRecording() {
     const std::lock_guard lock(mutex_);
@@ -160,6 +164,7 @@ class FaultVFS {
 
   static int sync(sqlite3_file* file, int flags) {
     if (instance().mustFail(FaultPlan::Kind::kSync, nullptr)) return SQLITE_IOERR_FSYNC;
+    if (instance().skipsSync_) return SQLITE_OK;
     const int code = below(file)->xSync(of(file)->below, flags);
     instance().record({FileEvent::Kind::kSync, of(file)->name, 0, {}});
     return code;
@@ -195,8 +200,9 @@ class FaultVFS {
     methods_.xSectorSize = [](sqlite3_file* file) {
       return below(file)->xSectorSize(of(file)->below);
     };
-    // No promise about what a power cut leaves.
-    methods_.xDeviceCharacteristics = [](sqlite3_file*) { return 0; };
+    methods_.xDeviceCharacteristics = [](sqlite3_file* file) {
+      return below(file)->xDeviceCharacteristics(of(file)->below);
+    };
     methods_.xShmMap = [](sqlite3_file* file, int page, int size, int extend,
                           void volatile** out) {
       if (instance().mustFail(FaultPlan::Kind::kAny, nullptr)) {
@@ -222,6 +228,7 @@ class FaultVFS {
   FaultPlan plan_;
   std::int64_t calls_ = 0;
   std::int64_t failed_ = 0;
+  std::atomic<bool> skipsSync_{false};
   bool isRecording_ = false;
   std::vector<FileEvent> events_;
 };
