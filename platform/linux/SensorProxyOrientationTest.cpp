@@ -255,11 +255,13 @@ TEST_F(SensorProxyOrientationBus, FindsABusThatComesLater) {
 TEST_F(SensorProxyOrientationBus, FindsABusThatIsStartedAgain) {
   bus_.start();
   auto sensors = observed("normal");
+  sensors->turn("right-up");
+  ASSERT_TRUE(hears({"right-up"}));
   bus_.stop();
   sensors.reset();
   bus_.start();
   sensors = std::make_unique<ScriptedSensors>(Answer::kYes, "left-up");
-  EXPECT_TRUE(hears({"left-up"}));
+  EXPECT_TRUE(hears({"right-up", "left-up"}));
 }
 
 TEST_F(SensorProxyOrientationBus, AsksAgainForASensorThatIsRefused) {
