@@ -1,6 +1,7 @@
 #include <atomic>
 #include <mutex>
 #include <numeric>
+#include <semaphore>
 
 #include "platform/contract/Time.h"
 
@@ -138,12 +139,17 @@ TYPED_TEST(WorkQueueContract, RunsWhatWasQueuedAfterItsOwnerReleasedIt) {
   EXPECT_TRUE(this->time_.reaches([&] { return watch.expired(); }));
 }
 
-TYPED_TEST(WorkQueueContract, MayEndInsideItsOwnStep) {
+TYPED_TEST(WorkQueueContract, MayLoseItsLastOwnerInsideItsOwnStep) {
   auto queue = this->makeQueue();
   const std::weak_ptr<WorkQueue> watch = queue;
-  WorkQueue& raw = *queue;
-  raw.async([owner = std::move(queue)]() mutable { owner.reset(); });
-  raw.async(this->note("after"));
+  std::binary_semaphore othersAreGone{0};
+  queue->async([&othersAreGone, owner = queue]() mutable {
+    othersAreGone.acquire();
+    owner.reset();
+  });
+  queue->async(this->note("after"));
+  queue.reset();
+  othersAreGone.release();
   ASSERT_TRUE(this->time_.settle());
   EXPECT_THAT(this->notes(), ElementsAre("after"));
   EXPECT_TRUE(this->time_.reaches([&] { return watch.expired(); }));
@@ -162,11 +168,11 @@ TYPED_TEST(WorkQueueContract, DestroysAStepBeforeTheNextOneRuns) {
 
 TYPED_TEST(WorkQueueContract, LetsTheEndOfAStepQueueOnTheSameQueue) {
   const auto queue = this->makeQueue();
-  const std::shared_ptr<void> queuesAtItsEnd(
+  std::shared_ptr<void> queuesAtItsEnd(
       nullptr, [this, &queue](void*) { queue->async(this->note("queued at the end")); });
   queue->async([held = queuesAtItsEnd] {});
   queue->async(this->note("second"));
-  const_cast<std::shared_ptr<void>&>(queuesAtItsEnd).reset();
+  queuesAtItsEnd.reset();
   ASSERT_TRUE(this->time_.settle());
   EXPECT_THAT(this->notes(),
               testing::UnorderedElementsAre("second", "queued at the end"));

@@ -76,6 +76,20 @@ Outcome<T> withFault(std::optional<T> value,
 FakeChannelReportingService::FakeChannelReportingService(SharedEventLog events)
     : events_(std::move(events)) {}
 
+std::optional<FakeChannelReportingService::Counters>
+FakeChannelReportingService::countersOf(const Group& asked) const {
+  const auto fits = [](const Name& wanted, const Name& name) {
+    return !wanted || wanted == name;
+  };
+  std::optional<Counters> found;
+  for (const auto& [group, counters] : counters_) {
+    if (!fits(asked.first, group.first) || !fits(asked.second, group.second)) continue;
+    if (!found) found.emplace();
+    found->insert(found->end(), counters.begin(), counters.end());
+  }
+  return found;
+}
+
 Outcome<std::shared_ptr<ChannelCollection>>
 FakeChannelReportingService::copyChannelsInGroup(const Name& groupName,
                                                  const Name& subGroupName) {
@@ -83,7 +97,7 @@ FakeChannelReportingService::copyChannelsInGroup(const Name& groupName,
   events_->add("channels.copyChannelsInGroup " + text(group));
   const std::lock_guard lock(mutex_);
   std::optional<std::shared_ptr<ChannelCollection>> collection;
-  if (const auto counters = lookUp(counters_, group)) {
+  if (const auto counters = countersOf(group)) {
     collection =
         std::make_shared<Collection>(group, static_cast<std::int32_t>(counters->size()));
   }
@@ -109,7 +123,7 @@ Outcome<Dictionary> FakeChannelReportingService::createSamples(
   events_->add("channels.createSamples " + text(known->group));
   const std::lock_guard lock(mutex_);
   std::optional<Dictionary> samples;
-  if (const auto counters = lookUp(counters_, known->group)) {
+  if (const auto counters = countersOf(known->group)) {
     samples = samplesOf(*counters);
   }
   return withFault(std::move(samples), lookUp(samplesFaults_, known->group));

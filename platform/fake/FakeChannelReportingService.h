@@ -14,8 +14,9 @@
 
 namespace ostrel {
 
-/// Counters that the test sets, by group and subgroup. A look-up finds every
-/// channel set under exactly the names that it asks for, none included.
+/// Counters that the test sets, by group and subgroup. A look-up finds those of
+/// every group that fits; no name asked for fits any, also one set without. Two
+/// channels of one name count as two and are sampled as the later.
 ///
 /// Samples are {channel name: value}. Events, a missing name shown as "*":
 /// "channels.copyChannelsInGroup GROUP SUBGROUP", "channels.createSubscription
@@ -45,15 +46,18 @@ class FakeChannelReportingService final : public ChannelReportingService {
   void iterate(const Dictionary& samples, const ChannelCallback& callback) override;
 
   /// Replaces the channels; an empty list is a group that is there but empty. A
-  /// group never set is not found: neither a value nor an error.
+  /// group never set is not found: neither a value nor an error. A subscription
+  /// sees the counters that its groups have when it is sampled.
   void setCounters(Name group, Name subgroup, Counters counters);
-  /// Until set again with none.
+  /// For calls that ask for exactly these names, until set again with none.
   void setLookupFault(Name group, Name subgroup, std::optional<Fault> fault);
   void setSamplesFault(Name group, Name subgroup, std::optional<Fault> fault);
   void setDeltaFault(std::optional<Fault> fault);
 
  private:
   using Group = std::pair<Name, Name>;
+
+  std::optional<Counters> countersOf(const Group& asked) const;  // Under the lock.
 
   const SharedEventLog events_;
   mutable std::mutex mutex_;

@@ -4,8 +4,6 @@
 #include <cstdio>
 #include <utility>
 
-#include "platform/fake/FakeUse.h"
-
 namespace ostrel {
 namespace {
 
@@ -23,12 +21,15 @@ FakeFileSystem::FakeFileSystem(SharedEventLog events) : events_(std::move(events
 
 Success FakeFileSystem::createDirectory(const std::string& path,
                                         std::uint32_t permissions) {
-  checkFakeUse(path.starts_with('/'), "paths are absolute");
   char mode[16];
   std::snprintf(mode, sizeof mode, " %04o", permissions);
   events_->add("files.createDirectory " + path + mode);
   const std::lock_guard lock(mutex_);
   if (directoryResult_) return *directoryResult_;
+  if (path != diagnosticLogDirectory() &&
+      !path.starts_with(diagnosticLogDirectory() + '/')) {
+    return failure(ENOENT, "No such file or directory");
+  }
   for (std::size_t slash = path.find('/', 1);; slash = path.find('/', slash + 1)) {
     const std::string directory = path.substr(0, slash);
     if (files_.contains(directory)) return failure(ENOTDIR, "Not a directory");
