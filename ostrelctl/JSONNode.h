@@ -21,7 +21,7 @@ using JSONObject = std::vector<JSONMember>;
 struct JSONNode {
   std::variant<std::nullptr_t, bool, std::int64_t, std::uint64_t, double, std::string,
                JSONArray, JSONObject>
-      value = nullptr;
+      value;  // Null unless made otherwise.
 
   bool isNull() const { return std::holds_alternative<std::nullptr_t>(value); }
   // Each is none when the node is of another kind.
