@@ -19,7 +19,9 @@
 namespace ostrel {
 namespace {
 
+// The service, which may be another user, reads what root makes here.
 constexpr mode_t kFileMode = 0644;
+constexpr mode_t kDirectoryMode = 0755;
 
 ErrorObject fileError(const std::string& what, int code) {
   return {std::string(kPOSIXErrorDomain), code, what + ": " + std::strerror(code)};
@@ -107,10 +109,21 @@ Success DefaultsFile::replace(const std::string& text) const {
 }
 
 Success makeDirectories(const std::string& path) {
-  std::error_code error;
-  std::filesystem::create_directories(path, error);
-  if (!error) return {true, {}};
-  return {false, fileError("the directory " + path + " cannot be made", error.value())};
+  std::filesystem::path made;
+  for (const auto& part : std::filesystem::path(path)) {
+    made /= part;
+    if (::mkdir(made.c_str(), kDirectoryMode) == 0) {
+      ::chmod(made.c_str(), kDirectoryMode);
+      continue;
+    }
+    const int code = errno == EEXIST ? ENOTDIR : errno;
+    std::error_code ignored;
+    if (!std::filesystem::is_directory(made, ignored)) {
+      return {false,
+              fileError("the directory " + made.string() + " cannot be made", code)};
+    }
+  }
+  return {true, {}};
 }
 
 Success postNotification(const std::string& path) {

@@ -29,7 +29,7 @@ class DefaultsFile {
   const std::string path_;
 };
 
-/// Makes a directory and those above it, with mode 0755 less the umask.
+/// Makes a directory and those above it, with mode 0755 whatever the umask.
 Success makeDirectories(const std::string& path);
 
 /// Posts a change notification: writes the file that is its name, in a directory

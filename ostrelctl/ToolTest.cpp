@@ -2,6 +2,7 @@
 
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
+#include <sys/stat.h>
 
 #include <cstdlib>
 #include <fstream>
@@ -281,6 +282,17 @@ TEST_F(ToolTest, KeepsTheModeOfTheSuiteAndLeavesNoOtherFile) {
     ++files;
   }
   EXPECT_EQ(files, 1);
+}
+
+TEST_F(ToolTest, MakesWhatTheServiceCanReadWhateverTheUmask) {
+  const mode_t old = ::umask(0077);
+  EXPECT_EQ(run({"defaults", "write", "a", "1"}), 0);
+  ::umask(old);
+  const auto modeOf = [this](const std::string& name) {
+    return std::filesystem::status(directory_ / name).permissions();
+  };
+  EXPECT_EQ(modeOf("state/defaults"), std::filesystem::perms{0755});
+  EXPECT_EQ(modeOf("state/defaults/suite.json"), std::filesystem::perms{0644});
 }
 
 TEST_F(ToolTest, RefusesNullAsADefault) {
