@@ -52,7 +52,7 @@ std::shared_ptr<Store> Store::open(std::string path, StoreOptions options) {
 
 Store::Store(std::string path, StoreOptions options)
     : options_(std::move(options)),
-      writer_(std::move(path), options_.vfs, counters_),
+      writer_(std::move(path), options_.vfs, options_.retention, counters_),
       retryPause_(options_.firstRetry) {
   // Signals are for the main thread.
   sigset_t all;
@@ -198,11 +198,7 @@ bool Store::push(StoreOperation operation) {
 void Store::runWriter() {
   ::pthread_setname_np(::pthread_self(), "ostrel-store");
   work();
-  publishState();
-  while (waitForWork()) {
-    work();
-    publishState();
-  }
+  while (waitForWork()) work();
   finish();
 }
 
@@ -256,6 +252,7 @@ void Store::work() {
   for (int attempt = 0; attempt < 2; ++attempt) {
     if (writer_.fault() && Clock::now() >= retryAt_) {
       writer_.recover();
+      publishState();
       isUrgent = true;
     }
     if (!writer_.fault() && (isUrgent || isCommitDue())) commit();
@@ -270,6 +267,7 @@ void Store::work() {
     retryAt_ = Clock::now() + retryPause_;
     retryPause_ = std::min(retryPause_ * 2, options_.longestRetry);
   }
+  publishState();  // Before a caller learns of it from its flush.
   writer_.failFlushes();
   writer_.keepAtMost(kKeptThroughFault);
 }

@@ -31,6 +31,8 @@ struct StoreOptions {
   std::size_t queuedBytes = 64 * 1024 * 1024;
   std::size_t queuedEvents = 100'000;
 
+  StoreRetention retention;
+
   /// Pauses between attempts during a fault.
   std::chrono::milliseconds firstRetry{100};
   std::chrono::milliseconds longestRetry{5000};

@@ -140,7 +140,7 @@ void writeFiles(const std::string& directory,
 }
 
 TEST(StoreCrash, KeepsWhatWasDurableThroughTwoThousandPowerCuts) {
-  TemporaryDirectory directory;
+  TemporaryDirectory directory(TemporaryDirectory::inMemory());
   const auto events = recordWork(directory.path() + "/state/reports.db");
   const std::string image = directory.path() + "/image";
   const std::string path = image + "/reports.db";

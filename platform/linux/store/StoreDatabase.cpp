@@ -16,6 +16,7 @@
 #include <cstdio>
 #include <cstring>
 #include <ctime>
+#include <limits>
 #include <memory>
 
 #include "platform/Logging.h"
@@ -171,6 +172,12 @@ struct StoreDatabase::Statements {
   Statement dataVersion;
   Statement interest;
   Statement fingerprint;
+  Statement usedBytes;
+  Statement removeMessages;
+  Statement removeAnalytics;
+  Statement removePower;
+  Statement removeSessions;
+  Statement addToStatus;
 };
 
 StoreDatabase::StoreDatabase(std::string path, const char* vfs)
@@ -314,6 +321,29 @@ StoreDatabase::Result StoreDatabase::prepareStatements() {
        "ifnull((SELECT max(id) FROM telemetry_messages), 0) + "
        "ifnull((SELECT max(id) FROM analytics_events), 0) + "
        "ifnull((SELECT max(id) FROM power_events), 0)"},
+      {statements->usedBytes,
+       "SELECT (page_count - freelist_count) * page_size FROM pragma_page_count, "
+       "pragma_freelist_count, pragma_page_size"},
+      {statements->removeMessages,
+       "DELETE FROM telemetry_messages WHERE "
+       "id < (SELECT min(id) FROM telemetry_messages) + ?1 AND "
+       "id < (SELECT max(id) FROM telemetry_messages) AND created_at < ?2"},
+      {statements->removeAnalytics,
+       "DELETE FROM analytics_events WHERE "
+       "id < (SELECT min(id) FROM analytics_events) + ?1 AND "
+       "id < (SELECT max(id) FROM analytics_events) AND created_at < ?2"},
+      {statements->removePower,
+       "DELETE FROM power_events WHERE "
+       "id < (SELECT min(id) FROM power_events) + ?1 AND "
+       "id < (SELECT max(id) FROM power_events) AND created_at < ?2"},
+      {statements->removeSessions,
+       "DELETE FROM telemetry_sessions WHERE "
+       "id < (SELECT min(id) FROM telemetry_sessions) + ?1 AND "
+       "id < (SELECT max(id) FROM telemetry_sessions) AND ended_at < ?2 AND "
+       "ended_at < (SELECT created_at FROM telemetry_messages ORDER BY id LIMIT 1)"},
+      {statements->addToStatus,
+       "INSERT INTO service_status (key, value) VALUES (?, ?) "
+       "ON CONFLICT (key) DO UPDATE SET value = value + excluded.value"},
   };
   for (const auto& [statement, sql] : table) {
     const int code = statement.prepare(connection_, sql);
@@ -473,6 +503,37 @@ StoreDatabase::Result StoreDatabase::readFingerprint(std::int64_t& fingerprint) 
   if (code == SQLITE_ROW) fingerprint = statement.integer(0);
   statement.reset();
   return code == SQLITE_ROW ? Result() : fault(code, "read the last rows");
+}
+
+StoreDatabase::Result StoreDatabase::readUsedBytes(std::int64_t& bytes) {
+  Statement& statement = statements_->usedBytes;
+  const int code = statement.step();
+  if (code == SQLITE_ROW) bytes = statement.integer(0);
+  statement.reset();
+  return code == SQLITE_ROW ? Result() : fault(code, "read the size");
+}
+
+StoreDatabase::Result StoreDatabase::removeOldest(std::int64_t rows,
+                                                  std::optional<std::int64_t> before,
+                                                  std::int64_t& removed) {
+  for (Statement* statement :
+       {&statements_->removeMessages, &statements_->removeAnalytics,
+        &statements_->removePower, &statements_->removeSessions}) {
+    statement->bind(1, rows);
+    statement->bind(2, before.value_or(std::numeric_limits<std::int64_t>::max()));
+    const int code = statement->run();
+    if (code != SQLITE_OK) return fault(code, "remove old rows");
+    removed += sqlite3_changes64(connection_);
+  }
+  return std::nullopt;
+}
+
+StoreDatabase::Result StoreDatabase::addToStatus(std::string_view key,
+                                                 std::int64_t value) {
+  statements_->addToStatus.bind(1, key);
+  statements_->addToStatus.bind(2, value);
+  const int code = statements_->addToStatus.run();
+  return code == SQLITE_OK ? Result() : fault(code, "update the status");
 }
 
 bool StoreDatabase::matches(const std::string& pattern, const std::string& text) {

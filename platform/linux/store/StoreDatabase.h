@@ -83,6 +83,17 @@ class StoreDatabase {
 
   Result insertRows(const RowBatch& rows);
 
+  /// The bytes of the file that hold something.
+  Result readUsedBytes(std::int64_t& bytes);
+
+  /// Removes of each kind up to `rows` of the oldest rows, only those from before
+  /// the time `before` if there is one; sessions, when nothing that is kept is older.
+  /// The newest of each kind stays, so that no id is given twice. `removed` grows.
+  Result removeOldest(std::int64_t rows, std::optional<std::int64_t> before,
+                      std::int64_t& removed);
+  /// Adds to a value of the status that outlives the process.
+  Result addToStatus(std::string_view key, std::int64_t value);
+
   /// A number that differs before and after any insertion.
   Result readFingerprint(std::int64_t& fingerprint);
 

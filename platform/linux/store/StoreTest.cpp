@@ -431,6 +431,58 @@ TEST_F(StoreTest, SaysItsVersionAndItsJournal) {
   EXPECT_EQ(reader.one("SELECT pattern FROM analytics_interest"), "*");
 }
 
+TEST_F(StoreTest, RemovesTheOldestRowsOfALargeStore) {
+  StoreOptions options;
+  options.retention.bytes = 2'000'000;
+  open(options);
+  const Dictionary payload{{"text", Value(std::string(1000, 'x'))}};
+  auto session = makeSession(1);
+  makeSession(2).reset();
+  for (int round = 0; round < 100; ++round) {
+    for (int i = 0; i < 100; ++i) session->sendMessage(1, 1, payload);
+    EXPECT_EQ(flushed(*session), std::nullopt);
+  }
+  OtherConnection reader(path());
+  EXPECT_EQ(reader.one("SELECT max(id), min(id) > 5000, count(*) > 500 FROM "
+                       "telemetry_messages"),
+            "10000|1|1");
+  EXPECT_EQ(reader.rows("SELECT reporter_id FROM telemetry_sessions"),
+            (std::vector<std::string>{"1", "2"}));
+  EXPECT_EQ(reader.one("SELECT value = 10000 - (SELECT count(*) FROM telemetry_messages) "
+                       "FROM service_status WHERE key = 'removed'"),
+            "1");
+  EXPECT_EQ(reader.one("SELECT (page_count - freelist_count) * page_size < 4000000 FROM "
+                       "pragma_page_count, pragma_freelist_count, pragma_page_size"),
+            "1");
+}
+
+TEST_F(StoreTest, RemovesRowsThatAreTooOld) {
+  std::atomic<std::int64_t> now{1'000'000};
+  StoreOptions options;
+  options.now = [&] { return now.load(); };
+  options.retention.age = std::chrono::hours(1);
+  open(options);
+  makeSession(1)->sendMessage(1, 1, kPayload);
+  analytics_->sendEventLazy("old", [] { return kPayload; });
+  wattlog_->logRegisteredEvent(1, "old", kPayload, std::nullopt);
+  settle();
+  now = 1'000'000 + 3'600'000'000 + 1;
+  makeSession(2)->sendMessage(2, 2, kPayload);
+  analytics_->sendEventLazy("new", [] { return kPayload; });
+  wattlog_->logRegisteredEvent(1, "new", kPayload, std::nullopt);
+  settle();
+  settle();
+  OtherConnection reader(path());
+  EXPECT_EQ(reader.rows("SELECT category FROM telemetry_messages"),
+            std::vector<std::string>{"2"});
+  EXPECT_EQ(reader.rows("SELECT name FROM analytics_events"),
+            std::vector<std::string>{"new"});
+  EXPECT_EQ(reader.rows("SELECT name FROM power_events"),
+            std::vector<std::string>{"new"});
+  EXPECT_EQ(reader.one("SELECT count(*) FROM telemetry_sessions WHERE reporter_id = 1"),
+            "0");
+}
+
 TEST_F(StoreTest, MakesTokensOfOneTrace) {
   open();
   const HierarchyToken root = backend_->makeHierarchyToken(std::nullopt);

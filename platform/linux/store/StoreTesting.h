@@ -21,8 +21,9 @@ namespace ostrel {
 /// A directory of its own, removed at the end.
 class TemporaryDirectory {
  public:
-  TemporaryDirectory() {
-    std::string pattern = std::filesystem::temp_directory_path() / "ostrel-XXXXXX";
+  TemporaryDirectory() : TemporaryDirectory(std::filesystem::temp_directory_path()) {}
+  explicit TemporaryDirectory(const std::filesystem::path& parent) {
+    std::string pattern = parent / "ostrel-XXXXXX";
     path_ = ::mkdtemp(pattern.data());
   }
   ~TemporaryDirectory() {
@@ -33,6 +34,13 @@ class TemporaryDirectory {
   TemporaryDirectory& operator=(const TemporaryDirectory&) = delete;
 
   const std::string& path() const { return path_; }
+
+  /// A place in memory where there is one: for tests that write much.
+  static std::filesystem::path inMemory() {
+    const std::filesystem::path memory = "/dev/shm";
+    return std::filesystem::exists(memory) ? memory
+                                           : std::filesystem::temp_directory_path();
+  }
 
  private:
   std::string path_;

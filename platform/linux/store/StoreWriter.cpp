@@ -47,8 +47,9 @@ void appendLenientJSON(std::string& out, const Dictionary& value) {
 
 }  // namespace
 
-StoreWriter::StoreWriter(std::string path, const char* vfs, StoreCounters& counters)
-    : database_(std::move(path), vfs), counters_(counters) {
+StoreWriter::StoreWriter(std::string path, const char* vfs,
+                         const StoreRetention& retention, StoreCounters& counters)
+    : database_(std::move(path), vfs), retention_(retention), counters_(counters) {
   fault_ = {StoreFault::Kind::kTransient, SQLITE_CANTOPEN, "the store is not open yet"};
 }
 
@@ -245,7 +246,8 @@ StoreWriter::Result StoreWriter::writeRows(bool evenIfFew) {
 std::vector<StoreBatch> StoreWriter::commit() {
   if (fault_ || pending_.empty()) return {};
   DoubtfulCommit made{0, pending_.size(), {}};
-  Result failed = writeStatus();
+  Result failed = removeOld();
+  if (!failed) failed = writeStatus();
   if (!failed) failed = database_.readFingerprint(made.fingerprint);
   if (failed) {
     fail(*failed);
@@ -313,6 +315,34 @@ StoreWriter::Result StoreWriter::writeStatus() {
   }
   writtenStatus_ = sum;
   return std::nullopt;
+}
+
+// Removes at least twice as much as comes, so that the bound holds under any load,
+// and not so much at once that others wait for it.
+StoreWriter::Result StoreWriter::removeOld() {
+  constexpr std::int64_t kLeast = 1000;
+  constexpr std::int64_t kHour = 3'600'000'000;
+  std::int64_t coming = 0;
+  for (const StoreBatch& batch : pending_) {
+    coming += static_cast<std::int64_t>(batch.size());
+    newestTime_ = std::max(newestTime_, batch.back().time);
+  }
+  const std::int64_t rows = std::max(kLeast, 2 * coming);
+  std::int64_t removed = 0;
+  std::int64_t used = 0;
+  if (Result failed = database_.readUsedBytes(used)) return failed;
+  if (used > retention_.bytes) {
+    if (Result failed = database_.removeOldest(rows, std::nullopt, removed))
+      return failed;
+  }
+  if (newestTime_ >= nextAgeCheck_) {
+    std::int64_t old = 0;
+    const std::int64_t before = newestTime_ - retention_.age.count();
+    if (Result failed = database_.removeOldest(rows, before, old)) return failed;
+    if (old == 0) nextAgeCheck_ = newestTime_ + kHour;
+    removed += old;
+  }
+  return removed == 0 ? std::nullopt : database_.addToStatus("removed", removed);
 }
 
 StoreWriter::Result StoreWriter::readInterest() {

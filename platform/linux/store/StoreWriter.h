@@ -1,5 +1,6 @@
 #pragma once
 
+#include <chrono>
 #include <cstdint>
 #include <optional>
 #include <string>
@@ -13,12 +14,21 @@
 
 namespace ostrel {
 
+/// What the store keeps.
+struct StoreRetention {
+  /// The store's own: more than a device reports in months, and a share of its flash
+  /// that nobody misses.
+  std::int64_t bytes = std::int64_t{4} * 1024 * 1024 * 1024;
+  std::chrono::microseconds age = std::chrono::hours(24 * 30);
+};
+
 /// Writes operations to the database and bears its faults. What was handed over
 /// is kept until a commit made it durable; after a fault it is written again.
 /// One thread at a time.
 class StoreWriter {
  public:
-  StoreWriter(std::string path, const char* vfs, StoreCounters& counters);
+  StoreWriter(std::string path, const char* vfs, const StoreRetention& retention,
+              StoreCounters& counters);
 
   /// Opens the database, or opens it again, and writes what is not durable yet. A
   /// damaged file is set aside and a new one begun.
@@ -76,6 +86,7 @@ class StoreWriter {
   Result insertSession(StoreSession& session);
   Result writeRows(bool evenIfFew);
   Result writeStatus();
+  Result removeOld();
   Result readInterest();
   bool wants(const std::string& name);
   void fail(const StoreFault& fault);
@@ -86,6 +97,7 @@ class StoreWriter {
   RowText json(const Dictionary& value);
 
   StoreDatabase database_;
+  const StoreRetention retention_;
   StoreCounters& counters_;
 
   std::optional<StoreFault> fault_;
@@ -105,6 +117,8 @@ class StoreWriter {
   std::vector<std::string> wantedPatterns_;
   std::unordered_map<std::string, bool> wantedNames_;
   std::uint64_t writtenStatus_ = 0;
+  std::int64_t newestTime_ = 0;    // Of the operations, as it is written.
+  std::int64_t nextAgeCheck_ = 0;  // On the same clock.
 };
 
 }  // namespace ostrel
