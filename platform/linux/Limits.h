@@ -29,11 +29,40 @@ inline constexpr std::size_t kReporterIDs = 1024;
 inline constexpr std::size_t kConnections = 2048;
 inline constexpr std::size_t kConnectionsOfUser = 1536;
 
-/// Payload bytes of one connection that are accepted and not yet delivered and
-/// stored. Beyond it the socket is not read until half of it is free again.
+/// Bytes of one connection's requests that are accepted and not yet carried out,
+/// delivered and stored. Beyond it the socket is not read until half of it is free
+/// again. Some 10,000 messages of usual size: the store's next commit always finds
+/// enough to write.
 inline constexpr std::size_t kQueuedBytes = 4 * 1024 * 1024;
 
-/// Reply bytes that a client has not read. Beyond it the client is cut off.
+/// The same of all connections of one user, so that many connections do not make
+/// many times the memory.
+inline constexpr std::size_t kQueuedBytesOfUser = 32 * 1024 * 1024;
+
+/// What a request costs on a queue beside its payload: the step, its place in the
+/// queue, the buffer's head.
+inline constexpr std::size_t kRequestBytes = 256;
+
+/// What a request that wants a reply costs besides: the callback, and the reply
+/// that it causes. Keeps the replies to what is queued below `kUnreadReplyBytes`.
+inline constexpr std::size_t kReplyBytes = 256;
+
+/// Reply bytes that a client has not read. Beyond it the client is cut off. A reply
+/// that is larger alone is sent all the same.
 inline constexpr std::size_t kUnreadReplyBytes = 1024 * 1024;
+
+/// Reply bytes from which on no further requests are read; a client that is merely
+/// slow stays below `kUnreadReplyBytes` by it.
+inline constexpr std::size_t kUnreadReplyBytesToPause = kUnreadReplyBytes / 4;
+
+/// How long such a client may read nothing at all before it is cut off.
+inline constexpr std::chrono::seconds kUnreadPatience{3};
+
+/// How long no connection is accepted once the process or the system has no
+/// descriptor left.
+inline constexpr std::chrono::milliseconds kAcceptBackOff{100};
+
+/// How often one kind of misuse by one user is logged.
+inline constexpr std::chrono::seconds kMisuseLogInterval{60};
 
 }  // namespace ostrel::limits

@@ -1,0 +1,97 @@
+#include "platform/linux/LinuxPlatform.h"
+
+#include <utility>
+
+#include "platform/Logging.h"
+#include "platform/linux/DirectoryFileSystem.h"
+#include "platform/linux/EtcDeviceInfo.h"
+#include "platform/linux/InotifyChangeNotification.h"
+#include "platform/linux/JSONTextSerialization.h"
+#include "platform/linux/JSONUserDefaults.h"
+#include "platform/linux/JournalLog.h"
+#include "platform/linux/LinuxOrientationService.h"
+#include "platform/linux/MappedChannelReporting.h"
+#include "platform/linux/PeerRegistry.h"
+#include "platform/linux/Places.h"
+#include "platform/linux/ProcProcessInfo.h"
+#include "platform/linux/SystemClock.h"
+#include "platform/linux/SystemRandom.h"
+#include "platform/linux/ThreadPoolWorkQueues.h"
+#include "platform/linux/TimedConditionFactory.h"
+#include "platform/linux/TimerThread.h"
+#include "platform/linux/UnixSocketIPCListener.h"
+#include "platform/linux/UsdtKernelTrace.h"
+#include "platform/linux/store/Store.h"
+#include "platform/linux/store/StoreAnalyticsSink.h"
+#include "platform/linux/store/StoreTelemetryBackend.h"
+#include "platform/linux/store/StoreWattlogSink.h"
+
+namespace ostrel {
+namespace {
+
+constexpr std::chrono::milliseconds kLogFarewell{200};
+
+}  // namespace
+
+// In the order of making; what is below may use what is above. The socket comes
+// first: a second service must not touch the store of the first.
+struct LinuxPlatform::Bindings {
+  std::shared_ptr<JournalLog> log;
+  std::shared_ptr<PeerRegistry> peers;
+  std::unique_ptr<UnixSocketIPCListener> listener;
+  std::shared_ptr<TimerThread> timers = std::make_shared<TimerThread>();
+  std::shared_ptr<ThreadPoolWorkQueues> queues =
+      std::make_shared<ThreadPoolWorkQueues>(timers);
+  std::shared_ptr<Store> store = Store::open(storePath());
+};
+
+Outcome<std::unique_ptr<LinuxPlatform>> LinuxPlatform::open() {
+  const std::shared_ptr<JournalLog> log = JournalLog::open();
+  setSystemLog(log);
+  registerLogScope(processLogScope);
+  const auto peers = std::make_shared<PeerRegistry>();
+  auto listener = UnixSocketIPCListener::open(reportingSocketPath(), peers);
+  if (!listener.value) return {std::nullopt, std::move(listener.error)};
+  auto bindings = std::unique_ptr<Bindings>(
+      new Bindings{log, peers, *std::move(listener.value)});
+  return {std::unique_ptr<LinuxPlatform>(new LinuxPlatform(std::move(bindings))),
+          std::nullopt};
+}
+
+LinuxPlatform::LinuxPlatform(std::unique_ptr<Bindings> bindings)
+    : bindings_(std::move(bindings)) {
+  platform_.workQueues = bindings_->queues;
+  platform_.conditions = std::make_shared<TimedConditionFactory>(bindings_->timers);
+  platform_.clock = std::make_shared<SystemClock>();
+  platform_.random = std::make_shared<SystemRandom>();
+  platform_.fileSystem = std::make_shared<DirectoryFileSystem>(diagnosticLogRoot());
+  platform_.json = std::make_shared<JSONTextSerialization>();
+  platform_.notifications = std::make_shared<InotifyChangeNotification>(
+      InotifyChangeNotification::systemDirectory());
+  platform_.userDefaults =
+      std::make_shared<JSONUserDefaults>(JSONUserDefaults::systemDirectory());
+  platform_.processInfo = std::make_shared<ProcProcessInfo>(bindings_->peers);
+  platform_.deviceInfo = std::make_shared<EtcDeviceInfo>(EtcDeviceInfo::systemFiles());
+  platform_.telemetryBackend = std::make_shared<StoreTelemetryBackend>(bindings_->store);
+  platform_.analyticsSink = std::make_shared<StoreAnalyticsSink>(bindings_->store);
+  platform_.wattlogSink = std::make_shared<StoreWattlogSink>(bindings_->store);
+  platform_.channelReportingService = MappedChannelReporting::ofSystem();
+  platform_.orientationService = std::make_shared<LinuxOrientationService>();
+  platform_.kernelTrace = std::make_shared<UsdtKernelTrace>();
+}
+
+LinuxPlatform::~LinuxPlatform() = default;
+
+IPCListener& LinuxPlatform::listener() { return *bindings_->listener; }
+
+bool LinuxPlatform::finish(std::chrono::steady_clock::time_point deadline) {
+  const bool isDrained = bindings_->queues->drain(deadline);
+  if (!isDrained) {
+    OSTREL_LOG_ERROR(processLogScope, "some work was still queued at the end");
+  }
+  const bool isDurable = bindings_->store->shutdown(deadline);
+  bindings_->log->flush(kLogFarewell);
+  return isDrained && isDurable;
+}
+
+}  // namespace ostrel

@@ -1,0 +1,130 @@
+#include "platform/linux/PeerChannel.h"
+
+#include <sys/socket.h>
+
+#include <cerrno>
+#include <utility>
+
+#include "platform/linux/Limits.h"
+
+namespace ostrel {
+namespace {
+
+// What a client's first reply with IDs is taken to cost.
+constexpr std::size_t kAssumedIDsReplyBytes = 16 * 1024;
+
+// An empty buffer of this capacity is kept for the next replies.
+constexpr std::size_t kKeptCapacity = 512;
+
+}  // namespace
+
+PeerChannel::PeerChannel(LoopWaker::ConnectionID id, std::shared_ptr<LoopWaker> waker,
+                         std::shared_ptr<RequestBudget> user, const Limits& limits)
+    : id_(id),
+      waker_(std::move(waker)),
+      user_(std::move(user)),
+      unreadReplyBytes_(limits.unreadReplyBytes),
+      own_(limits.queuedBytes),
+      idsReplyBytes_(kAssumedIDsReplyBytes) {}
+
+PeerChannel::~PeerChannel() {
+  // Whatever could tell that a request ran is gone.
+  if (user_->give(own_.used())) waker_->budgetEased();
+}
+
+void PeerChannel::reply(wire::RequestNumber number, const wire::ReplyValue& value) {
+  const std::lock_guard lock(mutex_);
+  if (isClosed_ || hasTooManyUnread_) return;
+  const std::size_t unread = out_.size() - written_;
+  const std::size_t before = out_.size();
+  wire::appendReply(out_, number, value);
+  const std::size_t added = out_.size() - before;
+  if (std::holds_alternative<ReporterIDs>(value)) idsReplyBytes_ = added;
+  if (unread != 0 && unread + added > unreadReplyBytes_) {
+    out_.resize(before);
+    hasTooManyUnread_ = true;
+  }
+  if (!std::exchange(isAnnounced_, true)) waker_->needsAttention(id_);
+}
+
+void PeerChannel::charge(std::size_t bytes) noexcept {
+  own_.take(bytes + limits::kRequestBytes);
+  user_->take(bytes + limits::kRequestBytes);
+}
+
+void PeerChannel::relieve(std::size_t bytes) noexcept {
+  give(bytes + limits::kRequestBytes);
+}
+
+void PeerChannel::give(std::size_t bytes) noexcept {
+  const bool hasOwnEased = own_.give(bytes);
+  const bool hasUserEased = user_->give(bytes);
+  if (hasOwnEased || hasUserEased) waker_->budgetEased();
+}
+
+std::uint64_t PeerChannel::chargeRequest(std::size_t bytes) {
+  own_.take(bytes);
+  user_->take(bytes);
+  return chargedMark_ += bytes;
+}
+
+void PeerChannel::requestsRan(std::uint64_t mark) noexcept {
+  std::uint64_t ran = ranMark_.load(std::memory_order_relaxed);
+  while (ran < mark && !ranMark_.compare_exchange_weak(ran, mark)) {
+  }
+  if (ran < mark) give(mark - ran);
+}
+
+bool PeerChannel::awaitBudget() {
+  const bool isOwnFull = own_.isExceeded() && own_.await();
+  const bool isUserFull = user_->isExceeded() && user_->await();
+  return isOwnFull || isUserFull;
+}
+
+std::size_t PeerChannel::unreadBytes() const {
+  const std::lock_guard lock(mutex_);
+  return out_.size() - written_;
+}
+
+bool PeerChannel::hasTooManyUnread() const {
+  const std::lock_guard lock(mutex_);
+  return hasTooManyUnread_;
+}
+
+bool PeerChannel::flush(int socket) {
+  const std::lock_guard lock(mutex_);
+  isAnnounced_ = false;
+  while (written_ < out_.size()) {
+    const ssize_t count = ::send(socket, out_.data() + written_, out_.size() - written_,
+                                 MSG_NOSIGNAL | MSG_DONTWAIT);
+    if (count < 0) {
+      if (errno == EINTR) continue;
+      if (errno == EAGAIN || errno == ENOBUFS || errno == ENOMEM) break;
+      return false;
+    }
+    written_ += static_cast<std::size_t>(count);
+  }
+  if (written_ == out_.size()) {
+    out_.clear();
+    written_ = 0;
+    if (out_.capacity() > kKeptCapacity) out_.shrink_to_fit();
+  } else if (written_ > out_.size() / 2) {
+    out_.erase(0, written_);
+    written_ = 0;
+  }
+  return true;
+}
+
+void PeerChannel::close(std::string_view reason) {
+  const std::lock_guard lock(mutex_);
+  if (!std::exchange(isClosed_, true)) wire::appendClosing(out_, reason);
+}
+
+void PeerChannel::close() {
+  const std::lock_guard lock(mutex_);
+  isClosed_ = true;
+  written_ = 0;
+  std::string().swap(out_);
+}
+
+}  // namespace ostrel

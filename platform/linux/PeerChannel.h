@@ -1,0 +1,85 @@
+#pragma once
+
+#include <atomic>
+#include <cstdint>
+#include <memory>
+#include <mutex>
+#include <string>
+
+#include "platform/Value.h"
+#include "platform/linux/LoopWaker.h"
+#include "platform/linux/RequestBudget.h"
+#include "platform/linux/wire/Frame.h"
+
+namespace ostrel {
+
+/// The part of a connection that other threads reach, and that may outlive it: the
+/// replies that are to be written, and the account of what its requests cost until
+/// they are carried out. Everything here may be called from any thread unless it says
+/// that it is the loop's.
+class PeerChannel final : public PayloadAccount {
+ public:
+  struct Limits {
+    std::size_t queuedBytes;
+    std::size_t unreadReplyBytes;
+  };
+
+  PeerChannel(LoopWaker::ConnectionID id, std::shared_ptr<LoopWaker> waker,
+              std::shared_ptr<RequestBudget> user, const Limits& limits);
+  ~PeerChannel() override;
+
+  /// Queues a reply; the loop writes it soon. Nothing once the connection has ended
+  /// or has too many unread.
+  void reply(wire::RequestNumber number, const wire::ReplyValue& value);
+
+  /// A payload also costs its place in a queue (`limits::kRequestBytes`).
+  void charge(std::size_t bytes) noexcept override;
+  void relieve(std::size_t bytes) noexcept override;
+
+  /// The loop's: a request without a payload of its own costs `bytes` until a
+  /// request up to the mark returned, or a later one, has run.
+  std::uint64_t chargeRequest(std::size_t bytes);
+  /// All requests up to `mark` have run, since requests run in their order.
+  void requestsRan(std::uint64_t mark) noexcept;
+
+  // The loop's.
+  bool isOverBudget() const { return own_.isExceeded() || user_->isExceeded(); }
+  /// Asks for `LoopWaker::budgetEased` once there is room; false: there is already.
+  bool awaitBudget();
+  /// What is waiting for its reader.
+  std::size_t unreadBytes() const;
+  /// Whether more waits than the client may leave unread.
+  bool hasTooManyUnread() const;
+  /// Writes what waits to the socket as far as that takes it. False when the peer
+  /// cannot be written to any more.
+  bool flush(int socket);
+  /// Adds a last frame. Nothing can be added after it.
+  void close(std::string_view reason);
+  void close();
+
+  /// The size of the client's last reply with IDs: what the next will cost.
+  std::size_t idsReplyBytes() const { return idsReplyBytes_.load(); }
+
+ private:
+  void give(std::size_t bytes) noexcept;
+
+  const LoopWaker::ConnectionID id_;
+  const std::shared_ptr<LoopWaker> waker_;
+  const std::shared_ptr<RequestBudget> user_;
+  const std::size_t unreadReplyBytes_;
+
+  RequestBudget own_;
+  std::uint64_t chargedMark_ = 0;  // The loop's.
+  std::atomic<std::uint64_t> ranMark_{0};
+  std::atomic<std::size_t> idsReplyBytes_;
+
+  mutable std::mutex mutex_;
+  // Guarded by `mutex_`.
+  std::string out_;
+  std::size_t written_ = 0;  // Of `out_`.
+  bool isAnnounced_ = false;
+  bool hasTooManyUnread_ = false;
+  bool isClosed_ = false;
+};
+
+}  // namespace ostrel

@@ -1,0 +1,238 @@
+#include "platform/linux/PeerConnection.h"
+
+#include <sys/socket.h>
+#include <sys/uio.h>
+
+#include <algorithm>
+#include <cerrno>
+#include <cstring>
+#include <utility>
+
+#include "Statistics/Service/OstrelReportingServiceProtocol.h"
+#include "platform/Logging.h"
+#include "platform/linux/RequestDispatch.h"
+
+namespace ostrel {
+namespace {
+
+// A frame that is not whole grows by as much as comes, not by what it claims.
+constexpr std::size_t kMostGrowth = 64 * 1024;
+
+// Descriptors that a client passes are nothing that it may do; they are closed.
+bool closePassedDescriptors(msghdr& message) {
+  bool hasPassed = (message.msg_flags & MSG_CTRUNC) != 0;
+  for (cmsghdr* header = CMSG_FIRSTHDR(&message); header != nullptr;
+       header = CMSG_NXTHDR(&message, header)) {
+    if (header->cmsg_level != SOL_SOCKET || header->cmsg_type != SCM_RIGHTS) continue;
+    hasPassed = true;
+    const std::size_t count = (header->cmsg_len - CMSG_LEN(0)) / sizeof(int);
+    for (std::size_t i = 0; i < count; ++i) {
+      int descriptor;
+      std::memcpy(&descriptor, CMSG_DATA(header) + i * sizeof descriptor,
+                  sizeof descriptor);
+      FileDescriptor passed(descriptor);
+    }
+  }
+  return hasPassed;
+}
+
+}  // namespace
+
+PeerConnection::PeerConnection(ID id, FileDescriptor socket, PeerIdentity peer,
+                               std::shared_ptr<PeerChannel> channel,
+                               const ListenerLimits& limits)
+    : id_(id),
+      socket_(std::move(socket)),
+      peer_(peer),
+      channel_(std::move(channel)),
+      limits_(limits) {}
+
+std::string PeerConnection::description() const {
+  return format("<connection %lu of process %i, user %u>", id_, peer_.pid, peer_.user);
+}
+
+void PeerConnection::setExportedObject(
+    std::shared_ptr<OstrelReportingServiceProtocol> object) {
+  object_ = std::move(object);
+}
+
+std::shared_ptr<OstrelReportingServiceProtocol> PeerConnection::exportedObject() const {
+  return object_;
+}
+
+void PeerConnection::setInterruptionHandler(std::function<void()> handler) {
+  interrupted_ = std::move(handler);
+}
+
+void PeerConnection::setInvalidationHandler(std::function<void()> handler) {
+  invalidated_ = std::move(handler);
+}
+
+// What is pending is a frame that is not whole: its rest is read to it directly,
+// so that a frame costs one copy however small its pieces are.
+void PeerConnection::read(std::span<std::uint8_t> buffer) {
+  if (!pending_.empty()) {
+    const std::size_t before = pending_.size();
+    const std::size_t wanted = std::min(missingBytes(), kMostGrowth);
+    pending_.resize(before + wanted);
+    auto* at = reinterpret_cast<std::uint8_t*>(pending_.data()) + before;
+    const ssize_t count = receive({at, wanted});
+    pending_.resize(before + static_cast<std::size_t>(std::max<ssize_t>(count, 0)));
+    if (count > 0) processPending();
+    return;
+  }
+  const ssize_t count = receive(buffer);
+  if (count <= 0) return;
+  const auto bytes = buffer.first(static_cast<std::size_t>(count));
+  const std::size_t done = process(bytes);
+  if (ending_ != Ending::kNone) return;
+  pending_.assign(reinterpret_cast<const char*>(bytes.data()) + done,
+                  bytes.size() - done);
+}
+
+void PeerConnection::continueReading() {
+  if (!isHeldBack_ || ending_ != Ending::kNone) return;
+  isHeldBack_ = false;
+  if (!holdBackIfFull()) processPending();
+}
+
+ssize_t PeerConnection::receive(std::span<std::uint8_t> room) {
+  iovec place{room.data(), room.size()};
+  alignas(cmsghdr) char control[CMSG_SPACE(sizeof(int))];
+  msghdr message{};
+  message.msg_iov = &place;
+  message.msg_iovlen = 1;
+  message.msg_control = control;
+  message.msg_controllen = sizeof control;
+  const ssize_t count =
+      ::recvmsg(socket_.get(), &message, MSG_DONTWAIT | MSG_CMSG_CLOEXEC);
+  if (count < 0) {
+    if (errno == EAGAIN || errno == EINTR || errno == ENOMEM || errno == ENOBUFS) {
+      return -1;
+    }
+    ending_ = Ending::kVanished;
+    return -1;
+  }
+  if (closePassedDescriptors(message)) {
+    breakOff(Ending::kBrokenRules, "descriptors are not taken");
+    return -1;
+  }
+  if (count == 0) ending_ = Ending::kVanished;
+  return count;
+}
+
+// How many bytes are whole requests that were carried out.
+std::size_t PeerConnection::process(std::span<const std::uint8_t> bytes) {
+  std::size_t done = 0;
+  while (bytes.size() - done >= wire::kFrameHeaderSize) {
+    const std::size_t length = wire::frameLength(bytes.data() + done);
+    if (length == 0) {
+      breakOff(Ending::kBrokenRules, "a frame is empty");
+      return done;
+    }
+    if (length > limits_.frameBytes) {
+      breakOff(Ending::kBrokenRules, "a frame is too large");
+      return done;
+    }
+    if (bytes.size() - done - wire::kFrameHeaderSize < length) return done;
+    if (holdBackIfFull()) return done;
+    carryOut(bytes.subspan(done + wire::kFrameHeaderSize, length));
+    if (ending_ != Ending::kNone) return done;
+    done += wire::kFrameHeaderSize + length;
+  }
+  return done;
+}
+
+void PeerConnection::processPending() {
+  const auto* bytes = reinterpret_cast<const std::uint8_t*>(pending_.data());
+  const std::size_t done = process({bytes, pending_.size()});
+  pending_.erase(0, done);
+  if (pending_.empty()) pending_.shrink_to_fit();
+}
+
+void PeerConnection::carryOut(std::span<const std::uint8_t> item) {
+  wire::Request request;
+  const wire::DecodeError error =
+      wire::decodeRequest(item, limits_.payload, limits_.reporterIDs, channel_, request);
+  if (error) {
+    breakOff(Ending::kBrokenRules, *error);
+    return;
+  }
+  if (request.operation == wire::Operation::kFarewell) {
+    ending_ = Ending::kFarewell;
+    return;
+  }
+  if (keepsReply(request.operation)) {
+    needsProbe_ = true;
+  } else if (request.number != 0) {
+    needsProbe_ = false;
+  }
+  dispatchRequest(*object_, channel_, request);
+}
+
+bool PeerConnection::holdBackIfFull() {
+  const bool hasManyUnread = channel_->unreadBytes() > limits_.unreadReplyBytesToPause;
+  if (!hasManyUnread && !channel_->isOverBudget()) return false;
+  if (channel_->isOverBudget() && std::exchange(needsProbe_, false)) {
+    dispatchProbe(*object_, channel_);
+  }
+  isHeldBack_ = hasManyUnread || channel_->awaitBudget();
+  return isHeldBack_;
+}
+
+// The bytes up to the end of the pending frame, or of its length.
+std::size_t PeerConnection::missingBytes() const {
+  if (pending_.size() < wire::kFrameHeaderSize) {
+    return wire::kFrameHeaderSize - pending_.size();
+  }
+  const auto* header = reinterpret_cast<const std::uint8_t*>(pending_.data());
+  const std::size_t whole = wire::kFrameHeaderSize + wire::frameLength(header);
+  return whole > pending_.size() ? whole - pending_.size() : 1;
+}
+
+void PeerConnection::write(Clock::time_point now) {
+  const std::size_t before = channel_->unreadBytes();
+  // A client that cannot be written to has gone; what it sent is still read.
+  if (!channel_->flush(socket_.get())) {
+    isDeaf_ = true;
+    channel_->close();
+  }
+  const std::size_t after = channel_->unreadBytes();
+  if (after < before || !hasUnread_) lastRead_ = now;
+  hasUnread_ = after != 0;
+  if (channel_->hasTooManyUnread()) {
+    breakOff(Ending::kBrokenRules, "too many replies are unread");
+  }
+}
+
+void PeerConnection::checkPatience(Clock::time_point now) {
+  if (!hasUnread_ || now < patienceEnds()) return;
+  if (channel_->unreadBytes() <= limits_.unreadReplyBytesToPause) {
+    lastRead_ = now;
+    return;
+  }
+  breakOff(Ending::kBrokenRules, "the replies are not read");
+}
+
+void PeerConnection::breakOff(Ending ending, std::string_view reason) {
+  if (ending_ != Ending::kNone) return;
+  ending_ = ending;
+  reason_ = reason;
+  channel_->close(reason);
+  channel_->flush(socket_.get());
+}
+
+void PeerConnection::invalidate() {
+  if (ending_ == Ending::kFarewell) channel_->flush(socket_.get());
+  channel_->close();
+  socket_.reset();
+  if (ending_ != Ending::kFarewell && ending_ != Ending::kNone && interrupted_) {
+    interrupted_();
+  }
+  if (invalidated_) invalidated_();
+  interrupted_ = nullptr;
+  invalidated_ = nullptr;
+  object_.reset();
+}
+
+}  // namespace ostrel

@@ -1,0 +1,128 @@
+#pragma once
+
+#include <chrono>
+#include <cstddef>
+#include <cstdint>
+#include <functional>
+#include <memory>
+#include <span>
+#include <string>
+#include <string_view>
+
+#include "platform/IPCListener.h"
+#include "platform/linux/FileDescriptor.h"
+#include "platform/linux/Limits.h"
+#include "platform/linux/PeerChannel.h"
+#include "platform/linux/wire/Frame.h"
+
+namespace ostrel {
+
+/// What one listener allows; the service's own values, fewer in tests.
+struct ListenerLimits {
+  std::size_t connections = limits::kConnections;
+  std::size_t connectionsOfUser = limits::kConnectionsOfUser;
+  std::size_t frameBytes = limits::kFrameBytes;
+  std::size_t reporterIDs = limits::kReporterIDs;
+  wire::PayloadLimits payload{limits::kNesting, limits::kNodes, limits::kKeyBytes};
+  std::size_t queuedBytes = limits::kQueuedBytes;
+  std::size_t queuedBytesOfUser = limits::kQueuedBytesOfUser;
+  std::size_t unreadReplyBytes = limits::kUnreadReplyBytes;
+  std::size_t unreadReplyBytesToPause = limits::kUnreadReplyBytesToPause;
+  std::chrono::milliseconds unreadPatience = limits::kUnreadPatience;
+};
+
+/// Who is at the other end of a socket, by the kernel.
+struct PeerIdentity {
+  ProcessID pid = 0;
+  std::uint32_t user = 0;
+};
+
+/// One client's connection as the listener's loop sees it. On the loop's thread
+/// only; what other threads reach is its `PeerChannel`.
+///
+/// Reading decides when it ends: what a client sent before it went away is carried
+/// out, however full the service was when it went.
+class PeerConnection final : public IPCConnection {
+ public:
+  using ID = LoopWaker::ConnectionID;
+  using Clock = std::chrono::steady_clock;
+
+  enum class Ending {
+    kNone,
+    kFarewell,     // The client ended well.
+    kVanished,     // It went away without a word.
+    kBrokenRules,  // It is told why and cut off.
+  };
+
+  PeerConnection(ID id, FileDescriptor socket, PeerIdentity peer,
+                 std::shared_ptr<PeerChannel> channel, const ListenerLimits& limits);
+
+  ProcessID processIdentifier() const override { return peer_.pid; }
+  std::string description() const override;
+  void setExportedObject(std::shared_ptr<OstrelReportingServiceProtocol> object) override;
+  std::shared_ptr<OstrelReportingServiceProtocol> exportedObject() const override;
+  void setInterruptionHandler(std::function<void()> handler) override;
+  void setInvalidationHandler(std::function<void()> handler) override;
+  void resume() override { isResumed_ = true; }
+
+  ID id() const { return id_; }
+  int socket() const { return socket_.get(); }
+  const PeerIdentity& peer() const { return peer_; }
+  bool isResumed() const { return isResumed_; }
+
+  /// Takes what the socket holds, once through `buffer`, and carries out the
+  /// requests that are whole.
+  void read(std::span<std::uint8_t> buffer);
+  /// Goes on with what was read before, if there is room for it now.
+  void continueReading();
+  /// Writes replies as far as the client takes them.
+  void write(Clock::time_point now);
+  /// Cuts off a client that has read nothing for too long.
+  void checkPatience(Clock::time_point now);
+
+  /// Whether the socket is to be read: the client has room for more requests.
+  bool wantsToRead() const { return ending_ == Ending::kNone && !isHeldBack_; }
+  bool wantsToWrite() const { return hasUnread_ && !isDeaf_; }
+  bool isHeldBack() const { return isHeldBack_; }
+  /// When `checkPatience` has something to say; none while the client reads.
+  bool isImpatient() const { return hasUnread_; }
+  Clock::time_point patienceEnds() const { return lastRead_ + limits_.unreadPatience; }
+
+  Ending ending() const { return ending_; }
+  std::string_view endingReason() const { return reason_; }
+
+  /// Ends it with a reason that the client is told as far as it listens.
+  void breakOff(Ending ending, std::string_view reason);
+  /// Closes the socket and calls the handlers. The last call.
+  void invalidate();
+
+ private:
+  ssize_t receive(std::span<std::uint8_t> room);
+  std::size_t process(std::span<const std::uint8_t> bytes);
+  void processPending();
+  void carryOut(std::span<const std::uint8_t> item);
+  bool holdBackIfFull();
+  std::size_t missingBytes() const;
+
+  const ID id_;
+  FileDescriptor socket_;
+  const PeerIdentity peer_;
+  const std::shared_ptr<PeerChannel> channel_;
+  const ListenerLimits& limits_;
+
+  std::shared_ptr<OstrelReportingServiceProtocol> object_;
+  std::function<void()> interrupted_;
+  std::function<void()> invalidated_;
+
+  std::string pending_;           // Read and not yet carried out; begins with a frame.
+  Clock::time_point lastRead_{};  // When the client last read a reply.
+  std::string reason_;
+  Ending ending_ = Ending::kNone;
+  bool isResumed_ = false;
+  bool isHeldBack_ = false;
+  bool hasUnread_ = false;
+  bool isDeaf_ = false;      // It will not read any more.
+  bool needsProbe_ = false;  // The last request's ticket may be kept for long.
+};
+
+}  // namespace ostrel

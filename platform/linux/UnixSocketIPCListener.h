@@ -1,0 +1,96 @@
+#pragma once
+
+#include <cstdint>
+#include <map>
+#include <memory>
+#include <string>
+#include <unordered_map>
+#include <vector>
+
+#include "platform/IPCListener.h"
+#include "platform/Outcome.h"
+#include "platform/linux/FileDescriptor.h"
+#include "platform/linux/LoopWaker.h"
+#include "platform/linux/PeerConnection.h"
+#include "platform/linux/PeerRegistry.h"
+#include "platform/linux/RequestBudget.h"
+#include "platform/linux/ServiceSocket.h"
+#include "platform/linux/TerminationSignals.h"
+
+namespace ostrel {
+
+/// Serves clients on a Unix stream socket, all of them on the one thread that calls
+/// `resume`. Frames and their rules are in `docs/protocol.md`.
+///
+/// A client that breaks the rules is told why and cut off. One that has more under
+/// way than it may is not read until half of it is done; nothing that it sent is
+/// lost, and no other client waits for it. One that does not read its replies is
+/// cut off at a limit.
+class UnixSocketIPCListener final : public IPCListener {
+ public:
+  /// The socket that systemd passed, else one of our own at `path`. An error is a
+  /// sentence for people. `peers` learns who connects.
+  static Outcome<std::unique_ptr<UnixSocketIPCListener>> open(
+      const std::string& path, std::shared_ptr<PeerRegistry> peers,
+      ListenerLimits limits = {});
+  ~UnixSocketIPCListener() override;
+
+  void setDelegate(IPCListenerDelegate* delegate) override { delegate_ = delegate; }
+
+  /// Says to systemd that the service is ready, and serves until SIGTERM, SIGINT or
+  /// `stop`; then ends every connection.
+  void resume() override;
+
+  /// Lets `resume` return. Any thread.
+  void stop() { signals_.raise(); }
+
+ private:
+  using Clock = PeerConnection::Clock;
+  struct User {
+    std::size_t connections = 0;
+    std::shared_ptr<RequestBudget> budget;
+    Clock::time_point mayLogAgain{};
+  };
+
+  UnixSocketIPCListener(ServiceSocket socket, std::shared_ptr<PeerRegistry> peers,
+                        ListenerLimits limits);
+
+  void acceptAll();
+  void accept(FileDescriptor socket);
+  bool isWithinLimits(const PeerIdentity& peer, int socket);
+  void handleEvent(std::uint64_t id, std::uint32_t events);
+  void handleWork();
+  void handleDeadlines(Clock::time_point now);
+  int millisecondsToWait(Clock::time_point now) const;
+
+  /// Brings the loop in line with what a connection wants now, or ends it.
+  void settle(PeerConnection& connection);
+  void watch(PeerConnection& connection);
+  void end(PeerConnection& connection);
+  void logMisuse(std::uint32_t user, std::string_view what);
+
+  const ListenerLimits limits_;
+  const ServiceSocket socket_;
+  const std::shared_ptr<PeerRegistry> peers_;
+  const std::shared_ptr<LoopWaker> waker_ = std::make_shared<LoopWaker>();
+  TerminationSignals signals_;
+  const FileDescriptor epoll_;
+  IPCListenerDelegate* delegate_ = nullptr;
+
+  struct Watched {
+    std::shared_ptr<PeerConnection> connection;
+    std::uint32_t events = 0;  // As epoll knows them; 0: not in it.
+  };
+  std::unordered_map<PeerConnection::ID, Watched> connections_;
+  std::map<std::uint32_t, User> users_;
+  std::vector<PeerConnection::ID> heldBack_;
+  std::vector<PeerConnection::ID> impatient_;
+  PeerConnection::ID nextID_;
+  LoopWaker::Work work_;
+  std::vector<std::uint8_t> buffer_;
+  Clock::time_point acceptAgainAt_{};  // Set while accepting is backed off.
+  bool isBackedOff_ = false;
+  bool isStopping_ = false;
+};
+
+}  // namespace ostrel
