@@ -184,7 +184,6 @@ TEST_F(InotifyChangeNotificationPosts, CostNoWakeUpWhileThereAreNone) {
   };
   // The thread may still be on its way to sleep: wait until it stays there.
   long before = switches();
-  EXPECT_GT(before, 0);
   int quietIntervals = 0;
   for (int i = 0; i < 100 && quietIntervals < 3; ++i) {
     std::this_thread::sleep_for(InotifyChangeNotification::kShortestInterval);
@@ -193,6 +192,7 @@ TEST_F(InotifyChangeNotificationPosts, CostNoWakeUpWhileThereAreNone) {
     before = now;
   }
   EXPECT_EQ(quietIntervals, 3);
+  EXPECT_GT(before, 0);  // It was counted at all.
 }
 
 }  // namespace
