@@ -34,6 +34,12 @@ constexpr std::chrono::seconds kFarewellTimeout{3};
 
 constexpr std::size_t kReadSize = 64 * 1024;
 
+constexpr const char* kGone = "the service went away";
+
+// A service whose queue of clients is full is asked again so often.
+constexpr int kConnectAttempts = 200;
+constexpr std::chrono::milliseconds kConnectPause{10};
+
 constexpr wire::PayloadLimits kReplyLimits{limits::kNesting, limits::kNodes,
                                            limits::kKeyBytes};
 
@@ -160,7 +166,10 @@ class ConnectionState : public std::enable_shared_from_this<ConnectionState> {
   bool writeSome() {
     while (unsentBegin_ < unsent_.size()) {
       const auto sent = socket_.send(std::string_view(unsent_).substr(unsentBegin_));
-      if (!sent) break;  // The thread finds the connection broken and says so.
+      if (!sent) {
+        isBroken_ = true;
+        return false;
+      }
       if (*sent == 0) return false;
       unsentBegin_ += *sent;
     }
@@ -200,10 +209,17 @@ class ConnectionState : public std::enable_shared_from_this<ConnectionState> {
   void serveUntil(Clock::time_point deadline) {
     while (Clock::now() < deadline) {
       short events = POLLIN;
+      bool isBroken;
       {
         const std::lock_guard lock(mutex_);
         if (phase_ == Phase::kEnded || !endReason_.empty()) return;
         if (!writeSome()) events |= POLLOUT;
+        isBroken = isBroken_;
+      }
+      if (isBroken) {
+        readReplies();  // What the service still said.
+        if (endReason_.empty()) endReason_ = kGone;
+        return;
       }
       pollfd descriptors[] = {{socket_.descriptor(), events, /*revents=*/0},
                               {wake_.descriptor(), POLLIN, /*revents=*/0}};
@@ -227,7 +243,7 @@ class ConnectionState : public std::enable_shared_from_this<ConnectionState> {
       case ClientSocket::Received::kNothingYet:
         return;
       case ClientSocket::Received::kEnd:
-        endReason_ = "the service went away";
+        endReason_ = kGone;
         return;
       case ClientSocket::Received::kBytes:
         reader_.added(size);
@@ -294,6 +310,7 @@ class ConnectionState : public std::enable_shared_from_this<ConnectionState> {
   std::condition_variable ended_;
   ClientSocket socket_;
   Phase phase_ = Phase::kOpen;
+  bool isBroken_ = false;  // Writing fails.
   bool hasThread_ = false;
   bool isRunning_ = false;
   std::thread::id threadID_;
@@ -400,6 +417,11 @@ std::string serviceSocketPath() {
 Outcome<std::shared_ptr<ServiceConnection>> ServiceConnection::connect(
     const std::string& socketPath) {
   auto socket = ClientSocket::connect(socketPath);
+  for (int i = 0; i < kConnectAttempts && socket.error && socket.error->code == EAGAIN;
+       ++i) {
+    std::this_thread::sleep_for(kConnectPause);
+    socket = ClientSocket::connect(socketPath);
+  }
   if (!socket.value) return {{}, std::move(socket.error)};
   auto wake = WakeEvent::make();
   if (!wake.value) return {{}, std::move(wake.error)};

@@ -116,7 +116,7 @@ class FrameReader {
   bool isWithinFrame() const { return begin_ != end_; }
 
  private:
-  const std::size_t mostFrameBytes_;
+  std::size_t mostFrameBytes_;
   std::string buffer_;
   std::size_t begin_ = 0;
   std::size_t end_ = 0;
