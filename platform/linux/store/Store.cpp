@@ -7,6 +7,7 @@
 #include <new>
 
 #include "platform/Logging.h"
+#include "platform/linux/Limits.h"
 
 namespace ostrel {
 namespace {
@@ -14,16 +15,17 @@ namespace {
 // Operations that make it worth writing before the commit is due.
 constexpr std::size_t kWriteAhead = 512;
 
-// Payload bytes that make it worth committing early: clients are held back while
-// about four times as much of theirs is not durable.
-constexpr std::size_t kCommitBytes = 1024 * 1024;
+// What is not durable keeps memory, of which clients have a bounded share: half of
+// one connection's (`limits::kQueuedBytes`) makes it worth committing early, so that
+// the other half is filled meanwhile.
+constexpr std::size_t kCommitBytes = limits::kQueuedBytes / 2;
 
 // Operations kept through a fault.
 constexpr std::size_t kKeptThroughFault = 16384;
 
-constexpr int kNotUsable = 1;
-constexpr int kQueueIsFull = 2;
-constexpr int kStopped = 3;
+// Codes of errors that are not SQLite's, which are positive.
+constexpr int kQueueIsFull = -1;
+constexpr int kStopped = -2;
 
 ErrorObject makeError(int code, std::string_view description) {
   return {std::string(kOstrelErrorDomain), code, std::string(description)};
