@@ -144,6 +144,18 @@ int openIn(const std::string& directory, std::string_view group,
   return EAGAIN;
 }
 
+// Of the service that this process reports to, whose runtime directory need not be
+// that of this process's user.
+std::string systemDirectory() {
+  const char* runtime = std::getenv("RUNTIME_DIRECTORY");
+  const char* socket = std::getenv("OSTREL_REPORTING_SOCKET");
+  if ((runtime == nullptr || *runtime == '\0') && socket != nullptr) {
+    const std::filesystem::path path(socket);
+    if (path.is_absolute()) return path.parent_path() / "channels";
+  }
+  return ostrel::runtimeDirectory() + "/channels";
+}
+
 // The counter's record, or one past those in use.
 Record* find(const ostrel_channels& channels, std::string_view name) {
   const std::uint32_t count =
@@ -188,8 +200,7 @@ int ostrel_channels_open_in(const char* directory, const char* group,
 int ostrel_channels_open(const char* group, const char* subgroup, uint32_t capacity,
                          ostrel_channels** channels) {
   try {
-    const std::string directory = ostrel::runtimeDirectory() + "/channels";
-    return ostrel_channels_open_in(directory.c_str(), group, subgroup, capacity,
+    return ostrel_channels_open_in(systemDirectory().c_str(), group, subgroup, capacity,
                                    channels);
   } catch (const std::bad_alloc&) {
     return ENOMEM;

@@ -249,6 +249,16 @@ TEST_F(ChannelPublisher, OpensInTheRuntimeDirectory) {
             channels::fileBytes(OSTREL_CHANNELS_DEFAULT_COUNTERS));
 }
 
+TEST_F(ChannelPublisher, OpensBesideTheSocketOfItsService) {
+  ::setenv("OSTREL_REPORTING_SOCKET", (directory_ + "/reporting.sock").c_str(),
+           /*replace=*/1);
+  ostrel_channels* channels = nullptr;
+  EXPECT_EQ(ostrel_channels_open("Speaker", "Stats", 0, &channels), 0);
+  ::unsetenv("OSTREL_REPORTING_SOCKET");
+  ostrel_channels_close(channels);
+  EXPECT_TRUE(std::filesystem::exists(directory_ + "/channels/Speaker.Stats"));
+}
+
 TEST_F(ChannelPublisher, ClosesNothing) { ostrel_channels_close(nullptr); }
 
 }  // namespace

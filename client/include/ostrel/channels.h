@@ -33,8 +33,9 @@ typedef struct ostrel_channels ostrel_channels;
 /** One counter; valid until its channels are closed. */
 typedef struct ostrel_counter ostrel_counter;
 
-/** Opens the counters of a group and subgroup in the runtime directory's
- * "channels", making them with room for `capacity` counters when there are none
+/** Opens the counters of a group and subgroup in the "channels" of
+ * $RUNTIME_DIRECTORY, else beside $OSTREL_REPORTING_SOCKET, else in the usual
+ * runtime directory, making them with room for `capacity` counters when there are none
  * yet. Several openers, of one process or of several, share the counters; those
  * that are there keep their values and their capacity. `group` or `subgroup` may
  * be NULL or empty.
