@@ -623,7 +623,10 @@ TEST_F(OstrelReportingSessionLifecycle, StopsInItsOrder) {
   const auto session = makeStarted(kHaptics);
   send(*session, {{"a", 1}}, 0x40000007, 1);
   session->setTransactionCompleteBlock(
-      [this](bool complete) { fakes.events->add(complete ? "complete" : "?"); });
+      [this, weak = std::weak_ptr(session)](bool complete) {
+        EXPECT_FALSE(weak.lock()->started());
+        fakes.events->add(complete ? "complete" : "?");
+      });
   forgetRecords();
   fakes.log->recordInto(fakes.events);
 

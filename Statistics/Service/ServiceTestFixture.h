@@ -22,14 +22,20 @@ class ServiceTest : public CoreTest {
 
   ServiceTest() { restart(); }
 
+  /// A registered client and the root object hold each other.
   ~ServiceTest() override {
     for (const auto& connection : connections_) connection->releaseCallbacks();
+    for (const auto& each : roots_) {
+      onServerQueue([&] { removeClients(*each); });
+    }
+    fakes.runUntilIdle();
   }
 
   /// Makes the service anew, for what it notices only when it starts. Clients of
   /// the earlier one are not to be used any more.
   void restart() {
     root = OstrelReportingServiceDelegate::init(platform);
+    roots_.push_back(root);
     fakes.listener->setDelegate(root.get());
     forgetRecords();
   }
@@ -155,6 +161,12 @@ class ServiceTest : public CoreTest {
     for (const auto& client : root->clients()) pids.push_back(client->clientID());
   }
 
+  static void removeClients(OstrelReportingServiceDelegate& from) {
+    assertOnServerQueue();
+    for (const auto& client : from.clients()) client->handleConnectionError();
+  }
+
+  std::vector<std::shared_ptr<OstrelReportingServiceDelegate>> roots_;
   std::vector<std::shared_ptr<FakeIPCConnection>> connections_;
 };
 
