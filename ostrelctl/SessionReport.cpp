@@ -175,7 +175,8 @@ void SessionReport::writeTo(Page& page) const {
   page.heading("Messages (" + std::to_string(messages.size()) + ")");
   std::vector<Page::Cells> rows;
   for (const Message& message : messages) {
-    rows.push_back({"+" + durationText(session.startedAt, message.recorded.createdAt),
+    rows.push_back({std::string("+").append(
+                        durationText(session.startedAt, message.recorded.createdAt)),
                     message.identifier, compactText(message.recorded.payload)});
   }
   page.table({}, rows, 2);
