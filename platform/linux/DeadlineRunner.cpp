@@ -37,7 +37,7 @@ struct DeadlineRunner::State {
   void help() {
     std::unique_lock lock(mutex);
     for (;;) {
-      changed.wait(lock, [this] { return isStopping || !jobs.empty(); });
+      changed.wait_for(lock, kIdleTime, [this] { return isStopping || !jobs.empty(); });
       if (jobs.empty()) break;
       const std::shared_ptr<Job> job = std::move(jobs.front());
       jobs.pop_front();

@@ -12,6 +12,9 @@ namespace ostrel {
 /// what it uses must not end with the caller.
 class DeadlineRunner {
  public:
+  /// How long a helper waits for the next call before it ends.
+  static constexpr std::chrono::seconds kIdleTime{1};
+
   /// At most `mostThreads` helpers at a time, started when they are needed.
   explicit DeadlineRunner(std::size_t mostThreads);
   DeadlineRunner(const DeadlineRunner&) = delete;
