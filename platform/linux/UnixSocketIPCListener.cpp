@@ -157,9 +157,7 @@ void UnixSocketIPCListener::handleWork() {
 
 void UnixSocketIPCListener::settle(PeerConnection& connection) {
   // Replies that were read make room again for a client that was merely slow.
-  if (connection.isHeldBack() && !connection.wantsToWrite()) {
-    connection.continueReading();
-  }
+  if (connection.isHeldBack()) connection.continueReading();
   if (connection.ending() != PeerConnection::Ending::kNone) {
     if (connection.ending() == PeerConnection::Ending::kBrokenRules) {
       logMisuse(connection.peer().user, connection.endingReason());
