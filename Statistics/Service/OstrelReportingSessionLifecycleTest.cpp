@@ -410,6 +410,7 @@ TEST_F(OstrelReportingSessionLifecycle, StartsAtOnceOnItsQueueWhenSync) {
 }
 
 TEST_F(OstrelReportingSessionLifecycle, EndsTheProcessOnASyncStartOffItsQueue) {
+  GTEST_FLAG_SET(death_test_style, "threadsafe");
   const auto session = makeSession(42);
 
   EXPECT_DEATH(session->startSync(/*sync=*/true), "off its queue");
