@@ -22,7 +22,10 @@ bool wantsColours() {
 
 int main(int argc, char** argv) {
   // Reads of a pipe return with what is there.
-  std::ios::sync_with_stdio(false);
+  std::ios::sync_with_stdio(/*sync=*/false);
+  // Replies are written by other threads; nothing else flushes the output.
+  std::cin.tie(/*tiestr=*/nullptr);
+  std::cerr.tie(/*tiestr=*/nullptr);
   const std::string socketPath = ostrel::serviceSocketPath();
   const ostrel::Tool tool{
       std::cin,
