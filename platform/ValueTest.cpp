@@ -22,6 +22,10 @@ std::vector<std::uint8_t> bytesOf(ValueView value) {
   return {bytes.begin(), bytes.end()};
 }
 
+std::string numbered(std::string name, int number) {
+  return name.append(std::to_string(number));
+}
+
 // A value of encoded bytes that are known to be right.
 Value valueOf(std::initializer_list<std::uint8_t> bytes) {
   return Value(ValueView(bytes.begin()));
@@ -314,12 +318,12 @@ TEST(DictionaryBuilder, IsADictionaryForAnyNumberOfKeys) {
     DictionaryBuilder builder;
     Model model;
     for (int i = 0; i < 3 * keys; ++i) {
-      const std::string key = "key" + std::to_string(random() % keys);
+      const std::string key = numbered("key", static_cast<int>(random() % keys));
       builder.set(key, Value(i));
       model.set(key, i);
       ASSERT_TRUE(builder.contains(key));
     }
-    EXPECT_FALSE(builder.contains("key" + std::to_string(keys)));
+    EXPECT_FALSE(builder.contains(numbered("key", keys)));
     EXPECT_EQ(builder.size(), model.size());
     EXPECT_EQ(description(builder.build()), model.text());
   }
@@ -327,18 +331,18 @@ TEST(DictionaryBuilder, IsADictionaryForAnyNumberOfKeys) {
 
 TEST(DictionaryBuilder, ReplacesEachOf17KeysAndMore) {
   DictionaryBuilder builder;
-  for (int i = 0; i < 20; ++i) builder.set("k" + std::to_string(i), Value(i));
-  for (int i = 0; i < 20; ++i) builder.set("k" + std::to_string(i), Value(-i));
+  for (int i = 0; i < 20; ++i) builder.set(numbered("k", i), Value(i));
+  for (int i = 0; i < 20; ++i) builder.set(numbered("k", i), Value(-i));
   const Dictionary dictionary = builder.build();
   ASSERT_EQ(dictionary.size(), 20u);
   for (int i = 0; i < 20; ++i) {
-    EXPECT_EQ(dictionary.find("k" + std::to_string(i))->signedInteger(), -i);
+    EXPECT_EQ(dictionary.find(numbered("k", i))->signedInteger(), -i);
   }
 }
 
 TEST(DictionaryBuilder, MergesItsOwnDictionaryWithoutChange) {
   DictionaryBuilder builder;
-  for (int i = 0; i < 20; ++i) builder.set("k" + std::to_string(i), Value(i));
+  for (int i = 0; i < 20; ++i) builder.set(numbered("k", i), Value(i));
   const Dictionary once = builder.build();
   builder.merge(once);
   EXPECT_EQ(builder.build(), once);
