@@ -190,7 +190,7 @@ class Writer {
       }
       if (isPretty_) output_.newLine(depth());
       if (top.isDictionary) key();
-      item();  // Ends the life of `top`.
+      if (!error_) item();  // Ends the life of `top`.
     }
     if (error_) {
       output_.cancel();

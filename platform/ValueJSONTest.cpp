@@ -136,6 +136,13 @@ TEST(ValueJSON, RefusesWhatJSONCannotSay) {
       {"c", Value(kNaN)}})));
 }
 
+TEST(ValueJSON, GivesTheFirstErrorOfSeveral) {
+  DictionaryBuilder builder;
+  builder.set(Value(5).view(), Value(kNaN).view());
+  EXPECT_EQ(errorOf(Value(builder.build()))->description,
+            "a key that is not text has no form in JSON");
+}
+
 TEST(ValueJSON, LenientlyWritesSubstitutes) {
   EXPECT_EQ(lenient(Value(kNaN)), "\"NaN\"");
   EXPECT_EQ(lenient(Value(kInfinity)), "\"Infinity\"");
