@@ -99,6 +99,18 @@ TEST(OstrelReportingBlockThrottleKey, LeavesOutTheFieldsThatAPayloadLists) {
             std::string("Count|^|_comparison_field_blacklist|^|x|2|") + kKeyEnd);
 }
 
+TEST(OstrelReportingBlockThrottleKey, LeavesOutIntegerKeysThatAPayloadLists) {
+  DictionaryBuilder payload;
+  payload.set("_comparison_field_blacklist",
+              ArrayBuilder().append(3).append(1.5).append(Dictionary()).build());
+  payload.set(Value(3), Value("three"));
+  payload.set(Value(4), Value("four"));
+  payload.set("3", "text");
+
+  EXPECT_EQ(keyOf(payload.build()),
+            std::string("3|^|4|four|3|text|_comparison_field_blacklist|^|") + kKeyEnd);
+}
+
 TEST(OstrelReportingBlockThrottleKey, IgnoresAListOfFieldsThatIsNoArray) {
   EXPECT_EQ(keyOf({{"_comparison_field_blacklist", "Count"}, {"Count", 1}}),
             std::string("Count|1|_comparison_field_blacklist|^|") + kKeyEnd);
