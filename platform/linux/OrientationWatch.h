@@ -52,7 +52,8 @@ class BackOff {
   std::chrono::milliseconds next_;
 };
 
-/// Sleeps for `time` or until `stopDescriptor` is readable. True: it is.
+/// Sleeps for `time`, or for ever when it is negative, or until `stopDescriptor` is
+/// readable. True: it is.
 bool waitForStop(int stopDescriptor, std::chrono::milliseconds time);
 
 /// The observers of one kind, and the thread that runs their source while there

@@ -8,7 +8,6 @@
 #include "platform/linux/SensorProxyOrientation.h"
 
 #include <poll.h>
-#include <systemd/sd-bus.h>
 
 #include <algorithm>
 #include <cerrno>
@@ -20,6 +19,7 @@
 #include <string_view>
 
 #include "platform/Logging.h"
+#include "platform/linux/SdBusLibrary.h"
 
 namespace ostrel {
 namespace {
@@ -56,17 +56,18 @@ std::optional<Code> codeOf(std::string_view name) {
 
 class SensorConnection {
  public:
-  SensorConnection(const OrientationSource::Report& report, milliseconds firstBackOff)
-      : report_(report), claimBackOff_(firstBackOff) {}
+  SensorConnection(const SdBusLibrary& library, const OrientationSource::Report& report,
+                   milliseconds firstBackOff)
+      : sd_(library), report_(report), claimBackOff_(firstBackOff) {}
   ~SensorConnection() {
     if (bus_ == nullptr) return;
     if (hasClaimed_) {
-      sd_bus_call_method_async(bus_, nullptr, kService, kPath, kService,
-                               "ReleaseAccelerometer", nullptr, nullptr, "");
+      sd_.sd_bus_call_method_async(bus_, nullptr, kService, kPath, kService,
+                                   "ReleaseAccelerometer", nullptr, nullptr, "");
     }
     // Writes what the socket takes at once.
-    sd_bus_process(bus_, nullptr);
-    sd_bus_close_unref(bus_);
+    sd_.sd_bus_process(bus_, nullptr);
+    sd_.sd_bus_close_unref(bus_);
   }
   SensorConnection(const SensorConnection&) = delete;
   SensorConnection& operator=(const SensorConnection&) = delete;
@@ -79,10 +80,10 @@ class SensorConnection {
     for (;;) {
       int more = 0;
       // Not more at a time, so that a flood does not keep the stop from being seen.
-      for (int i = 0; i < 64 && (more = sd_bus_process(bus_, nullptr)) > 0; ++i) {
+      for (int i = 0; i < 64 && (more = sd_.sd_bus_process(bus_, nullptr)) > 0; ++i) {
       }
       if (more < 0) return false;
-      wasReady = wasReady || sd_bus_is_ready(bus_) > 0;
+      wasReady = wasReady || sd_.sd_bus_is_ready(bus_) > 0;
       const auto now = steady_clock::now();
       if (!wasReady && now - begin > SensorProxyOrientation::kMostWait) return false;
       if (claimAt_ && now >= *claimAt_ && claim() < 0) return false;
@@ -98,23 +99,23 @@ class SensorConnection {
 
   int open() {
     const char* address = std::getenv("DBUS_SYSTEM_BUS_ADDRESS");
-    int error = sd_bus_new(&bus_);
+    int error = sd_.sd_bus_new(&bus_);
     if (error >= 0) {
-      error = sd_bus_set_address(bus_, address != nullptr ? address : kUsualAddress);
+      error = sd_.sd_bus_set_address(bus_, address != nullptr ? address : kUsualAddress);
     }
-    if (error >= 0) error = sd_bus_set_bus_client(bus_, /*b=*/1);
+    if (error >= 0) error = sd_.sd_bus_set_bus_client(bus_, /*b=*/1);
     if (error >= 0) {
-      error = sd_bus_set_method_call_timeout(
+      error = sd_.sd_bus_set_method_call_timeout(
           bus_, microseconds(SensorProxyOrientation::kMostWait).count());
     }
-    if (error >= 0) error = sd_bus_start(bus_);
+    if (error >= 0) error = sd_.sd_bus_start(bus_);
     if (error >= 0) {
-      error = sd_bus_add_match_async(bus_, nullptr, kChangesMatch, &changed,
-                                     /*install_callback=*/nullptr, this);
+      error = sd_.sd_bus_add_match_async(bus_, nullptr, kChangesMatch, &changed,
+                                         /*install_callback=*/nullptr, this);
     }
     if (error >= 0) {
-      error = sd_bus_add_match_async(bus_, nullptr, kOwnerMatch, &ownerChanged,
-                                     /*install_callback=*/nullptr, this);
+      error = sd_.sd_bus_add_match_async(bus_, nullptr, kOwnerMatch, &ownerChanged,
+                                         /*install_callback=*/nullptr, this);
     }
     if (error >= 0) error = claim();
     return error;
@@ -124,7 +125,7 @@ class SensorConnection {
   microseconds untilDue(steady_clock::time_point now) const {
     microseconds wait = kForever;
     std::uint64_t due = UINT64_MAX;  // Of the monotonic clock.
-    if (sd_bus_get_timeout(bus_, &due) >= 0 && due != UINT64_MAX) {
+    if (sd_.sd_bus_get_timeout(bus_, &due) >= 0 && due != UINT64_MAX) {
       const auto sinceStart =
           std::chrono::duration_cast<microseconds>(now.time_since_epoch());
       wait = std::max(microseconds(due) - sinceStart, microseconds(0));
@@ -140,7 +141,7 @@ class SensorConnection {
   bool sleep(int stopDescriptor, microseconds wait) const {
     pollfd descriptors[] = {
         {stopDescriptor, POLLIN, 0},
-        {sd_bus_get_fd(bus_), static_cast<short>(sd_bus_get_events(bus_)), 0}};
+        {sd_.sd_bus_get_fd(bus_), static_cast<short>(sd_.sd_bus_get_events(bus_)), 0}};
     const timespec time = {
         static_cast<time_t>(std::min<std::int64_t>(wait.count() / 1000000, 86400)),
         static_cast<long>(wait.count() % 1000000 * 1000)};
@@ -151,15 +152,15 @@ class SensorConnection {
 
   int claim() {
     claimAt_.reset();
-    return sd_bus_call_method_async(bus_, nullptr, kService, kPath, kService,
-                                    "ClaimAccelerometer", &claimed, this, "");
+    return sd_.sd_bus_call_method_async(bus_, nullptr, kService, kPath, kService,
+                                        "ClaimAccelerometer", &claimed, this, "");
   }
 
   void claimLater() { claimAt_ = steady_clock::now() + claimBackOff_.next(); }
 
   void read() {
-    sd_bus_call_method_async(bus_, nullptr, kService, kPath, kProperties, "Get",
-                             &propertyRead, this, "ss", kService, kProperty);
+    sd_.sd_bus_call_method_async(bus_, nullptr, kService, kPath, kProperties, "Get",
+                                 &propertyRead, this, "ss", kService, kProperty);
   }
 
   void take(const char* name) {
@@ -171,9 +172,9 @@ class SensorConnection {
 
   static int claimed(sd_bus_message* reply, void* userData, sd_bus_error*) {
     auto& self = *static_cast<SensorConnection*>(userData);
-    if (sd_bus_message_is_method_error(reply, nullptr) > 0) {
+    if (self.sd_.sd_bus_message_is_method_error(reply, nullptr) > 0) {
       OSTREL_LOG_DEBUG(processLogScope, "the accelerometer cannot be claimed: %@",
-                       std::string(sd_bus_message_get_error(reply)->name));
+                       std::string(self.sd_.sd_bus_message_get_error(reply)->name));
       self.claimLater();
       return 0;
     }
@@ -184,10 +185,11 @@ class SensorConnection {
   }
 
   static int propertyRead(sd_bus_message* reply, void* userData, sd_bus_error*) {
+    auto& self = *static_cast<SensorConnection*>(userData);
     const char* name = nullptr;
-    if (sd_bus_message_is_method_error(reply, nullptr) <= 0 &&
-        sd_bus_message_read(reply, "v", "s", &name) > 0) {
-      static_cast<SensorConnection*>(userData)->take(name);
+    if (self.sd_.sd_bus_message_is_method_error(reply, nullptr) <= 0 &&
+        self.sd_.sd_bus_message_read(reply, "v", "s", &name) > 0) {
+      self.take(name);
     }
     return 0;
   }
@@ -195,22 +197,24 @@ class SensorConnection {
   static int changed(sd_bus_message* signal, void* userData, sd_bus_error*) {
     auto& self = *static_cast<SensorConnection*>(userData);
     if (!self.hasClaimed_) return 0;
-    if (sd_bus_message_skip(signal, "s") < 0) return 0;
-    if (sd_bus_message_enter_container(signal, SD_BUS_TYPE_ARRAY, "{sv}") < 0) return 0;
-    while (sd_bus_message_enter_container(signal, SD_BUS_TYPE_DICT_ENTRY, "sv") > 0) {
+    if (self.sd_.sd_bus_message_skip(signal, "s") < 0) return 0;
+    if (self.sd_.sd_bus_message_enter_container(signal, SD_BUS_TYPE_ARRAY, "{sv}") < 0)
+      return 0;
+    while (self.sd_.sd_bus_message_enter_container(signal, SD_BUS_TYPE_DICT_ENTRY, "sv") >
+           0) {
       const char* name = nullptr;
       const char* orientation = nullptr;
-      if (sd_bus_message_read(signal, "s", &name) < 0) return 0;
+      if (self.sd_.sd_bus_message_read(signal, "s", &name) < 0) return 0;
       const char* contents = nullptr;
       char type = 0;
-      if (sd_bus_message_peek_type(signal, &type, &contents) < 0) return 0;
+      if (self.sd_.sd_bus_message_peek_type(signal, &type, &contents) < 0) return 0;
       if (std::strcmp(name, kProperty) == 0 && std::strcmp(contents, "s") == 0) {
-        if (sd_bus_message_read(signal, "v", "s", &orientation) < 0) return 0;
+        if (self.sd_.sd_bus_message_read(signal, "v", "s", &orientation) < 0) return 0;
         self.take(orientation);
-      } else if (sd_bus_message_skip(signal, "v") < 0) {
+      } else if (self.sd_.sd_bus_message_skip(signal, "v") < 0) {
         return 0;
       }
-      if (sd_bus_message_exit_container(signal) < 0) return 0;
+      if (self.sd_.sd_bus_message_exit_container(signal) < 0) return 0;
     }
     return 0;
   }
@@ -220,7 +224,7 @@ class SensorConnection {
     const char* name = nullptr;
     const char* before = nullptr;
     const char* now = nullptr;
-    if (sd_bus_message_read(signal, "sss", &name, &before, &now) < 0) return 0;
+    if (self.sd_.sd_bus_message_read(signal, "sss", &name, &before, &now) < 0) return 0;
     self.hasClaimed_ = false;
     if (*now != '\0') {
       self.claimBackOff_.reset();
@@ -229,6 +233,7 @@ class SensorConnection {
     return 0;
   }
 
+  const SdBusLibrary& sd_;
   const OrientationSource::Report& report_;
   BackOff claimBackOff_;
   sd_bus* bus_ = nullptr;
@@ -239,6 +244,11 @@ class SensorConnection {
 }  // namespace
 
 void SensorProxyOrientation::run(int stopDescriptor, const Report& report) {
+  const SdBusLibrary* const library = SdBusLibrary::load();
+  if (library == nullptr) {
+    waitForStop(stopDescriptor, /*time=*/milliseconds(-1));
+    return;
+  }
   BackOff backOff(firstBackOff_);
   bool isKnown = false;
   const Report reportKnown = [&](Code code) {
@@ -247,7 +257,7 @@ void SensorProxyOrientation::run(int stopDescriptor, const Report& report) {
     report(code);
   };
   do {
-    SensorConnection connection(reportKnown, firstBackOff_);
+    SensorConnection connection(*library, reportKnown, firstBackOff_);
     bool wasReady = false;
     if (connection.run(stopDescriptor, wasReady)) return;
     if (wasReady) backOff.reset();

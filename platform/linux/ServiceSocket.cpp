@@ -9,12 +9,13 @@
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/un.h>
-#include <systemd/sd-daemon.h>
 #include <unistd.h>
 
 #include <cerrno>
 #include <cstring>
 #include <utility>
+
+#include "platform/linux/SystemdService.h"
 
 namespace ostrel {
 namespace {
@@ -42,11 +43,6 @@ bool makeDirectoriesOf(const std::string& path) {
   return true;
 }
 
-bool isOfKind(int descriptor) {
-  return ::sd_is_socket_unix(descriptor, SOCK_STREAM, /*listening=*/1, nullptr,
-                             /*length=*/0) > 0;
-}
-
 bool makeNonBlocking(int descriptor) {
   const int flags = ::fcntl(descriptor, F_GETFL);
   return flags >= 0 && ::fcntl(descriptor, F_SETFL, flags | O_NONBLOCK) == 0;
@@ -63,15 +59,15 @@ ServiceSocket::~ServiceSocket() {
 }
 
 Outcome<ServiceSocket> ServiceSocket::open(const std::string& path) {
-  const int count = ::sd_listen_fds(/*unset_environment=*/1);
+  const int count = takePassedSockets();
   if (count < 0) {
     return {std::nullopt, failure(-count, "the sockets passed by LISTEN_FDS are wrong")};
   }
   if (count == 0) return bind(path);
   FileDescriptor found;
   for (int i = 0; i < count; ++i) {
-    FileDescriptor passed(SD_LISTEN_FDS_START + i);
-    if (!found && isOfKind(passed.get())) found = std::move(passed);
+    FileDescriptor passed(kFirstPassedSocket + i);
+    if (!found && isListeningUnixStream(passed.get())) found = std::move(passed);
   }
   if (!found) {
     return {std::nullopt,

@@ -5,7 +5,6 @@
 
 #include <sys/epoll.h>
 #include <sys/socket.h>
-#include <systemd/sd-daemon.h>
 
 #include <algorithm>
 #include <array>
@@ -14,6 +13,7 @@
 
 #include "platform/Logging.h"
 #include "platform/linux/ProcProcessInfo.h"
+#include "platform/linux/SystemdService.h"
 
 #ifndef SO_PEERPIDFD
 #define SO_PEERPIDFD 77
@@ -91,7 +91,7 @@ UnixSocketIPCListener::~UnixSocketIPCListener() = default;
 
 void UnixSocketIPCListener::resume() {
   buffer_.resize(kReadBytes);
-  ::sd_notify(/*unset_environment=*/0, "READY=1");
+  notifySystemd("READY=1");
   std::array<epoll_event, kMostEvents> events;
   while (!isStopping_) {
     handleWork();
@@ -103,7 +103,7 @@ void UnixSocketIPCListener::resume() {
     }
     handleDeadlines(Clock::now());
   }
-  ::sd_notify(/*unset_environment=*/0, "STOPPING=1");
+  notifySystemd("STOPPING=1");
   while (!connections_.empty()) {
     const auto connection = connections_.begin()->second.connection;
     sendClosing(connection->socket(), "the service ends");
