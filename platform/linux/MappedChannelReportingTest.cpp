@@ -241,7 +241,7 @@ TEST_F(MappedChannelReportingHanging, GivesAnErrorAndHoldsTheCallerBrieflyOnce) 
   EXPECT_LT(sampleAll(errors), milliseconds(250));
   EXPECT_EQ(errors, (std::vector<std::int64_t>{0, ETIMEDOUT, 0, 0}));
   errors.clear();
-  EXPECT_LT(sampleAll(errors), milliseconds(50));
+  EXPECT_LT(sampleAll(errors), milliseconds(100));  // Not another deadline.
   EXPECT_EQ(errors, (std::vector<std::int64_t>{0, EBUSY, 0, 0}));
   EXPECT_EQ(sources_[1]->reads, 2);  // The look-up's and the one that hangs.
 }
@@ -254,7 +254,7 @@ TEST_F(MappedChannelReportingHanging, OfAllDriversHoldsTheCallerBrieflyToo) {
     EXPECT_TRUE(error == ETIMEDOUT || error == EBUSY) << error;
   }
   errors.clear();
-  EXPECT_LT(sampleAll(errors), milliseconds(50));
+  EXPECT_LT(sampleAll(errors), milliseconds(100));  // Not another deadline.
   EXPECT_EQ(std::count(errors.begin(), errors.end(), 0), 0);
 }
 
