@@ -46,7 +46,8 @@ handle SIGTERM nostop noprint pass
 break -probe-stap ostrel:kernel_trace
 commands
 silent
-printf "trace %x %d %d %d %d\n", $_probe_arg0, $_probe_arg1, $_probe_arg2, $_probe_arg3, $_probe_arg4
+printf "trace %x %d %d %d %d\n", $_probe_arg0, \
+  $_probe_arg1, $_probe_arg2, $_probe_arg3, $_probe_arg4
 continue
 end
 )";
