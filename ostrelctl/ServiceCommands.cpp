@@ -34,15 +34,17 @@ class Conversation {
 
   ServiceConnection& service() { return *service_; }
 
-  /// A callback that `waitForAll` waits for; it keeps its argument in `*place`.
+  /// A callback that `waitForAll` waits for; it keeps its first argument in
+  /// `*place`. The type of ID 0 is replied twice.
   template <typename T>
   auto expect(std::shared_ptr<T> place) {
     {
       const std::lock_guard lock(state_->mutex);
       ++state_->outstanding;
     }
-    return [state = state_, place](const T& value) {
+    return [state = state_, place, isFirst = true](const T& value) mutable {
       const std::lock_guard lock(state->mutex);
+      if (!std::exchange(isFirst, /*new_value=*/false)) return;
       *place = value;
       --state->outstanding;
       state->changed.notify_all();

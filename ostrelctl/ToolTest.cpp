@@ -144,6 +144,20 @@ TEST_F(ToolTest, ShowsTheSessionsAndTheirTypes) {
   EXPECT_EQ(service_->calls.back(), "close");
 }
 
+TEST_F(ToolTest, TakesTheSecondReplyForIDZeroAsNoOtherSessionsReply) {
+  service_->onRequest = [this] {
+    if (service_->serviceTypeReplies.empty()) {
+      service_->reporterIDsReplies[0]({ReporterID{0}, ReporterID{7}});
+    } else if (service_->serviceTypeReplies.size() == 2) {
+      service_->serviceTypeReplies[0](ServiceType{65535});
+      service_->serviceTypeReplies[0](ServiceType{65535});
+      service_->serviceTypeReplies[1](ServiceType{2});
+    }
+  };
+  EXPECT_EQ(run({"status"}), 0);
+  EXPECT_THAT(takeOutput(), HasSubstr("7         telephony (2)"));
+}
+
 TEST_F(ToolTest, WritesTheStatusAsJSON) {
   service_->onRequest = [this] { service_->reporterIDsReplies.at(0)({}); };
   EXPECT_EQ(run({"status", "--json"}), 0);
