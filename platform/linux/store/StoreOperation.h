@@ -77,8 +77,10 @@ struct StoreOperation {
                AnalyticsEvent, PowerEvent>
       what;
 
-  /// The memory that it keeps, roughly.
-  std::size_t bytes() const;
+  /// The memory of the payloads that it keeps; those of their clients bear it.
+  std::size_t payloadBytes() const;
+  /// All the memory that it keeps, roughly.
+  std::size_t bytes() const { return sizeof *this + payloadBytes(); }
 };
 
 using StoreBatch = std::vector<StoreOperation>;

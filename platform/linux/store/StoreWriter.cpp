@@ -103,7 +103,8 @@ StoreWriter::Result StoreWriter::resolveDoubt() {
 
 void StoreWriter::add(std::vector<StoreBatch> batches) {
   for (StoreBatch& batch : batches) {
-    for (const StoreOperation& operation : batch) uncommittedBytes_ += operation.bytes();
+    for (const StoreOperation& operation : batch)
+      uncommittedBytes_ += operation.payloadBytes();
     pending_.push_back(std::move(batch));
   }
   if (fault_) return;
@@ -283,7 +284,7 @@ std::vector<StoreBatch> StoreWriter::takeDone(std::size_t batches) {
   std::uint64_t rows = 0;
   for (const StoreBatch& batch : done) {
     for (const StoreOperation& operation : batch) {
-      uncommittedBytes_ -= std::min(uncommittedBytes_, operation.bytes());
+      uncommittedBytes_ -= std::min(uncommittedBytes_, operation.payloadBytes());
       if (isRow(operation)) ++rows;
     }
   }
@@ -434,7 +435,8 @@ void StoreWriter::keepAtMost(std::size_t count) {
                  pending_.begin() + static_cast<std::ptrdiff_t>(batches));
   uncommittedBytes_ = 0;
   for (const StoreBatch& batch : pending_) {
-    for (const StoreOperation& operation : batch) uncommittedBytes_ += operation.bytes();
+    for (const StoreOperation& operation : batch)
+      uncommittedBytes_ += operation.payloadBytes();
   }
 }
 

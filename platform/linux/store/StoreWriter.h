@@ -47,6 +47,7 @@ class StoreWriter {
 
   /// Whether there is anything to commit.
   bool hasUncommitted() const { return !pending_.empty(); }
+  /// Of payloads.
   std::size_t uncommittedBytes() const { return uncommittedBytes_; }
 
   /// Calls the completions of the flushes that wait with the fault's error.
