@@ -255,7 +255,7 @@ std::optional<Date> ValueView::date() const {
   return Date{*seconds.number()};
 }
 
-std::optional<std::string_view> ValueView::string() const {
+std::optional<std::string_view> ValueView::longString() const {
   const Head head = readHead(item_);
   if (head.majorType != kText) return std::nullopt;
   return asText({head.next, static_cast<std::size_t>(head.argument)});
@@ -286,7 +286,7 @@ std::optional<double> ValueView::number() const {
   return doubleOf(head);
 }
 
-const std::uint8_t* ValueView::end() const {
+const std::uint8_t* ValueView::endOfLongItem() const {
   const std::uint8_t* at = item_;
   for (std::uint64_t left = 1; left != 0; --left) {
     const Head head = readHead(at);

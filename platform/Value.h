@@ -115,7 +115,14 @@ class ValueView {
   std::optional<std::uint64_t> unsignedInteger() const;
   std::optional<double> floatingPoint() const;
   std::optional<Date> date() const;
-  std::optional<std::string_view> string() const;
+  std::optional<std::string_view> string() const {
+    const unsigned head = *item_;
+    if (head >= kShortTexts && head < kLongTexts) {
+      return std::string_view(reinterpret_cast<const char*>(item_ + 1),
+                              head - kShortTexts);
+    }
+    return longString();
+  }
   std::optional<ArrayView> array() const;
   std::optional<DictionaryView> dictionary() const;
 
@@ -129,14 +136,35 @@ class ValueView {
   std::span<const std::uint8_t> bytes() const { return {item_, end()}; }
   /// The first byte of the encoding.
   const std::uint8_t* data() const { return item_; }
-  /// One past the last byte of the encoding.
-  const std::uint8_t* end() const;
+  /// One past the last byte of the encoding. Numbers and short texts, nearly all
+  /// there are, are found by their first byte.
+  const std::uint8_t* end() const {
+    const unsigned head = *item_;
+    if (head >= kShortTexts && head < kLongTexts) return item_ + 1 + (head - kShortTexts);
+    if (head < kAfterIntegers || head >= kSimpleValues) {
+      return item_ + 1 + kArgumentBytes[head & 0x1F];
+    }
+    return endOfLongItem();
+  }
 
   /// Numbers are equal when their values are (1 and 1.0 are not: kinds
   /// differ); dictionaries are whatever the order of their entries.
   friend bool operator==(ValueView a, ValueView b);
 
  private:
+  // First bytes of encodings.
+  static constexpr unsigned kAfterIntegers = 0x40;
+  static constexpr unsigned kShortTexts = 0x60;
+  static constexpr unsigned kLongTexts = 0x78;
+  static constexpr unsigned kSimpleValues = 0xE0;  // Booleans, doubles.
+  // By the low 5 bits of the first byte.
+  static constexpr std::uint8_t kArgumentBytes[32] = {0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0,
+                                                      0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0,
+                                                      0, 0, 1, 2, 4, 8, 0, 0, 0, 0};
+
+  const std::uint8_t* endOfLongItem() const;
+  std::optional<std::string_view> longString() const;
+
   const std::uint8_t* item_;
 };
 
