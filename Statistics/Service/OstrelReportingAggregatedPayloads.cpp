@@ -30,14 +30,14 @@ void OstrelReportingAggregatedPayloads::Snapshot::forEach(
 
 void OstrelReportingAggregatedPayloads::append(std::string_view identifier,
                                                const Dictionary& payload) {
-  std::string head;
-  ValueEncoder encoder(head);
+  head_.clear();
+  ValueEncoder encoder(head_);
   encoder.beginDictionary(1);
   encoder.string(identifier);
   const auto bytes = payload.value().bytes();
-  std::uint8_t* at = room(head.size() + bytes.size());
-  std::memcpy(at, head.data(), head.size());
-  std::memcpy(at + head.size(), bytes.data(), bytes.size());
+  std::uint8_t* at = room(head_.size() + bytes.size());
+  std::memcpy(at, head_.data(), head_.size());
+  std::memcpy(at + head_.size(), bytes.data(), bytes.size());
   ++size_;
 }
 

@@ -4,6 +4,7 @@
 #include <cstdint>
 #include <functional>
 #include <memory>
+#include <string>
 #include <string_view>
 #include <vector>
 
@@ -64,6 +65,7 @@ class OstrelReportingAggregatedPayloads {
   std::size_t size_ = 0;
   std::vector<std::shared_ptr<const MutableDictionary>> front_;  // Latest last.
   std::vector<Chunk> chunks_;
+  std::string head_;  // Of the last message's entry; keeps its memory for the next.
 };
 
 /// The list with its own monitor.

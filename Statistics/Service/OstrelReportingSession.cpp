@@ -45,6 +45,9 @@ constexpr std::int32_t kDeviceClassWithoutOrientation = 6;
 constexpr std::string_view kHostApplicationKey = "HostApplicationDisplayID";
 constexpr std::uint32_t kLogDirectoryPermissions = 0777;
 
+// Room for the longest there is, so that an identifier is one allocation.
+constexpr std::size_t kLongestIdentifier = 64;
+
 // Kept: the backend gets the low half of the category, log lines get all of it.
 // [KeepsFullCategoryInLogAndLow16BitsOnTheWire]
 std::uint16_t categoryOnTheWire(MessageCategory category) {
@@ -343,7 +346,9 @@ void OstrelReportingSession::aggregate(const Dictionary& payload,
 // [KeepsSharedCounterForEqualNames]
 std::string OstrelReportingSession::messageIdForCategory(MessageCategory category,
                                                          MessageType type) {
-  std::string identifier = CategoryName(category);
+  std::string identifier;
+  identifier.reserve(kLongestIdentifier);
+  appendCategoryName(identifier, category);
   identifier += '_';
   identifier += MessageTypeName(type);
   const std::int64_t count = ++messageTypeCounts_[identifier];
