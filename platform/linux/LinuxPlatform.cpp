@@ -52,8 +52,8 @@ Outcome<std::unique_ptr<LinuxPlatform>> LinuxPlatform::open() {
   const auto peers = std::make_shared<PeerRegistry>();
   auto listener = UnixSocketIPCListener::open(reportingSocketPath(), peers);
   if (!listener.value) return {std::nullopt, std::move(listener.error)};
-  auto bindings = std::unique_ptr<Bindings>(
-      new Bindings{log, peers, *std::move(listener.value)});
+  auto bindings =
+      std::unique_ptr<Bindings>(new Bindings{log, peers, *std::move(listener.value)});
   return {std::unique_ptr<LinuxPlatform>(new LinuxPlatform(std::move(bindings))),
           std::nullopt};
 }

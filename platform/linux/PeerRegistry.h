@@ -19,9 +19,9 @@ class PeerRegistry {
  public:
   /// What is known of the process that a client's id meant when it connected.
   struct Peer {
-    bool wasConnected = false;   // The other two mean something.
-    bool isConnected = false;    // Not any more: its id may be another's by now.
-    FileDescriptor descriptor;   // Readable once the process has ended. May be none.
+    bool wasConnected = false;  // The other two mean something.
+    bool isConnected = false;   // Not any more: its id may be another's by now.
+    FileDescriptor descriptor;  // Readable once the process has ended. May be none.
   };
 
   using Key = std::uint64_t;

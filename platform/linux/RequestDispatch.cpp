@@ -134,10 +134,8 @@ constexpr std::array<Handler, 12> kHandlers = {{
      [](Protocol& object, Request&, Reply reply) {
        object.getAllReporters(std::move(reply));
      }},
-    {Operation::kKillService,
-     [](Protocol& object, Request&, Reply reply) {
-       object.killService(std::move(reply));
-     }},
+    {Operation::kKillService, [](Protocol& object, Request&,
+                                 Reply reply) { object.killService(std::move(reply)); }},
 }};
 
 constexpr bool rowsStandInOrder() {

@@ -13,8 +13,7 @@ namespace ostrel {
 /// same where that tells when the request has run. `request` is used up and must not
 /// be a farewell.
 void dispatchRequest(OstrelReportingServiceProtocol& object,
-                     const std::shared_ptr<PeerChannel>& channel,
-                     wire::Request& request);
+                     const std::shared_ptr<PeerChannel>& channel, wire::Request& request);
 
 /// Whether the reply callback of an operation may be kept long after the operation
 /// has run.

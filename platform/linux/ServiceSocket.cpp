@@ -26,8 +26,7 @@ constexpr mode_t kSocketMode = 0660;
 constexpr int kBacklog = 4096;
 
 ErrorObject failure(int error, const std::string& sentence) {
-  return {std::string(kPOSIXErrorDomain), error,
-          sentence + ": " + std::strerror(error)};
+  return {std::string(kPOSIXErrorDomain), error, sentence + ": " + std::strerror(error)};
 }
 
 Outcome<ServiceSocket> failed(const std::string& sentence) {
@@ -50,8 +49,7 @@ bool makeNonBlocking(int descriptor) {
 
 }  // namespace
 
-ServiceSocket::ServiceSocket(FileDescriptor socket, FileDescriptor lock,
-                             std::string path)
+ServiceSocket::ServiceSocket(FileDescriptor socket, FileDescriptor lock, std::string path)
     : socket_(std::move(socket)), lock_(std::move(lock)), path_(std::move(path)) {}
 
 ServiceSocket::~ServiceSocket() {
@@ -91,14 +89,13 @@ Outcome<ServiceSocket> ServiceSocket::bind(const std::string& path) {
     return failed("the directory of " + path + " cannot be made");
   }
 
-  FileDescriptor lock(::open(lockPath.c_str(),
-                             O_RDWR | O_CREAT | O_CLOEXEC | O_NOFOLLOW, kLockMode));
+  FileDescriptor lock(
+      ::open(lockPath.c_str(), O_RDWR | O_CREAT | O_CLOEXEC | O_NOFOLLOW, kLockMode));
   if (!lock) return failed("the lock " + lockPath + " cannot be opened");
   if (::flock(lock.get(), LOCK_EX | LOCK_NB) != 0) {
     if (errno != EWOULDBLOCK) return failed("the lock " + lockPath + " is of no use");
-    return {std::nullopt,
-            ErrorObject{std::string(kPOSIXErrorDomain), EADDRINUSE,
-                        "another service is already listening at " + path}};
+    return {std::nullopt, ErrorObject{std::string(kPOSIXErrorDomain), EADDRINUSE,
+                                      "another service is already listening at " + path}};
   }
 
   FileDescriptor socket(
@@ -107,8 +104,7 @@ Outcome<ServiceSocket> ServiceSocket::bind(const std::string& path) {
   ::unlink(fresh.c_str());
   const auto* plain = reinterpret_cast<const sockaddr*>(&address);
   if (::bind(socket.get(), plain, sizeof address) != 0 ||
-      ::chmod(fresh.c_str(), kSocketMode) != 0 ||
-      ::listen(socket.get(), kBacklog) != 0 ||
+      ::chmod(fresh.c_str(), kSocketMode) != 0 || ::listen(socket.get(), kBacklog) != 0 ||
       ::rename(fresh.c_str(), path.c_str()) != 0) {
     const int error = errno;
     ::unlink(fresh.c_str());

@@ -96,8 +96,8 @@ TEST_F(WaitingSessions, AreAllDetachedAfterNineSecondsAndHoldNoThread) {
     const auto asked = steady_clock::now();
     other->getAllReporters([&](const ReporterIDs&) { answered.set_value(); });
     answered.get_future().wait();
-    longestReply = std::max<std::chrono::nanoseconds>(longestReply,
-                                                      steady_clock::now() - asked);
+    longestReply =
+        std::max<std::chrono::nanoseconds>(longestReply, steady_clock::now() - asked);
     mostThreads = std::max(mostThreads, threadsOfProcess());
     ++repliesWhileWaiting;
   }
