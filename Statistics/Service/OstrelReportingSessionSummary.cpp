@@ -2,8 +2,11 @@
 
 #include <algorithm>
 #include <cstdint>
+#include <deque>
+#include <functional>
+#include <string>
 #include <string_view>
-#include <unordered_map>
+#include <utility>
 #include <vector>
 
 #include "Statistics/OstrelReportingUtility.h"
@@ -16,8 +19,9 @@ bool holdsBlank(ValueView key) {
   return text && text->find(' ') != std::string_view::npos;
 }
 
-// The values of the entries under their keys. A key's values are a list through
-// `values`: a session of a million messages has about as many keys.
+// The values of the entries under their keys. A session of a million messages has
+// about as many keys, so that what is kept for each is small: 50 bytes, and no
+// allocation of its own.
 class Grouping {
  public:
   Grouping(const Value& firstKey, const Value& firstValue,
@@ -30,20 +34,28 @@ class Grouping {
 
   std::size_t groupCount() const { return groups_.size(); }
 
+  /// Calls `use` with each group's key and joined text, encoded.
   template <typename Use>
   void forEachGroup(Use use) const {
+    std::string text;
+    std::string encoded;
     for (const Group& group : groups_) {
-      std::string text;
+      text.clear();
       for (std::size_t at = group.first; at != kNone; at = values_[at].next) {
         if (at != group.first) text += ',';
         appendDescription(text, values_[at].value);
       }
-      use(group.key, text);
+      encoded.clear();
+      ValueEncoder encoder(encoded);
+      encoder.item(group.key);
+      encoder.string(text);
+      use(encoded);
     }
   }
 
  private:
   static constexpr std::size_t kNone = SIZE_MAX;
+  static constexpr std::size_t kFewestSlots = 64;  // A power of two, as all counts.
   struct Link {
     ValueView value;
     std::size_t next;
@@ -54,25 +66,45 @@ class Grouping {
     std::size_t last;
   };
 
-  void add(ValueView key, ValueView value) {
+  static std::string_view nameOf(ValueView key) {
     const auto bytes = key.bytes();
-    const std::string_view name(reinterpret_cast<const char*>(bytes.data()),
-                                bytes.size());
+    return {reinterpret_cast<const char*>(bytes.data()), bytes.size()};
+  }
+
+  void add(ValueView key, ValueView value) {
+    const std::size_t link = values_.size();
     values_.push_back({value, kNone});
-    const std::size_t link = values_.size() - 1;
-    const auto [found, isNew] = indices_.try_emplace(name, groups_.size());
-    if (isNew) {
+    if (2 * groups_.size() >= slots_.size()) growSlots();
+    std::size_t& slot = findSlot(key);
+    if (slot == kNone) {
+      slot = groups_.size();
       groups_.push_back({key, link, link});
       return;
     }
-    Group& group = groups_[found->second];
+    Group& group = groups_[slot];
     values_[group.last].next = link;
     group.last = link;
   }
 
-  std::vector<Link> values_;
-  std::vector<Group> groups_;
-  std::unordered_map<std::string_view, std::size_t> indices_;
+  // The slot of the key's group, or the free one where it belongs.
+  std::size_t& findSlot(ValueView key) {
+    const std::string_view name = nameOf(key);
+    std::size_t at = std::hash<std::string_view>()(name);
+    while (true) {
+      std::size_t& slot = slots_[at++ & (slots_.size() - 1)];
+      if (slot == kNone || nameOf(groups_[slot].key) == name) return slot;
+    }
+  }
+
+  void growSlots() {
+    slots_.assign(std::max(kFewestSlots, 2 * slots_.size()), kNone);
+    for (std::size_t i = 0; i < groups_.size(); ++i) findSlot(groups_[i].key) = i;
+  }
+
+  // A value's place in a group's list; the lists do not move as they grow.
+  std::deque<Link> values_;
+  std::deque<Group> groups_;
+  std::vector<std::size_t> slots_;  // Of `groups_`, by the hash of the key.
 };
 
 }  // namespace
@@ -100,14 +132,17 @@ Dictionary summaryEvent(ServiceType serviceType,
   const Value key("Ostrel_Session_Summary_Event");
   const Value type(static_cast<std::uint16_t>(serviceType));
   const Grouping grouping(key, type, entries);
-  std::string event;
-  ValueEncoder encoder(event);
-  encoder.beginDictionary(grouping.groupCount());
-  grouping.forEachGroup([&](ValueView groupKey, const std::string& text) {
-    encoder.item(groupKey);
-    encoder.string(text);
-  });
-  return Dictionary::copyOf(event);
+  std::string head;
+  ValueEncoder(head).beginDictionary(grouping.groupCount());
+  // The texts are made twice: a summary may be as large as all that it sums up, and
+  // a buffer that grew with it would take as much again.
+  std::size_t size = head.size();
+  grouping.forEachGroup([&](const std::string& group) { size += group.size(); });
+  ValueBuffer event = ValueBuffer::make(size);
+  std::uint8_t* at = std::copy(head.begin(), head.end(), event.data());
+  grouping.forEachGroup(
+      [&](const std::string& group) { at = std::copy(group.begin(), group.end(), at); });
+  return Dictionary(event, std::as_const(event).data());
 }
 
 std::string sessionLogFileName(const Clock& clock, Date date,
