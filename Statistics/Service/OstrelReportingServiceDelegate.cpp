@@ -42,6 +42,9 @@ AtomicProperty<std::shared_ptr<WorkQueue>>& serverQueueProperty() {
   return property;
 }
 
+// The queue of the property: asserted several times a request, without its lock.
+std::atomic<const WorkQueue*> assertedServerQueue{nullptr};
+
 std::atomic<int> defaultsNotifyToken{-1};
 
 template <typename Reply, typename... Values>
@@ -113,7 +116,9 @@ void connectionInterrupted(const std::weak_ptr<OstrelReportingServerInstance>& w
 std::shared_ptr<WorkQueue> serverQueue() { return serverQueueProperty().get(); }
 
 void assertOnServerQueue() {
-  if (const auto queue = serverQueue()) queue->assertCurrent();
+  if (const auto* queue = assertedServerQueue.load(std::memory_order_acquire)) {
+    queue->assertCurrent();
+  }
 }
 
 std::shared_ptr<OstrelReportingServiceDelegate> OstrelReportingServiceDelegate::init(
@@ -123,6 +128,7 @@ std::shared_ptr<OstrelReportingServiceDelegate> OstrelReportingServiceDelegate::
   serverQueueProperty().set(platform.workQueues->makeSerialQueue(
       "com.orbisk.ostrel.reporting.server", QualityOfService::kUserInteractive,
       /*relativePriority=*/0));
+  assertedServerQueue.store(serverQueue().get(), std::memory_order_release);
   root->listenForDefaultsNotification();
   root->driverUtility_ = OstrelReportingDriverUtility::init(platform);
   return root;

@@ -44,6 +44,7 @@ void PeerChannel::reply(wire::RequestNumber number, const wire::ReplyValue& valu
     out_.resize(before);
     hasTooManyUnread_ = true;
   }
+  unread_ = out_.size() - written_;
   if (!std::exchange(isAnnounced_, true)) waker_->needsAttention(id_);
 }
 
@@ -81,11 +82,6 @@ bool PeerChannel::awaitBudget() {
   return isOwnFull || isUserFull;
 }
 
-std::size_t PeerChannel::unreadBytes() const {
-  const std::lock_guard lock(mutex_);
-  return out_.size() - written_;
-}
-
 bool PeerChannel::hasTooManyUnread() const {
   const std::lock_guard lock(mutex_);
   return hasTooManyUnread_;
@@ -112,12 +108,14 @@ bool PeerChannel::flush(int socket) {
     out_.erase(0, written_);
     written_ = 0;
   }
+  unread_ = out_.size() - written_;
   return true;
 }
 
 void PeerChannel::close(std::string_view reason) {
   const std::lock_guard lock(mutex_);
   if (!std::exchange(isClosed_, true)) wire::appendClosing(out_, reason);
+  unread_ = out_.size() - written_;
 }
 
 void PeerChannel::close() {
@@ -125,6 +123,7 @@ void PeerChannel::close() {
   isClosed_ = true;
   written_ = 0;
   std::string().swap(out_);
+  unread_ = 0;
 }
 
 }  // namespace ostrel

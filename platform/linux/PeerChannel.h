@@ -47,7 +47,7 @@ class PeerChannel final : public PayloadAccount {
   /// Asks for `LoopWaker::budgetEased` once there is room; false: there is already.
   bool awaitBudget();
   /// What is waiting for its reader.
-  std::size_t unreadBytes() const;
+  std::size_t unreadBytes() const { return unread_.load(std::memory_order_relaxed); }
   /// Whether more waits than the client may leave unread.
   bool hasTooManyUnread() const;
   /// Writes what waits to the socket as far as that takes it. False when the peer
@@ -72,6 +72,8 @@ class PeerChannel final : public PayloadAccount {
   std::uint64_t chargedMark_ = 0;  // The loop's.
   std::atomic<std::uint64_t> ranMark_{0};
   std::atomic<std::size_t> idsReplyBytes_;
+  // Of `out_`; written under the lock, asked for before each request without it.
+  std::atomic<std::size_t> unread_{0};
 
   mutable std::mutex mutex_;
   // Guarded by `mutex_`.
