@@ -10,23 +10,20 @@ namespace ostrel {
 LoopWaker::LoopWaker() : event_(::eventfd(/*initval=*/0, EFD_CLOEXEC | EFD_NONBLOCK)) {}
 
 void LoopWaker::needsAttention(ConnectionID connection) {
-  {
-    const std::lock_guard lock(mutex_);
-    work_.connections.push_back(connection);
-  }
-  wake();
+  std::unique_lock lock(mutex_);
+  work_.connections.push_back(connection);
+  wake(std::move(lock));
 }
 
 void LoopWaker::budgetEased() {
-  {
-    const std::lock_guard lock(mutex_);
-    work_.hasBudgetEased = true;
-  }
-  wake();
+  std::unique_lock lock(mutex_);
+  work_.hasBudgetEased = true;
+  wake(std::move(lock));
 }
 
-void LoopWaker::wake() {
-  if (isAwake_.exchange(true)) return;
+void LoopWaker::wake(std::unique_lock<std::mutex> lock) {
+  if (!std::exchange(isWaiting_, false)) return;
+  lock.unlock();
   const std::uint64_t one = 1;
   [[maybe_unused]] const ssize_t written = ::write(event_.get(), &one, sizeof one);
 }
@@ -38,10 +35,20 @@ void LoopWaker::take(Work& work) {
   std::swap(work, work_);
 }
 
+bool LoopWaker::beginWait() {
+  const std::lock_guard lock(mutex_);
+  isWaiting_ = work_.connections.empty() && !work_.hasBudgetEased;
+  return isWaiting_;
+}
+
+void LoopWaker::endWait() {
+  const std::lock_guard lock(mutex_);
+  isWaiting_ = false;
+}
+
 void LoopWaker::clear() {
   std::uint64_t count;
   [[maybe_unused]] const ssize_t got = ::read(event_.get(), &count, sizeof count);
-  isAwake_ = false;
 }
 
 }  // namespace ostrel

@@ -1,6 +1,5 @@
 #pragma once
 
-#include <atomic>
 #include <cstdint>
 #include <mutex>
 #include <vector>
@@ -11,7 +10,8 @@
 namespace ostrel {
 
 /// Through it other threads tell the listener's loop which connections need it.
-/// However many do before the loop looks, it costs them one system call.
+/// However many do before the loop looks, it costs them one system call, and none
+/// while the loop does not wait.
 class LoopWaker {
  public:
   using ConnectionID = std::uint64_t;
@@ -30,20 +30,25 @@ class LoopWaker {
   void needsAttention(ConnectionID connection);
   void budgetEased();
 
-  /// The work since the last call, in `work`, whose memory is used again. The loop
-  /// calls it before each wait.
-  void take(Work& work);
+  // The loop's.
 
-  /// The loop calls it when `descriptor` was readable.
+  /// The work since the last call, in `work`, whose memory is used again.
+  void take(Work& work);
+  /// Before each wait: false when there is work already. From now on whoever
+  /// brings some makes `descriptor` readable.
+  bool beginWait();
+  /// After each wait.
+  void endWait();
+  /// When `descriptor` was readable.
   void clear();
 
  private:
-  void wake();
+  void wake(std::unique_lock<std::mutex> lock);
 
   const FileDescriptor event_;
-  std::atomic<bool> isAwake_{false};
-  std::mutex mutex_;
-  Work work_;  // Guarded by `mutex_`.
+  std::mutex mutex_;  // Of what follows.
+  Work work_;
+  bool isWaiting_ = false;  // And nobody has woken it.
 };
 
 }  // namespace ostrel

@@ -34,12 +34,13 @@ namespace ostrel {
 namespace {
 
 using Steps = std::vector<Task>;
+using Emptied = std::array<Steps, 2>;  // The lists of a strand, to be used again.
 
 /// After so many steps a strand lets the others in line go first.
 constexpr int kStepsOfTurn = 128;
 /// Step lists that a pool keeps for the next strands, and the longest kept.
 constexpr std::size_t kMostSpares = 8;
-constexpr std::size_t kLongestSpare = 256;
+constexpr std::size_t kLongestSpare = 512;
 
 constexpr std::chrono::milliseconds kThreadRetry{100};
 constexpr std::chrono::seconds kLastWait{2};
@@ -73,6 +74,7 @@ class ThreadPoolWorkQueues::Pool : public std::enable_shared_from_this<Pool> {
     const char* name;
     int niceness;
     std::size_t mostThreads;
+    bool isBatched;  // Its strands may be run by a `Batch`.
   };
   enum class Placed { kDropped, kQuiet, kWakes };
 
@@ -84,6 +86,11 @@ class ThreadPoolWorkQueues::Pool : public std::enable_shared_from_this<Pool> {
   /// `kWakes` the caller calls `wakeOne`, best without a lock.
   Placed place(std::shared_ptr<Strand> strand, Steps& steps);
   void wakeOne() { wake_.notify_one(); }
+
+  /// As `place`, for a strand that a batch runs: it gets into no line.
+  Placed begin(Steps& steps);
+  void runHere(std::shared_ptr<Strand> strand);
+  bool isBatched() const { return kind_.isBatched; }
 
   void async(Task step);
 
@@ -99,12 +106,15 @@ class ThreadPoolWorkQueues::Pool : public std::enable_shared_from_this<Pool> {
   };
 
   bool hasEnded() const { return isEnding_ && liveThreads_ == 0; }
+  void giveMemory(Steps& steps);
+  void takeMemory(Emptied& emptied);
   void append(std::shared_ptr<Strand> strand);
   std::shared_ptr<Strand> takeStrand();
   Placed callThread();
   void addThread();
   void work();
-  void runStrand(std::shared_ptr<Strand> strand, std::unique_lock<std::mutex>& lock);
+  /// Without the lock, then with it. True when the strand is in line again.
+  bool runStrand(std::shared_ptr<Strand> strand, std::unique_lock<std::mutex>& lock);
   void runLoose(std::unique_lock<std::mutex>& lock);
 
   const Kind kind_;
@@ -130,8 +140,6 @@ class ThreadPoolWorkQueues::Pool : public std::enable_shared_from_this<Pool> {
 class ThreadPoolWorkQueues::Strand final : public WorkQueue,
                                            public std::enable_shared_from_this<Strand> {
  public:
-  using Emptied = std::array<Steps, 2>;
-
   Strand(std::shared_ptr<Pool> pool, const std::string& label, bool isLow)
       : isLow_(isLow), label_(label), pool_(std::move(pool)) {}
 
@@ -184,7 +192,10 @@ void ThreadPoolWorkQueues::Strand::async(Task step) {
 void ThreadPoolWorkQueues::Strand::placeInLine(std::unique_lock<std::mutex>& lock,
                                                Steps& steps, Task& step) {
   isPlaced_ = true;
-  const Pool::Placed placed = pool_->place(shared_from_this(), incoming_);
+  const bool isBatched =
+      currentBatch_ != nullptr && pool_->isBatched() && currentBatch_->takes();
+  const Pool::Placed placed =
+      isBatched ? pool_->begin(incoming_) : pool_->place(shared_from_this(), incoming_);
   if (placed == Pool::Placed::kDropped) {
     isPlaced_ = false;
     lock.unlock();
@@ -193,13 +204,18 @@ void ThreadPoolWorkQueues::Strand::placeInLine(std::unique_lock<std::mutex>& loc
   // The thread that takes the strand waits for this lock. Once it has it, the
   // strand may end.
   steps.push_back(std::move(step));
+  if (isBatched) currentBatch_->take(shared_from_this(), pool_);
   if (placed == Pool::Placed::kQuiet) {
     lock.unlock();
     return;
   }
   const std::shared_ptr<Pool> pool = pool_;
   lock.unlock();
-  pool->wakeOne();
+  if (currentBatch_ != nullptr) {
+    currentBatch_->wakeLater(pool);
+  } else {
+    pool->wakeOne();
+  }
 }
 
 void ThreadPoolWorkQueues::Strand::suspend() {
@@ -288,12 +304,23 @@ ThreadPoolWorkQueues::Pool::Placed ThreadPoolWorkQueues::Pool::place(
   const std::lock_guard lock(mutex_);
   if (hasEnded()) return Placed::kDropped;
   shared_->begin();
-  if (steps.capacity() == 0 && !spares_.empty()) {
-    steps = std::move(spares_.back());
-    spares_.pop_back();
-  }
+  giveMemory(steps);
   append(std::move(strand));
   return callThread();
+}
+
+ThreadPoolWorkQueues::Pool::Placed ThreadPoolWorkQueues::Pool::begin(Steps& steps) {
+  const std::lock_guard lock(mutex_);
+  if (hasEnded()) return Placed::kDropped;
+  shared_->begin();
+  giveMemory(steps);
+  return Placed::kQuiet;
+}
+
+void ThreadPoolWorkQueues::Pool::giveMemory(Steps& steps) {
+  if (steps.capacity() != 0 || spares_.empty()) return;
+  steps = std::move(spares_.back());
+  spares_.pop_back();
 }
 
 void ThreadPoolWorkQueues::Pool::async(Task step) {
@@ -369,6 +396,7 @@ void ThreadPoolWorkQueues::Pool::work() {
     if (!loose_.empty() && isLooseNext) {
       runLoose(lock);
     } else if (auto strand = takeStrand()) {
+      lock.unlock();
       runStrand(std::move(strand), lock);
     } else if (!loose_.empty()) {
       runLoose(lock);
@@ -387,15 +415,14 @@ void ThreadPoolWorkQueues::Pool::work() {
   }
 }
 
-void ThreadPoolWorkQueues::Pool::runStrand(std::shared_ptr<Strand> strand,
+bool ThreadPoolWorkQueues::Pool::runStrand(std::shared_ptr<Strand> strand,
                                            std::unique_lock<std::mutex>& lock) {
-  lock.unlock();
-  Strand::Emptied emptied;
+  Emptied emptied;
   const bool hasMore = strand->runTurn(emptied);
   if (hasMore) {
     lock.lock();
     append(std::move(strand));
-    return;
+    return true;
   }
   strand.reset();  // Perhaps its end.
   shared_->finish();
@@ -403,11 +430,24 @@ void ThreadPoolWorkQueues::Pool::runStrand(std::shared_ptr<Strand> strand,
     if (steps.capacity() > kLongestSpare) Steps().swap(steps);
   }
   lock.lock();
+  takeMemory(emptied);
+  return false;
+}
+
+void ThreadPoolWorkQueues::Pool::takeMemory(Emptied& emptied) {
   for (Steps& steps : emptied) {
     if (steps.capacity() > 0 && spares_.size() < kMostSpares) {
       spares_.push_back(std::move(steps));
     }
   }
+}
+
+// A thread of the pool does the rest when other strands wait for one.
+void ThreadPoolWorkQueues::Pool::runHere(std::shared_ptr<Strand> strand) {
+  std::unique_lock lock(mutex_, std::defer_lock);
+  if (!runStrand(std::move(strand), lock) || callThread() != Placed::kWakes) return;
+  lock.unlock();
+  wakeOne();
 }
 
 void ThreadPoolWorkQueues::Pool::runLoose(std::unique_lock<std::mutex>& lock) {
@@ -443,6 +483,17 @@ void ThreadPoolWorkQueues::Pool::end() {
   }
 }
 
+thread_local ThreadPoolWorkQueues::Batch* ThreadPoolWorkQueues::currentBatch_ = nullptr;
+
+ThreadPoolWorkQueues::Batch::Batch() { currentBatch_ = this; }
+
+ThreadPoolWorkQueues::Batch::~Batch() {
+  isRunning_ = true;
+  if (strand_ != nullptr) pool_->runHere(std::move(strand_));
+  currentBatch_ = nullptr;
+  for (const auto& pool : poolsToWake_) pool->wakeOne();
+}
+
 /// The concurrent queue: the background pool without a strand.
 class ThreadPoolWorkQueues::Background final : public ConcurrentQueue {
  public:
@@ -467,13 +518,16 @@ class ThreadPoolWorkQueues::Background final : public ConcurrentQueue {
 ThreadPoolWorkQueues::ThreadPoolWorkQueues(std::shared_ptr<TimerThread> timers)
     : shared_(std::make_shared<Shared>()),
       pools_{std::make_shared<Pool>(
-                 Pool::Kind{"ostrel-ui-", /*niceness=*/-5, kMostInteractiveThreads},
+                 Pool::Kind{"ostrel-ui-", /*niceness=*/-5, kMostInteractiveThreads,
+                            /*isBatched=*/true},
                  shared_, timers),
              std::make_shared<Pool>(
-                 Pool::Kind{"ostrel-util-", /*niceness=*/5, kMostUtilityThreads}, shared_,
-                 timers),
+                 Pool::Kind{"ostrel-util-", /*niceness=*/5, kMostUtilityThreads,
+                            /*isBatched=*/false},
+                 shared_, timers),
              std::make_shared<Pool>(
-                 Pool::Kind{"ostrel-bg-", /*niceness=*/10, kMostBackgroundThreads},
+                 Pool::Kind{"ostrel-bg-", /*niceness=*/10, kMostBackgroundThreads,
+                            /*isBatched=*/false},
                  shared_, timers)},
       background_(std::make_unique<Background>(
           pools_[static_cast<std::size_t>(QualityOfService::kBackground)], timers)) {}

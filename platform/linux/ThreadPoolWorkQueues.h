@@ -4,6 +4,8 @@
 #include <chrono>
 #include <cstddef>
 #include <memory>
+#include <utility>
+#include <vector>
 
 #include "platform/WorkQueue.h"
 #include "platform/linux/TimerThread.h"
@@ -18,6 +20,13 @@ namespace ostrel {
 /// nothing wakes up. A step must not throw.
 class ThreadPoolWorkQueues final : public WorkQueueFactory {
  public:
+  /// While it lives, the first idle interactive queue that the calling thread
+  /// queues on waits for its end, and runs then, on this thread. So a thread that
+  /// turns a batch of input into steps hands nothing over: a batch costs neither a
+  /// wake-up nor a change of threads, and a request is answered by the thread that
+  /// read it. At most one a thread; not on a queue.
+  class Batch;
+
   static constexpr std::size_t kMostInteractiveThreads = 2;
   static constexpr std::size_t kMostUtilityThreads = 2;
   static constexpr std::size_t kMostBackgroundThreads = 4;
@@ -49,9 +58,35 @@ class ThreadPoolWorkQueues final : public WorkQueueFactory {
   class Pool;
   class Strand;
 
+  static thread_local Batch* currentBatch_;
+
   const std::shared_ptr<Shared> shared_;
   const std::array<std::shared_ptr<Pool>, 3> pools_;  // By quality of service.
   const std::unique_ptr<Background> background_;
+};
+
+class ThreadPoolWorkQueues::Batch {
+ public:
+  Batch();
+  ~Batch();
+  Batch(const Batch&) = delete;
+  Batch& operator=(const Batch&) = delete;
+
+ private:
+  friend class ThreadPoolWorkQueues;
+
+  bool takes() const { return strand_ == nullptr && !isRunning_; }
+  void take(std::shared_ptr<Strand> strand, std::shared_ptr<Pool> pool) {
+    strand_ = std::move(strand);
+    pool_ = std::move(pool);
+  }
+  /// Other pools' threads find a whole batch when they wake up.
+  void wakeLater(std::shared_ptr<Pool> pool) { poolsToWake_.push_back(std::move(pool)); }
+
+  bool isRunning_ = false;
+  std::shared_ptr<Strand> strand_;
+  std::shared_ptr<Pool> pool_;
+  std::vector<std::shared_ptr<Pool>> poolsToWake_;
 };
 
 }  // namespace ostrel

@@ -87,6 +87,78 @@ TEST_F(ThreadPoolWorkQueuesTest, RunsTwoQueuesOfAClassAtOnce) {
   EXPECT_TRUE(drain());
 }
 
+TEST_F(ThreadPoolWorkQueuesTest, ABatchRunsAnInteractiveQueueOnItsThreadAtItsEnd) {
+  const auto queue = makeQueue(QualityOfService::kUserInteractive);
+  std::vector<int> ran;
+  std::thread::id thread;
+  {
+    const ThreadPoolWorkQueues::Batch batch;
+    queue->async([&] {
+      thread = std::this_thread::get_id();
+      EXPECT_TRUE(queue->isCurrent());
+      ran.push_back(1);
+      queue->async([&] { ran.push_back(3); });
+    });
+    queue->async([&] { ran.push_back(2); });
+    EXPECT_TRUE(ran.empty());
+  }
+  EXPECT_EQ(ran, (std::vector<int>{1, 2, 3}));
+  EXPECT_EQ(thread, std::this_thread::get_id());
+  EXPECT_EQ(queues_->threadCount(), 0u);
+  EXPECT_TRUE(drain());
+}
+
+TEST_F(ThreadPoolWorkQueuesTest, ABatchLeavesASecondInteractiveQueueToAThread) {
+  const auto first = makeQueue(QualityOfService::kUserInteractive);
+  const auto second = makeQueue(QualityOfService::kUserInteractive);
+  std::binary_semaphore ran{0};
+  {
+    const ThreadPoolWorkQueues::Batch batch;
+    first->async([] {});
+    second->async([&] { ran.release(); });
+    ran.acquire();
+  }
+  EXPECT_EQ(queues_->threadCount(), 1u);
+}
+
+TEST_F(ThreadPoolWorkQueuesTest, ABatchWakesTheThreadsOfOtherQueuesAtItsEnd) {
+  const auto server = makeQueue(QualityOfService::kUserInteractive);
+  const auto session = makeQueue(QualityOfService::kUtility);
+  session->async([] {});
+  ASSERT_TRUE(drain());
+  std::vector<int> ran;
+  std::binary_semaphore isDone{0};
+  {
+    const ThreadPoolWorkQueues::Batch batch;
+    server->async([&] {
+      EXPECT_FALSE(session->isCurrent());
+      session->async([&] { ran.push_back(1); });
+      session->async([&] {
+        EXPECT_FALSE(server->isCurrent());
+        ran.push_back(2);
+        isDone.release();
+      });
+    });
+  }
+  isDone.acquire();
+  EXPECT_EQ(ran, (std::vector<int>{1, 2}));
+}
+
+TEST_F(ThreadPoolWorkQueuesTest, ABatchTakesNoQueueThatAThreadRuns) {
+  const auto queue = makeQueue(QualityOfService::kUserInteractive);
+  Gate gate;
+  queue->async(gate.holdingStep());
+  gate.waitUntilHolding();
+  std::thread::id thread;
+  {
+    const ThreadPoolWorkQueues::Batch batch;
+    queue->async([&] { thread = std::this_thread::get_id(); });
+  }
+  gate.open();
+  ASSERT_TRUE(drain());
+  EXPECT_NE(thread, std::this_thread::get_id());
+}
+
 TEST_F(ThreadPoolWorkQueuesTest, RunsFourBackgroundStepsAtOnce) {
   Gate gate;
   ConcurrentQueue& background = queues_->backgroundQueue();

@@ -1,4 +1,6 @@
-// One thread, one epoll. A connection is in the epoll only while it has something
+// One thread, one epoll. The requests that one look at the sockets brings are served
+// on this thread too before it waits again, and their replies written: a round trip
+// takes no other thread. A connection is in the epoll only while it has something
 // to wait for: a client that is held back is taken out, so that its hanging up does
 // not spin the loop, and comes back when its requests have been carried out.
 #include "platform/linux/UnixSocketIPCListener.h"
@@ -14,6 +16,7 @@
 #include "platform/Logging.h"
 #include "platform/linux/ProcProcessInfo.h"
 #include "platform/linux/SystemdService.h"
+#include "platform/linux/ThreadPoolWorkQueues.h"
 
 #ifndef SO_PEERPIDFD
 #define SO_PEERPIDFD 77
@@ -94,14 +97,21 @@ void UnixSocketIPCListener::resume() {
   notifySystemd("READY=1");
   std::array<epoll_event, kMostEvents> events;
   while (!isStopping_) {
-    handleWork();
+    const bool mayWait = waker_->beginWait();
     const int count = ::epoll_wait(epoll_.get(), events.data(), kMostEvents,
-                                   millisecondsToWait(Clock::now()));
-    for (int i = 0; i < count; ++i) {
-      const epoll_event& event = events[static_cast<std::size_t>(i)];
-      handleEvent(event.data.u64, event.events);
+                                   mayWait ? millisecondsToWait(Clock::now()) : 0);
+    waker_->endWait();
+    {
+      const ThreadPoolWorkQueues::Batch requests;
+      for (int i = 0; i < count; ++i) {
+        const epoll_event& event = events[static_cast<std::size_t>(i)];
+        handleEvent(event.data.u64, event.events);
+      }
+      handleDeadlines(Clock::now());
     }
-    handleDeadlines(Clock::now());
+    // The requests have been served, and many replies are there.
+    const ThreadPoolWorkQueues::Batch requests;
+    handleWork();
   }
   notifySystemd("STOPPING=1");
   while (!connections_.empty()) {
