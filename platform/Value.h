@@ -203,7 +203,7 @@ class ArrayView {
   std::size_t size() const { return size_; }
   bool empty() const { return size_ == 0; }
   Iterator begin() const { return {first_, size_}; }
-  Iterator end() const { return {nullptr, 0}; }
+  Iterator end() const { return {/*at=*/nullptr, /*left=*/0}; }
 
  private:
   const std::uint8_t* first_;
@@ -257,7 +257,7 @@ class DictionaryView {
   std::size_t size() const { return size_; }
   bool empty() const { return size_ == 0; }
   Iterator begin() const { return {first_, size_}; }
-  Iterator end() const { return {nullptr, 0}; }
+  Iterator end() const { return {/*at=*/nullptr, /*left=*/0}; }
 
   /// The value of a text key; a walk over the entries.
   std::optional<ValueView> find(std::string_view key) const;

@@ -185,7 +185,7 @@ void OstrelReportingSession::startStep() {
   aggregatedPayloadData_.set(std::make_shared<AggregatedPayloadData>());
   platform_.kernelTrace->trace(TraceCode::kSessionStart);
   if (serviceType() == kServiceTypeTest) {
-    setStarted(true);
+    setStarted(/*started=*/true);
     return;
   }
   const HierarchyToken token =
@@ -235,7 +235,7 @@ void OstrelReportingSession::backendCallback(const std::optional<Array>& backend
   }
   OSTREL_LOG_DEFAULT(logScope, "List of backends %@", *backends);
   condition.lock();
-  setStarted(true);
+  setStarted(/*started=*/true);
   condition.signal();
   condition.unlock();
 }
@@ -243,7 +243,7 @@ void OstrelReportingSession::backendCallback(const std::optional<Array>& backend
 void OstrelReportingSession::finishStartStep(bool foundBackends) {
   if (!foundBackends) {
     reportingSession_.set(nullptr);
-    setStarted(true);
+    setStarted(/*started=*/true);
   }
   if (shouldReportOrientation()) registerOrientationObservers();
 }
@@ -282,7 +282,7 @@ void OstrelReportingSession::stopStep() {
     const auto locked = list->lock();
     aggregatedPayloadData_.set(nullptr);
   }
-  setStarted(false);
+  setStarted(/*started=*/false);
   // Kept: a start is answered here, at each stop, and nowhere else.
   // [KeepsStartReplyAtEveryStop]
   if (const BoolReply complete = transactionCompleteBlock_.get()) complete(true);
