@@ -1,5 +1,6 @@
 #include "platform/linux/LinuxPlatform.h"
 
+#include <future>
 #include <utility>
 
 #include "platform/Logging.h"
@@ -30,6 +31,13 @@ namespace ostrel {
 namespace {
 
 constexpr std::chrono::milliseconds kLogFarewell{200};
+
+// Once the store is known, no session waits for it any more.
+void awaitStore(Store& store, std::chrono::steady_clock::time_point deadline) {
+  const auto known = std::make_shared<std::promise<void>>();
+  store.whenKnown([known](bool) { known->set_value(); });
+  known->get_future().wait_until(deadline);
+}
 
 }  // namespace
 
@@ -85,6 +93,9 @@ LinuxPlatform::~LinuxPlatform() = default;
 IPCListener& LinuxPlatform::listener() { return *bindings_->listener; }
 
 bool LinuxPlatform::finish(std::chrono::steady_clock::time_point deadline) {
+  // A session that waits for the store keeps its messages on a suspended queue,
+  // which is not drained.
+  awaitStore(*bindings_->store, deadline);
   const bool isDrained = bindings_->queues->drain(deadline);
   if (!isDrained) {
     OSTREL_LOG_ERROR(processLogScope, "some work was still queued at the end");
