@@ -71,17 +71,16 @@ Curve growWithMessagesKept(const Scale& scale) {
   ServiceProcess service({.kind = ServiceKind::kCounting});
   ServiceClient client(service.socketPath());
   client.startSessions(kSession, 1);
-  const std::uint64_t probe = scale.messages / 50;
+  const std::uint64_t probe = scale.messages / 100;
   std::uint64_t kept = 0;
   const auto sendMore = [&](std::uint64_t count) {
     kept += count;
     return deliver(service, count, [&] { client.send(count, kSession); });
   };
-  sendMore(1);
   for (std::uint64_t wanted = 1; wanted <= scale.messages; wanted *= 10) {
-    if (wanted > kept) sendMore(wanted - kept);
-    const double x = static_cast<double>(kept);
-    curve.add(x, sendMore(probe).processorNanoseconds);
+    if (wanted < kept) continue;
+    sendMore(wanted - kept);
+    curve.add(static_cast<double>(wanted), sendMore(probe).processorNanoseconds);
   }
   return curve;
 }
