@@ -161,7 +161,8 @@ TEST_F(ClientOfTheService, ReachesItAgainAfterAKill) {
   } while (answers.wait(++asked).back() != "again 0 true" && asked < 100);
 
   EXPECT_EQ(answers.wait(asked).back(), "again 0 true");
-  EXPECT_EQ(client.counts().connections, 2u);
+  // A dying service may still have a socket to connect to for a moment.
+  EXPECT_GE(client.counts().connections, 2u);
 }
 
 TEST_F(ClientOfTheService, MakesItsSessionsAnewWhenAskedTo) {
