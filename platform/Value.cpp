@@ -106,7 +106,7 @@ std::optional<double> doubleOf(const Head& head) {
 
 double integerAsDouble(const Head& head) {
   return head.majorType == kUnsigned ? static_cast<double>(head.argument)
-                                     : -1.0 - static_cast<double>(head.argument);
+                                     : -static_cast<double>(head.argument + 1);
 }
 
 std::string_view asText(std::span<const std::uint8_t> bytes) {
