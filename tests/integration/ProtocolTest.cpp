@@ -211,6 +211,9 @@ TEST_F(Protocol, PutsASecondSessionInPlaceOfTheFirstWithoutStoppingIt) {
   EXPECT_THAT(client.takeReplies(),
               UnorderedElementsAre("create true", "create true", "all 7", "send no error",
                                    "stop true", "start true"));
+  // Both handles go while the service lives.
+  EXPECT_TRUE(service.waitForRows(
+      "SELECT id FROM telemetry_sessions WHERE ended_at IS NOT NULL", 2));
   EXPECT_EQ(service.terminate(), 0);
   EXPECT_THAT(
       service.rows("SELECT json_extract(user_info, '$.which'), flushed_at IS NOT NULL, "
