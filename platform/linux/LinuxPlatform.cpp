@@ -93,8 +93,10 @@ LinuxPlatform::~LinuxPlatform() = default;
 IPCListener& LinuxPlatform::listener() { return *bindings_->listener; }
 
 bool LinuxPlatform::finish(std::chrono::steady_clock::time_point deadline) {
-  // A session that waits for the store keeps its messages on a suspended queue,
-  // which is not drained.
+  // A session that waits for the store keeps its messages on a suspended queue, which
+  // is not drained. What is queued now may begin such a wait; the store answers in
+  // order.
+  bindings_->queues->drain(deadline);
   awaitStore(*bindings_->store, deadline);
   const bool isDrained = bindings_->queues->drain(deadline);
   if (!isDrained) {

@@ -156,7 +156,7 @@ void Store::whenKnown(Answer answer) {
   bool isUsable;
   {
     const std::lock_guard lock(mutex_);
-    if (state_ == State::kOpening) {
+    if (state_ == State::kOpening || isAnswering_) {
       waitingAnswers_.push_back(std::move(answer));
       return;
     }
@@ -293,8 +293,16 @@ void Store::publishState() {
     state_ = isUsable ? State::kUsable : State::kFaulty;
     if (!isUsable) faultError_ = StoreWriter::errorOf(*writer_.fault());
     answers.swap(waitingAnswers_);
+    isAnswering_ = !answers.empty();
   }
-  for (const Answer& answer : answers) answer(isUsable);
+  // Answers are given in the order of the questions, also to those asked meanwhile.
+  while (!answers.empty()) {
+    for (const Answer& answer : answers) answer(isUsable);
+    answers.clear();
+    const std::lock_guard lock(mutex_);
+    answers.swap(waitingAnswers_);
+    isAnswering_ = !answers.empty();
+  }
 }
 
 void Store::finish() {

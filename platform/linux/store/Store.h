@@ -134,6 +134,7 @@ class Store {
   bool isStopping_ = false;
   bool hasEnded_ = false;
   std::vector<Answer> waitingAnswers_;
+  bool isAnswering_ = false;
 
   std::thread thread_;  // Last, so that it starts after the rest.
 };
