@@ -8,3 +8,7 @@ elseif(OSTREL_SANITIZER STREQUAL "thread")
 elseif(NOT OSTREL_SANITIZER STREQUAL "")
   message(FATAL_ERROR "OSTREL_SANITIZER is neither address+undefined nor thread")
 endif()
+if(OSTREL_FUZZERS)
+  # All code shows a fuzzer where it went.
+  add_compile_options(-fsanitize=fuzzer-no-link)
+endif()
