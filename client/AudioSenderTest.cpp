@@ -16,6 +16,9 @@
 
 #include "ostrel/OstrelReportingClient.h"
 
+// The sanitizers make system calls and allocate on their own.
+#if !defined(__SANITIZE_THREAD__) && !defined(__SANITIZE_ADDRESS__)
+
 namespace {
 
 thread_local bool countsAllocations = false;
@@ -23,13 +26,16 @@ std::atomic<int> allocations{0};
 
 }  // namespace
 
-void* operator new(std::size_t size) {
+// Out of line, or g++ 12 takes their pairing for a mistake.
+[[gnu::noinline]] void* operator new(std::size_t size) {
   if (countsAllocations) ++allocations;
   if (void* memory = std::malloc(size != 0 ? size : 1)) return memory;
   throw std::bad_alloc();
 }
-void operator delete(void* memory) noexcept { std::free(memory); }
-void operator delete(void* memory, std::size_t) noexcept { std::free(memory); }
+[[gnu::noinline]] void operator delete(void* memory) noexcept { std::free(memory); }
+[[gnu::noinline]] void operator delete(void* memory, std::size_t) noexcept {
+  std::free(memory);
+}
 
 namespace ostrel::reporting {
 namespace {
@@ -76,8 +82,6 @@ bool forbidSystemCalls() {
   ::_exit(0);
 }
 
-#if !defined(__SANITIZE_THREAD__) && !defined(__SANITIZE_ADDRESS__)
-// The sanitizers make system calls of their own.
 TEST(AudioSender, MakesNoSystemCallAndAllocatesNothing) {
   const pid_t child = ::fork();
   if (child == 0) sendWithoutSystemCalls();
@@ -100,7 +104,14 @@ TEST(AudioSender, IsSeenToMakeASystemCallWhenItDoes) {
 
   EXPECT_TRUE(WIFSIGNALED(status));
 }
+
+}  // namespace
+}  // namespace ostrel::reporting
+
 #endif
+
+namespace ostrel::reporting {
+namespace {
 
 TEST(AudioSender, CountsWhatDoesNotFitItsRing) {
   Options options;
