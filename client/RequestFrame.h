@@ -1,6 +1,6 @@
 // Requests of the public library as they travel. The frequent one is written
-// without a detour over the protocol's values; `RequestFrameTest.cpp` holds it
-// against the wire codec's own.
+// without a detour over the protocol's values; `MessageTest.cpp` and
+// `ClientServiceTest.cpp` hold it against the wire codec.
 #pragma once
 
 #include <cstdint>
@@ -14,7 +14,7 @@
 namespace ostrel::reporting {
 
 /// Appends a frame that sends `payload`, an encoded dictionary, and says where
-/// in `out` the payload begins. 13 ns and the copy.
+/// in `out` the payload begins.
 std::size_t appendSendMessage(std::string& out, wire::RequestNumber number,
                               std::string_view payload, Category category,
                               MessageType type,
