@@ -261,14 +261,15 @@ std::string textOf(ValueView value, bool areDatesNumbers) {
       return textOfString(*value.string());
     case ValueKind::kArray: {
       std::vector<std::string> elements;
-      for (const ValueView element : *value.array()) {
+      const ArrayView array = *value.array();
+      for (const ValueView element : array) {
         elements.push_back(textOf(element, areDatesNumbers));
       }
       return textOfList(elements);
     }
     case ValueKind::kDictionary: {
       std::map<std::string, std::string> entries;
-      for (const auto [key, held] : *value.dictionary()) {
+      for (const auto [key, held] : value.entries()) {
         EXPECT_TRUE(
             entries.emplace(textOf(key, areDatesNumbers), textOf(held, areDatesNumbers))
                 .second)
