@@ -108,6 +108,10 @@ class ScriptedSensors {
     sd_bus* bus = nullptr;
     sd_bus_open_system(&bus);
     sd_bus_add_object(bus, nullptr, kPath, &handle, this);
+    sd_bus_add_match(bus, nullptr,
+                     "type='signal',sender='org.freedesktop.DBus',"
+                     "member='NameOwnerChanged'",
+                     &clientChanged, this);
     sd_bus_request_name(bus, kName, 0);
     isReady_ = true;
     while (!isDone_) {
@@ -127,10 +131,27 @@ class ScriptedSensors {
     sd_bus_flush_close_unref(bus);
   }
 
+  // A claim ends with a word or with the claimer, as the real service has it.
+  void release() {
+    if (!claimer_.empty()) ++releases_;
+    claimer_.clear();
+  }
+
+  static int clientChanged(sd_bus_message* signal, void* data, sd_bus_error*) {
+    auto& self = *static_cast<ScriptedSensors*>(data);
+    const char* name = nullptr;
+    const char* before = nullptr;
+    const char* now = nullptr;
+    sd_bus_message_read(signal, "sss", &name, &before, &now);
+    if (self.claimer_ == name && *now == '\0') self.release();
+    return 0;
+  }
+
   static int handle(sd_bus_message* message, void* data, sd_bus_error*) {
     auto& self = *static_cast<ScriptedSensors*>(data);
     if (sd_bus_message_is_method_call(message, kName, "ClaimAccelerometer") > 0) {
       ++self.claims_;
+      self.claimer_ = sd_bus_message_get_sender(message);
       if (self.answer_ == Answer::kNever) return 1;
       if (self.answer_ == Answer::kError) {
         return sd_bus_reply_method_errorf(message, SD_BUS_ERROR_FAILED, "no sensor");
@@ -138,7 +159,7 @@ class ScriptedSensors {
       return sd_bus_reply_method_return(message, "");
     }
     if (sd_bus_message_is_method_call(message, kName, "ReleaseAccelerometer") > 0) {
-      ++self.releases_;
+      self.release();
       return sd_bus_reply_method_return(message, "");
     }
     if (sd_bus_message_is_method_call(message, kProperties, "Get") > 0) {
@@ -150,6 +171,7 @@ class ScriptedSensors {
 
   std::atomic<Answer> answer_;
   std::string orientation_;
+  std::string claimer_;  // On the service's thread.
   std::atomic<int> claims_ = 0;
   std::atomic<int> releases_ = 0;
   std::atomic<int> reads_ = 0;
