@@ -31,9 +31,7 @@ void OstrelReportingTallyraBridge::handleEvent(const OstrelReportingPlatform& pl
   platform.analyticsSink->sendEventLazy(
       eventName(category, type),
       [message = payload != nullptr ? *payload : Dictionary(), userInfo] {
-        return DictionaryBuilder(message)
-            .set("HostApplicationDisplayID", HostApplicationID(userInfo))
-            .build();
+        return message.with("HostApplicationDisplayID", HostApplicationID(userInfo));
       });
 }
 

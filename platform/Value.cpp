@@ -2,6 +2,7 @@
 // item's end is found by counting the items that are still to come.
 #include "platform/Value.h"
 
+#include <algorithm>
 #include <bit>
 #include <charconv>
 #include <cmath>
@@ -74,6 +75,49 @@ Head readHead(const std::uint8_t* at) {
   }
   return head;
 }
+
+bool isShortest(const Head& head) {
+  switch (head.additional) {
+    case 24:
+      return head.argument >= 24;
+    case 25:
+      return head.argument > 0xFF;
+    case 26:
+      return head.argument > 0xFFFF;
+    case 27:
+      return head.argument > 0xFFFFFFFF;
+    default:
+      return true;
+  }
+}
+
+// The shortest head of an item.
+class EncodedHead {
+ public:
+  EncodedHead(std::uint8_t majorType, std::uint64_t argument) {
+    if (argument < 24) {
+      bytes_[0] = static_cast<std::uint8_t>(majorType << 5 | argument);
+      return;
+    }
+    const int log2Width = argument <= 0xFF         ? 0
+                          : argument <= 0xFFFF     ? 1
+                          : argument <= 0xFFFFFFFF ? 2
+                                                   : 3;
+    const std::size_t width = std::size_t{1} << log2Width;
+    bytes_[0] = static_cast<std::uint8_t>(majorType << 5 | (24 + log2Width));
+    for (std::size_t i = 0; i < width; ++i) {
+      bytes_[1 + i] = static_cast<std::uint8_t>(argument >> (8 * (width - 1 - i)));
+    }
+    size_ = 1 + width;
+  }
+
+  std::span<const std::uint8_t> bytes() const { return {bytes_, size_}; }
+  std::size_t size() const { return size_; }
+
+ private:
+  std::uint8_t bytes_[9];
+  std::size_t size_ = 1;
+};
 
 double decodeHalf(std::uint16_t bits) {
   const int exponent = (bits >> 10) & 0x1F;
@@ -416,6 +460,19 @@ Value Value::ofUnsigned(std::uint64_t integer) {
   return Value(asBytes(encoded([&](ValueEncoder& to) { to.unsignedInteger(integer); })));
 }
 
+namespace {
+Dictionary joined(std::initializer_list<std::span<const std::uint8_t>> parts,
+                  std::shared_ptr<PayloadAccount> account) {
+  std::size_t size = 0;
+  for (const auto part : parts) size += part.size();
+  ValueBuffer buffer = ValueBuffer::make(size, std::move(account));
+  std::uint8_t* at = buffer.data();
+  for (const auto part : parts) at = std::ranges::copy(part, at).out;
+  const std::uint8_t* const item = std::as_const(buffer).data();
+  return Dictionary(std::move(buffer), item);
+}
+}  // namespace
+
 Array::Array() : item_(&kEmptyArray) {}
 
 std::optional<Array> Array::from(const Value& value) {
@@ -448,25 +505,36 @@ std::optional<Value> Dictionary::get(std::string_view key) const {
   return Value(owner_, *found);
 }
 
-void ValueEncoder::head(std::uint8_t majorType, std::uint64_t argument) {
-  char bytes[9];
-  std::size_t size;
-  if (argument < 24) {
-    bytes[0] = static_cast<char>(majorType << 5 | argument);
-    size = 1;
-  } else {
-    const int log2Width = argument <= 0xFF         ? 0
-                          : argument <= 0xFFFF     ? 1
-                          : argument <= 0xFFFFFFFF ? 2
-                                                   : 3;
-    const std::size_t width = std::size_t{1} << log2Width;
-    bytes[0] = static_cast<char>(majorType << 5 | (24 + log2Width));
-    for (std::size_t i = 0; i < width; ++i) {
-      bytes[1 + i] = static_cast<char>(argument >> (8 * (width - 1 - i)));
+Dictionary Dictionary::with(std::string_view key, const Value& value) const {
+  const Head head = readHead(item_);
+  const std::uint8_t* at = head.next;
+  std::span<const std::uint8_t> oldValue;
+  for (std::uint64_t left = head.argument; left != 0; --left) {
+    // A builder writes keys with their shortest heads.
+    if (!isShortest(readHead(at))) {
+      return DictionaryBuilder(*this).set(key, value).build();
     }
-    size = 1 + width;
+    const ValueView entryKey(at);
+    const ValueView entryValue(entryKey.end());
+    at = entryValue.end();
+    if (entryKey.string() == key) oldValue = {entryValue.data(), at};
   }
-  out_.append(bytes, size);
+  const std::span<const std::uint8_t> entries(head.next, at);
+  if (oldValue.empty()) {
+    return joined({EncodedHead(kMapType, head.argument + 1).bytes(), entries,
+                   EncodedHead(kText, key.size()).bytes(), asBytes(key), value->bytes()},
+                  owner_.account());
+  }
+  return joined({EncodedHead(kMapType, head.argument).bytes(),
+                 {entries.data(), oldValue.data()},
+                 value->bytes(),
+                 {std::to_address(oldValue.end()), at}},
+                owner_.account());
+}
+
+void ValueEncoder::head(std::uint8_t majorType, std::uint64_t argument) {
+  const EncodedHead head(majorType, argument);
+  out_.append(asText(head.bytes()));
 }
 
 void ValueEncoder::boolean(bool value) { head(kSimple, value ? kTrue : kFalse); }

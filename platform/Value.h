@@ -370,6 +370,10 @@ class Dictionary {
   std::optional<Value> get(std::string_view key) const;
   bool contains(std::string_view key) const { return find(key).has_value(); }
 
+  /// This dictionary with `value` under `key`, in the place of what was there or as
+  /// the last entry: what a builder makes of it, in one allocation.
+  Dictionary with(std::string_view key, const Value& value) const;
+
   friend bool operator==(const Dictionary& a, const Dictionary& b) {
     return a.value() == b.value();
   }
