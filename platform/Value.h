@@ -39,6 +39,13 @@ class PayloadAccount {
   virtual void charge(std::size_t bytes) noexcept = 0;
   /// Any thread. The account may end during the call.
   virtual void relieve(std::size_t bytes) noexcept = 0;
+
+  /// Asks for room for `bytes` that are kept beyond the message that brought
+  /// them: an entry of a session's list. False: the client's share is used up,
+  /// and nothing was taken. Any thread.
+  virtual bool keep(std::size_t bytes) noexcept = 0;
+  /// Gives back what `keep` took. Any thread.
+  virtual void discard(std::size_t bytes) noexcept = 0;
 };
 
 /// The shared bytes below values: one allocation, counted references.

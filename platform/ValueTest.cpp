@@ -359,6 +359,8 @@ class CountingAccount final : public PayloadAccount {
  public:
   void charge(std::size_t bytes) noexcept override { charged += bytes; }
   void relieve(std::size_t bytes) noexcept override { relieved += bytes; }
+  bool keep(std::size_t) noexcept override { return true; }
+  void discard(std::size_t) noexcept override {}
   std::size_t charged = 0;
   std::size_t relieved = 0;
 };

@@ -39,6 +39,17 @@ inline constexpr std::size_t kQueuedBytes = 4 * 1024 * 1024;
 /// many times the memory.
 inline constexpr std::size_t kQueuedBytesOfUser = 32 * 1024 * 1024;
 
+/// Sessions in all, and of one user. Room for the 16,384 that are promised and for
+/// load tests of 100,000 by one user; an idle session costs some 500 bytes.
+inline constexpr std::size_t kSessions = 256 * 1024;
+inline constexpr std::size_t kSessionsOfUser = 128 * 1024;
+
+/// Bytes of the entries that sessions keep for their summaries, in all, and of the
+/// messages of one user's clients. Room for a session of a million messages with its
+/// summary, twice. What is beyond a small budget in memory is in files.
+inline constexpr std::size_t kKeptBytes = std::size_t{2} * 1024 * 1024 * 1024;
+inline constexpr std::size_t kKeptBytesOfUser = std::size_t{1} * 1024 * 1024 * 1024;
+
 /// What a request costs on a queue beside its payload: the step, its place in the
 /// queue, the buffer's head.
 inline constexpr std::size_t kRequestBytes = 256;

@@ -19,7 +19,7 @@ constexpr std::size_t kKeptCapacity = 512;
 }  // namespace
 
 PeerChannel::PeerChannel(LoopWaker::ConnectionID id, std::shared_ptr<LoopWaker> waker,
-                         std::shared_ptr<RequestBudget> user, const Limits& limits)
+                         std::shared_ptr<UserAccount> user, const Limits& limits)
     : id_(id),
       waker_(std::move(waker)),
       user_(std::move(user)),
@@ -29,7 +29,7 @@ PeerChannel::PeerChannel(LoopWaker::ConnectionID id, std::shared_ptr<LoopWaker> 
 
 PeerChannel::~PeerChannel() {
   // Whatever could tell that a request ran is gone.
-  if (user_->give(own_.used())) waker_->budgetEased();
+  if (user_->queued().give(own_.used())) waker_->budgetEased();
 }
 
 void PeerChannel::reply(wire::RequestNumber number, const wire::ReplyValue& value) {
@@ -50,7 +50,7 @@ void PeerChannel::reply(wire::RequestNumber number, const wire::ReplyValue& valu
 
 void PeerChannel::charge(std::size_t bytes) noexcept {
   own_.take(bytes + limits::kRequestBytes);
-  user_->take(bytes + limits::kRequestBytes);
+  user_->queued().take(bytes + limits::kRequestBytes);
 }
 
 void PeerChannel::relieve(std::size_t bytes) noexcept {
@@ -59,13 +59,13 @@ void PeerChannel::relieve(std::size_t bytes) noexcept {
 
 void PeerChannel::give(std::size_t bytes) noexcept {
   const bool hasOwnEased = own_.give(bytes);
-  const bool hasUserEased = user_->give(bytes);
+  const bool hasUserEased = user_->queued().give(bytes);
   if (hasOwnEased || hasUserEased) waker_->budgetEased();
 }
 
 std::uint64_t PeerChannel::chargeRequest(std::size_t bytes) {
   own_.take(bytes);
-  user_->take(bytes);
+  user_->queued().take(bytes);
   return chargedMark_ += bytes;
 }
 
@@ -78,7 +78,7 @@ void PeerChannel::requestsRan(std::uint64_t mark) noexcept {
 
 bool PeerChannel::awaitBudget() {
   const bool isOwnFull = own_.isExceeded() && own_.await();
-  const bool isUserFull = user_->isExceeded() && user_->await();
+  const bool isUserFull = user_->queued().isExceeded() && user_->queued().await();
   return isOwnFull || isUserFull;
 }
 

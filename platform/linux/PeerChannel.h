@@ -9,6 +9,7 @@
 #include "platform/Value.h"
 #include "platform/linux/LoopWaker.h"
 #include "platform/linux/RequestBudget.h"
+#include "platform/linux/UserAccount.h"
 #include "platform/linux/wire/Frame.h"
 
 namespace ostrel {
@@ -25,7 +26,7 @@ class PeerChannel final : public PayloadAccount {
   };
 
   PeerChannel(LoopWaker::ConnectionID id, std::shared_ptr<LoopWaker> waker,
-              std::shared_ptr<RequestBudget> user, const Limits& limits);
+              std::shared_ptr<UserAccount> user, const Limits& limits);
   ~PeerChannel() override;
 
   /// Queues a reply; the loop writes it soon. Nothing once the connection has ended
@@ -35,6 +36,8 @@ class PeerChannel final : public PayloadAccount {
   /// A payload also costs its place in a queue (`limits::kRequestBytes`).
   void charge(std::size_t bytes) noexcept override;
   void relieve(std::size_t bytes) noexcept override;
+  bool keep(std::size_t bytes) noexcept override { return user_->keep(bytes); }
+  void discard(std::size_t bytes) noexcept override { user_->discard(bytes); }
 
   /// The loop's: a request without a payload of its own costs `bytes` until a
   /// request up to the mark returned, or a later one, has run.
@@ -43,7 +46,7 @@ class PeerChannel final : public PayloadAccount {
   void requestsRan(std::uint64_t mark) noexcept;
 
   // The loop's.
-  bool isOverBudget() const { return own_.isExceeded() || user_->isExceeded(); }
+  bool isOverBudget() const { return own_.isExceeded() || user_->queued().isExceeded(); }
   /// Asks for `LoopWaker::budgetEased` once there is room; false: there is already.
   bool awaitBudget();
   /// What is waiting for its reader.
@@ -65,7 +68,7 @@ class PeerChannel final : public PayloadAccount {
 
   const LoopWaker::ConnectionID id_;
   const std::shared_ptr<LoopWaker> waker_;
-  const std::shared_ptr<RequestBudget> user_;
+  const std::shared_ptr<UserAccount> user_;
   const std::size_t unreadReplyBytes_;
 
   RequestBudget own_;

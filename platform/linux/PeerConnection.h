@@ -25,7 +25,10 @@ struct ListenerLimits {
   std::size_t reporterIDs = limits::kReporterIDs;
   wire::PayloadLimits payload{limits::kNesting, limits::kNodes, limits::kKeyBytes};
   std::size_t queuedBytes = limits::kQueuedBytes;
-  std::size_t queuedBytesOfUser = limits::kQueuedBytesOfUser;
+  UserAccount::Limits ofUser{limits::kQueuedBytesOfUser, limits::kSessionsOfUser,
+                             limits::kKeptBytesOfUser};
+  std::size_t sessions = limits::kSessions;
+  std::size_t keptBytes = limits::kKeptBytes;
   std::size_t unreadReplyBytes = limits::kUnreadReplyBytes;
   std::size_t unreadReplyBytesToPause = limits::kUnreadReplyBytesToPause;
   std::chrono::milliseconds unreadPatience = limits::kUnreadPatience;

@@ -84,6 +84,7 @@ UnixSocketIPCListener::UnixSocketIPCListener(ServiceSocket socket,
       socket_(std::move(socket)),
       peers_(std::move(peers)),
       epoll_(::epoll_create1(EPOLL_CLOEXEC)),
+      service_(new ServiceAccount{Share(limits.sessions), Share(limits.keptBytes)}),
       nextID_(kFirstConnection) {
   watchDescriptor(epoll_.get(), socket_.descriptor(), kSocketEvent);
   watchDescriptor(epoll_.get(), waker_->descriptor(), kWakerEvent);
@@ -239,13 +240,13 @@ void UnixSocketIPCListener::accept(FileDescriptor socket) {
   const PeerIdentity peer = identityOf(socket.get());
   if (!isWithinLimits(peer, socket.get())) return;
   User& user = users_[peer.user];
-  if (!user.budget) {
-    user.budget = std::make_shared<RequestBudget>(limits_.queuedBytesOfUser);
+  if (!user.account) {
+    user.account = std::make_shared<UserAccount>(peer.user, limits_.ofUser, service_);
   }
   const PeerConnection::ID id = nextID_++;
   peers_->peerConnected(peer.pid, id, processOf(socket.get(), peer.pid));
   auto channel = std::make_shared<PeerChannel>(
-      id, waker_, user.budget,
+      id, waker_, user.account,
       PeerChannel::Limits{limits_.queuedBytes, limits_.unreadReplyBytes});
   auto connection = std::make_shared<PeerConnection>(id, std::move(socket), peer,
                                                      std::move(channel), limits_);

@@ -13,9 +13,9 @@
 #include "platform/linux/LoopWaker.h"
 #include "platform/linux/PeerConnection.h"
 #include "platform/linux/PeerRegistry.h"
-#include "platform/linux/RequestBudget.h"
 #include "platform/linux/ServiceSocket.h"
 #include "platform/linux/TerminationSignals.h"
+#include "platform/linux/UserAccount.h"
 
 namespace ostrel {
 
@@ -48,7 +48,7 @@ class UnixSocketIPCListener final : public IPCListener {
   using Clock = PeerConnection::Clock;
   struct User {
     std::size_t connections = 0;
-    std::shared_ptr<RequestBudget> budget;
+    std::shared_ptr<UserAccount> account;
     Clock::time_point mayLogAgain{};
   };
 
@@ -82,6 +82,7 @@ class UnixSocketIPCListener final : public IPCListener {
     std::uint32_t events = 0;  // As epoll knows them; 0: not in it.
   };
   std::unordered_map<PeerConnection::ID, Watched> connections_;
+  const std::shared_ptr<ServiceAccount> service_;
   std::map<std::uint32_t, User> users_;
   std::vector<PeerConnection::ID> heldBack_;
   std::vector<PeerConnection::ID> impatient_;

@@ -32,6 +32,8 @@ class CountingAccount : public PayloadAccount {
  public:
   void charge(std::size_t bytes) noexcept override { bytes_ += bytes; }
   void relieve(std::size_t bytes) noexcept override { bytes_ -= bytes; }
+  bool keep(std::size_t) noexcept override { return true; }
+  void discard(std::size_t) noexcept override {}
   std::size_t bytes() const { return bytes_; }
 
  private:

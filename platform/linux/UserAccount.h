@@ -1,0 +1,78 @@
+#pragma once
+
+#include <cstddef>
+#include <cstdint>
+#include <memory>
+#include <utility>
+
+#include "platform/linux/RequestBudget.h"
+#include "platform/linux/Share.h"
+
+namespace ostrel {
+
+/// What all users of the service may have together.
+struct ServiceAccount {
+  Share sessions;
+  Share keptBytes;
+};
+
+/// What one user's clients have under way and keep. Outlives the user's connections
+/// as long as a session's list or a request of theirs is left. Any thread.
+class UserAccount {
+ public:
+  struct Limits {
+    std::size_t queuedBytes;
+    std::size_t sessions;
+    std::size_t keptBytes;
+  };
+
+  UserAccount(std::uint32_t user, const Limits& limits,
+              std::shared_ptr<ServiceAccount> service)
+      : user_(user),
+        queued_(limits.queuedBytes),
+        sessions_(limits.sessions),
+        keptBytes_(limits.keptBytes),
+        service_(std::move(service)) {}
+
+  std::uint32_t user() const { return user_; }
+
+  /// Bytes of requests that are accepted and not yet carried out.
+  RequestBudget& queued() { return queued_; }
+
+  /// One more session. False: there are as many as the user or the service may have.
+  bool takeSession() noexcept { return takeBoth(sessions_, service_->sessions, 1); }
+  void giveSessions(std::size_t count) noexcept {
+    giveBoth(sessions_, service_->sessions, count);
+  }
+
+  /// Bytes that sessions keep in their lists.
+  bool keep(std::size_t bytes) noexcept {
+    return takeBoth(keptBytes_, service_->keptBytes, bytes);
+  }
+  void discard(std::size_t bytes) noexcept {
+    giveBoth(keptBytes_, service_->keptBytes, bytes);
+  }
+
+  std::size_t sessions() const { return sessions_.used(); }
+  std::size_t keptBytes() const { return keptBytes_.used(); }
+
+ private:
+  static bool takeBoth(Share& own, Share& all, std::size_t amount) noexcept {
+    if (!own.take(amount)) return false;
+    if (all.take(amount)) return true;
+    own.give(amount);
+    return false;
+  }
+  static void giveBoth(Share& own, Share& all, std::size_t amount) noexcept {
+    own.give(amount);
+    all.give(amount);
+  }
+
+  const std::uint32_t user_;
+  RequestBudget queued_;
+  Share sessions_;
+  Share keptBytes_;
+  const std::shared_ptr<ServiceAccount> service_;
+};
+
+}  // namespace ostrel
