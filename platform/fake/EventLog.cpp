@@ -1,6 +1,9 @@
 #include "platform/fake/EventLog.h"
 
 #include <algorithm>
+#include <utility>
+
+#include "platform/ValueJSON.h"
 
 namespace ostrel {
 
@@ -9,9 +12,25 @@ void EventLog::add(std::string event) {
   events_.push_back(std::move(event));
 }
 
+void EventLog::add(std::string event, std::initializer_list<ValueView> arguments) {
+  if (showsArguments_) {
+    for (const ValueView argument : arguments) {
+      event += ' ';
+      appendJSON(event, argument, JSONLayout::kCompact, JSONStrictness::kLenient,
+                 /*indent=*/0);
+    }
+  }
+  add(std::move(event));
+}
+
 std::vector<std::string> EventLog::all() const {
   const std::lock_guard lock(mutex_);
   return events_;
+}
+
+std::vector<std::string> EventLog::take() {
+  const std::lock_guard lock(mutex_);
+  return std::exchange(events_, {});
 }
 
 std::vector<std::string> EventLog::startingWith(std::string_view prefix) const {

@@ -112,6 +112,53 @@ TEST_F(FakePlatformTest, CanSuspendAQueueInsideAnOperationRunAsAStep) {
   EXPECT_THAT(fake_.events->all(), ElementsAre("first", "waits"));
 }
 
+TEST_F(FakePlatformTest, RunsAStepOfTheQueueThatTheTestChooses) {
+  const auto first = makeQueue("first");
+  const auto second = makeQueue("second");
+  first->async(note("first"));
+  second->async(note("second"));
+  const auto ready = fake_.workQueues->readyQueues();
+  ASSERT_EQ(ready.size(), 2u);
+  fake_.workQueues->runOneOf(ready[1], /*position=*/0);
+  EXPECT_EQ(fake_.workQueues->readyQueues(), std::vector<std::size_t>{ready[0]});
+  fake_.workQueues->runOneOf(ready[0], /*position=*/0);
+  EXPECT_TRUE(fake_.workQueues->readyQueues().empty());
+  EXPECT_THAT(fake_.events->all(), ElementsAre("second", "first"));
+}
+
+TEST_F(FakePlatformTest, RunsTheBackgroundStepThatTheTestChooses) {
+  fake_.workQueues->backgroundQueue().asyncAfter(seconds(0), note("first"));
+  fake_.workQueues->backgroundQueue().asyncAfter(seconds(0), note("second"));
+  EXPECT_EQ(fake_.workQueues->backgroundCount(), 2u);
+  fake_.workQueues->runOneOf(/*number=*/0, /*position=*/1);
+  fake_.workQueues->runOneOf(/*number=*/0, /*position=*/0);
+  EXPECT_THAT(fake_.events->all(), ElementsAre("second", "first"));
+}
+
+TEST_F(FakePlatformTest, ShowsTheArgumentsOfCallsWhenAsked) {
+  fake_.events->showArguments();
+  fake_.telemetryBackend->sendOneMessage({{"a", 1}}, {{"b", 1.0}}, /*category=*/2,
+                                         /*type=*/3, {{"c", "1"}});
+  fake_.analyticsSink->sendEventLazy("name", [] { return Dictionary{{"d", true}}; });
+  EXPECT_THAT(
+      fake_.events->take(),
+      ElementsAre("backend.sendOneMessage 2 3 {\"a\":1} {\"b\":1.0} {\"c\":\"1\"}",
+                  "analytics name {\"d\":true}"));
+  EXPECT_TRUE(fake_.events->all().empty());
+}
+
+TEST_F(FakePlatformTest, ForgetsTheCompletionOfADiscovery) {
+  fake_.telemetryBackend->setDiscovery(FakeDiscovery::held());
+  const auto held = std::make_shared<int>(0);
+  const auto session =
+      fake_.telemetryBackend->createSession({}, {}, /*frameworksToCheck=*/{});
+  session->startConfiguration([held](const std::optional<Array>&) {});
+  EXPECT_EQ(held.use_count(), 2);
+  fake_.telemetryBackend->lastSession()->forgetDiscovery();
+  EXPECT_EQ(held.use_count(), 1);
+  EXPECT_FALSE(fake_.telemetryBackend->lastSession()->isDiscovering());
+}
+
 TEST_F(FakePlatformTest, WakesWaitersSpuriously) {
   const auto condition = fake_.conditions->makeCondition();
   std::vector<Condition::Wake> wakes;

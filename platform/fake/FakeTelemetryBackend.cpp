@@ -72,8 +72,9 @@ class FakeTelemetrySessionHandle final : public TelemetrySession {
 
   Success sendMessage(std::uint16_t category, std::uint16_t type,
                       const Dictionary& payload) override {
-    shared_->events->add("backend.sendMessage " + numberText() + ' ' +
-                         codes(category, type));
+    shared_->events->add(
+        "backend.sendMessage " + numberText() + ' ' + codes(category, type),
+        {payload.value()});
     const FakeTelemetryMessage message{category, type, payload};
     {
       const std::lock_guard lock(session_->mutex_);
@@ -151,6 +152,17 @@ void FakeTelemetrySession::answerDiscoveryDespiteRelease(std::optional<Array> ba
   completion(std::move(backends));
 }
 
+void FakeTelemetrySession::forgetDiscovery() {
+  TelemetrySession::BackendsCallback dropped;  // Destroyed without the lock.
+  const std::lock_guard lock(mutex_);
+  dropped.swap(discovery_);
+}
+
+bool FakeTelemetrySession::hasHeldFlush() const {
+  const std::lock_guard lock(mutex_);
+  return !flushes_.empty();
+}
+
 void FakeTelemetrySession::answerFlush(std::optional<ErrorObject> error) {
   const TelemetrySession::FlushCallback completion = [&] {
     const std::lock_guard lock(mutex_);
@@ -187,7 +199,8 @@ std::shared_ptr<TelemetrySession> FakeTelemetryBackend::createSession(
     shared_->sessions.push_back(session);
     session->number_ = static_cast<int>(shared_->sessions.size());
   }
-  shared_->events->add("backend.createSession " + std::to_string(session->number_));
+  shared_->events->add("backend.createSession " + std::to_string(session->number_),
+                       {sessionInfo.value(), userInfo.value()});
   return std::make_shared<FakeTelemetrySessionHandle>(shared_, session);
 }
 
@@ -195,7 +208,8 @@ Success FakeTelemetryBackend::sendOneMessage(const Dictionary& sessionInfo,
                                              const Dictionary& userInfo,
                                              std::uint16_t category, std::uint16_t type,
                                              const Dictionary& payload) {
-  shared_->events->add("backend.sendOneMessage " + codes(category, type));
+  shared_->events->add("backend.sendOneMessage " + codes(category, type),
+                       {sessionInfo.value(), userInfo.value(), payload.value()});
   const std::lock_guard lock(shared_->mutex);
   shared_->singleMessages.push_back({sessionInfo, userInfo, category, type, payload});
   return takeScripted(shared_->sendOneResults);

@@ -68,6 +68,10 @@ class FakeTelemetrySession {
   /// As `answerDiscovery`, but also after the release: a backend that breaks
   /// its promise.
   void answerDiscoveryDespiteRelease(std::optional<Array> backends);
+  /// Drops the completion, answered or not, and all that it holds.
+  void forgetDiscovery();
+  /// Whether a held flush is due.
+  bool hasHeldFlush() const;
   /// Completes the oldest held flush on the calling thread; there must be one.
   void answerFlush(std::optional<ErrorObject> error);
 
@@ -94,7 +98,8 @@ class FakeTelemetrySession {
 /// Events, N being the session's number: "backend.makeHierarchyToken",
 /// "backend.createSession N", "backend.startConfiguration N",
 /// "backend.sendMessage N CATEGORY TYPE", "backend.flush N",
-/// "backend.release N", "backend.sendOneMessage CATEGORY TYPE".
+/// "backend.release N", "backend.sendOneMessage CATEGORY TYPE". Their arguments are the
+/// dictionaries, in the order of the call.
 class FakeTelemetryBackend final : public TelemetryBackend {
  public:
   struct SingleMessage {

@@ -1,5 +1,6 @@
 #include "platform/fake/ManualWorkQueue.h"
 
+#include <algorithm>
 #include <utility>
 
 #include "platform/fake/FakeUse.h"
@@ -34,9 +35,11 @@ struct ManualWorkQueue::Shared {
   bool isRunning = false;
 };
 
-ManualWorkQueue::ManualWorkQueue(std::shared_ptr<Shared> shared, std::string label,
-                                 QualityOfService qualityOfService, int relativePriority)
+ManualWorkQueue::ManualWorkQueue(std::shared_ptr<Shared> shared, std::size_t number,
+                                 std::string label, QualityOfService qualityOfService,
+                                 int relativePriority)
     : shared_(std::move(shared)),
+      number_(number),
       label_(std::move(label)),
       qualityOfService_(qualityOfService),
       relativePriority_(relativePriority) {}
@@ -107,17 +110,18 @@ ManualWorkQueueFactory::ManualWorkQueueFactory(std::shared_ptr<ManualClock> cloc
     : clock_(std::move(clock)),
       shared_(std::make_shared<ManualWorkQueue::Shared>()),
       background_(std::shared_ptr<ManualWorkQueue>(
-          new ManualWorkQueue(shared_, "background", QualityOfService::kBackground,
-                              /*relativePriority=*/0))) {}
+          new ManualWorkQueue(shared_, /*number=*/0, "background",
+                              QualityOfService::kBackground, /*relativePriority=*/0))) {}
 
 ManualWorkQueueFactory::~ManualWorkQueueFactory() { releaseCallbacks(); }
 
 std::shared_ptr<WorkQueue> ManualWorkQueueFactory::makeSerialQueue(
     std::string_view label, QualityOfService qualityOfService, int relativePriority) {
   checkFakeUse(relativePriority <= 0, "relative priorities are 0 or below");
-  const std::shared_ptr<ManualWorkQueue> queue(new ManualWorkQueue(
-      shared_, std::string(label), qualityOfService, relativePriority));
   const std::lock_guard lock(shared_->mutex);
+  const std::shared_ptr<ManualWorkQueue> queue(
+      new ManualWorkQueue(shared_, shared_->queues.size() + 1, std::string(label),
+                          qualityOfService, relativePriority));
   shared_->queues.push_back(queue);
   return queue;
 }
@@ -153,6 +157,12 @@ bool ManualWorkQueueFactory::runOne() {
     queue->updateReady();
     shared_->isRunning = true;
   }
+  runStepOf(queue, std::move(step));
+  return true;
+}
+
+void ManualWorkQueueFactory::runStepOf(const std::shared_ptr<ManualWorkQueue>& queue,
+                                       Task step) {
   {
     const CurrentQueueScope scope(queue.get());
     step();
@@ -162,7 +172,36 @@ bool ManualWorkQueueFactory::runOne() {
   shared_->isRunning = false;
   queue->isRunning_ = false;
   queue->updateReady();
-  return true;
+}
+
+std::vector<std::size_t> ManualWorkQueueFactory::readyQueues() const {
+  std::vector<std::size_t> numbers;
+  const std::lock_guard lock(shared_->mutex);
+  for (const auto& [order, queue] : shared_->ready) numbers.push_back(queue->number_);
+  std::sort(numbers.begin(), numbers.end());
+  return numbers;
+}
+
+void ManualWorkQueueFactory::runOneOf(std::size_t number, std::size_t position) {
+  std::shared_ptr<ManualWorkQueue> queue;
+  Task step;
+  {
+    const std::lock_guard lock(shared_->mutex);
+    checkFakeUse(!shared_->isRunning, "steps are not run from inside a step");
+    for (const auto& [order, ready] : shared_->ready) {
+      if (ready->number_ == number) queue = ready;
+    }
+    checkFakeUse(queue != nullptr, "the queue is ready");
+    checkFakeUse(position == 0 || (number == 0 && position < queue->steps_.size()),
+                 "only steps of the background queue have no order");
+    const auto at = queue->steps_.begin() + static_cast<std::ptrdiff_t>(position);
+    step = std::move(at->task);
+    queue->steps_.erase(at);
+    queue->isRunning_ = true;
+    queue->updateReady();
+    shared_->isRunning = true;
+  }
+  runStepOf(queue, std::move(step));
 }
 
 std::size_t ManualWorkQueueFactory::runUntilIdle() {

@@ -27,6 +27,8 @@ class ManualWorkQueue final : public WorkQueue,
   bool isCurrent() const override;
   const std::string& label() const override { return label_; }
 
+  /// Counts from 1 in the order of making; the background queue is 0.
+  std::size_t number() const { return number_; }
   QualityOfService qualityOfService() const { return qualityOfService_; }
   int relativePriority() const { return relativePriority_; }
   bool isSuspended() const;
@@ -45,12 +47,13 @@ class ManualWorkQueue final : public WorkQueue,
     Task task;
   };
 
-  ManualWorkQueue(std::shared_ptr<Shared> shared, std::string label,
+  ManualWorkQueue(std::shared_ptr<Shared> shared, std::size_t number, std::string label,
                   QualityOfService qualityOfService, int relativePriority);
 
   void updateReady();  // With the lock held.
 
   const std::shared_ptr<Shared> shared_;
+  const std::size_t number_;
   const std::string label_;
   const QualityOfService qualityOfService_;
   const int relativePriority_;
@@ -83,6 +86,15 @@ class ManualWorkQueueFactory final : public WorkQueueFactory, private Concurrent
   /// Returns how many ran.
   std::size_t runUntilIdle();
 
+  /// For tests that choose which queue goes on: the numbers of those that can run a
+  /// step, ascending.
+  std::vector<std::size_t> readyQueues() const;
+  /// How many steps of the background queue wait, delayed ones apart.
+  std::size_t backgroundCount() const { return background_->waitingCount(); }
+  /// Runs one step of that ready queue: its first, or of the background queue, whose
+  /// steps have no order, the one at `position`.
+  void runOneOf(std::size_t number, std::size_t position);
+
   /// Every queue made so far that is still alive, oldest first.
   std::vector<std::shared_ptr<ManualWorkQueue>> queues() const;
   /// The oldest living queue of that label; ends the program when there is none.
@@ -96,6 +108,7 @@ class ManualWorkQueueFactory final : public WorkQueueFactory, private Concurrent
 
  private:
   void asyncAfter(std::chrono::nanoseconds delay, Task step) override;
+  void runStepOf(const std::shared_ptr<ManualWorkQueue>& queue, Task step);
 
   const std::shared_ptr<ManualClock> clock_;
   const std::shared_ptr<ManualWorkQueue::Shared> shared_;

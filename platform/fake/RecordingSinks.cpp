@@ -11,7 +11,11 @@ RecordingAnalyticsSink::RecordingAnalyticsSink(SharedEventLog events)
 
 void RecordingAnalyticsSink::sendEventLazy(std::string name, PayloadProvider provider) {
   checkFakeUse(provider != nullptr, "an event has a provider");
-  events_->add("analytics " + name);
+  if (events_->showsArguments()) {
+    events_->add("analytics " + name, {provider().value()});
+  } else {
+    events_->add("analytics " + name);
+  }
   const std::lock_guard lock(mutex_);
   sent_.push_back({std::move(name), std::move(provider)});
 }
@@ -43,7 +47,8 @@ RecordingWattlogSink::RecordingWattlogSink(SharedEventLog events)
 void RecordingWattlogSink::logRegisteredEvent(
     std::int32_t clientID, std::string_view name, const Dictionary& event,
     const std::optional<Dictionary>& attachment) {
-  events_->add("wattlog " + std::to_string(clientID) + ' ' + std::string(name));
+  events_->add("wattlog " + std::to_string(clientID) + ' ' + std::string(name),
+               {event.value()});
   const std::lock_guard lock(mutex_);
   logged_.push_back({clientID, std::string(name), event, attachment});
 }

@@ -11,8 +11,8 @@
 
 namespace ostrel {
 
-/// Keeps each event and its provider; calls none by itself. Adds
-/// "analytics NAME" to the events.
+/// Keeps each event and its provider; calls none by itself, unless the events show
+/// arguments. Adds "analytics NAME" to the events, its argument being the payload.
 class RecordingAnalyticsSink final : public AnalyticsSink {
  public:
   struct Event {
@@ -36,7 +36,7 @@ class RecordingAnalyticsSink final : public AnalyticsSink {
   std::vector<Event> sent_;
 };
 
-/// Adds "wattlog CLIENT NAME" to the events.
+/// Adds "wattlog CLIENT NAME" to the events, its argument being the event.
 class RecordingWattlogSink final : public WattlogSink {
  public:
   struct Event {
