@@ -53,7 +53,9 @@ class PrivateBus {
     std::filesystem::remove(socketPath());
     daemon_ = std::make_unique<ChildProcess>(std::vector<std::string>{
         "dbus-daemon", "--config-file=" + directory_ / "bus.conf", "--nofork"});
-    ASSERT_TRUE(eventually([this] { return std::filesystem::exists(socketPath()); }));
+    // The socket's file is there before anybody listens on it.
+    ASSERT_TRUE(
+        eventually([this] { return testing_support::isListenedTo(socketPath()); }));
   }
   void stop() { daemon_.reset(); }
 
@@ -106,13 +108,14 @@ class ScriptedSensors {
  private:
   void run() {
     sd_bus* bus = nullptr;
-    sd_bus_open_system(&bus);
-    sd_bus_add_object(bus, nullptr, kPath, &handle, this);
-    sd_bus_add_match(bus, nullptr,
-                     "type='signal',sender='org.freedesktop.DBus',"
-                     "member='NameOwnerChanged'",
-                     &clientChanged, this);
-    sd_bus_request_name(bus, kName, 0);
+    EXPECT_GE(sd_bus_open_system(&bus), 0);
+    EXPECT_GE(sd_bus_add_object(bus, nullptr, kPath, &handle, this), 0);
+    EXPECT_GE(sd_bus_add_match(bus, nullptr,
+                               "type='signal',sender='org.freedesktop.DBus',"
+                               "member='NameOwnerChanged'",
+                               &clientChanged, this),
+              0);
+    EXPECT_GE(sd_bus_request_name(bus, kName, 0), 0);
     isReady_ = true;
     while (!isDone_) {
       while (sd_bus_process(bus, nullptr) > 0) {

@@ -1,7 +1,11 @@
 // For the tests of the Linux bindings.
 #pragma once
 
+#include <sys/socket.h>
+#include <sys/un.h>
+
 #include <cstdlib>
+#include <cstring>
 #include <filesystem>
 #include <fstream>
 #include <memory>
@@ -11,6 +15,7 @@
 #include <vector>
 
 #include "platform/Logging.h"
+#include "platform/linux/FileDescriptor.h"
 
 namespace ostrel::testing_support {
 
@@ -43,6 +48,17 @@ class TemporaryDirectory {
  private:
   std::string path_;
 };
+
+/// Whether a connection to the Unix socket at `path` is taken. The file is there a moment
+/// before anybody listens.
+inline bool isListenedTo(const std::string& path) {
+  const FileDescriptor socket(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
+  sockaddr_un address{};
+  address.sun_family = AF_UNIX;
+  std::strncpy(address.sun_path, path.c_str(), sizeof address.sun_path - 1);
+  return ::connect(socket.get(), reinterpret_cast<const sockaddr*>(&address),
+                   sizeof address) == 0;
+}
 
 /// The process's log while it lives: keeps every line's text.
 class CapturedLog {

@@ -41,7 +41,8 @@ class TurnableDevice {
                       "<allow receive_sender=\"*\"/></policy></busconfig>");
     bus_ = std::make_unique<ChildProcess>(std::vector<std::string>{
         "dbus-daemon", "--config-file=" + service / "bus.conf", "--nofork"});
-    EXPECT_TRUE(eventually([&] { return std::filesystem::exists(service / "bus"); }));
+    EXPECT_TRUE(
+        eventually([&] { return testing_support::isListenedTo(service / "bus"); }));
     sensors_ = std::make_unique<ChildProcess>(
         std::vector<std::string>{
             "/usr/bin/python3", "-m", "dbusmock", "--template", "iio-sensors-proxy",
