@@ -18,6 +18,15 @@ Dictionary built(const Dictionary& start, std::string_view key, const Value& val
   return DictionaryBuilder(start).set(key, value).build();
 }
 
+class CountingAccount final : public PayloadAccount {
+ public:
+  void charge(std::size_t) noexcept override { ++buffers; }
+  void relieve(std::size_t) noexcept override {}
+  bool keep(std::size_t) noexcept override { return true; }
+  void discard(std::size_t) noexcept override {}
+  int buffers = 0;
+};
+
 TEST(DictionaryWith, AppendsAKeyThatIsNew) {
   const Dictionary start{{"a", 1}, {"b", 2}};
   EXPECT_EQ(description(start.with("c", "x")), "{a: 1, b: 2, c: x}");
@@ -42,6 +51,20 @@ TEST(DictionaryWith, TellsATextKeyFromAnIntegerKey) {
   const Dictionary start =
       DictionaryBuilder().set(five.view(), Value("integer").view()).build();
   EXPECT_EQ(encoded(start.with("5", "text")), encoded(built(start, "5", "text")));
+}
+
+TEST(DictionaryWith, IsOneBufferOfTheSameAccount) {
+  const auto account = std::make_shared<CountingAccount>();
+  const Dictionary plain{{"a", "text"}, {"b", 2}};
+  ValueBuffer buffer = ValueBuffer::copyOf(plain.value().bytes(), account);
+  const std::uint8_t* item = std::as_const(buffer).data();
+  const Dictionary start(std::move(buffer), item);
+  account->buffers = 0;
+
+  const Dictionary result = start.with("c", Value(3));
+
+  EXPECT_EQ(result.owner().account(), account);
+  EXPECT_EQ(account->buffers, 1);
 }
 
 // Writes dictionaries as other encoders may: with heads that are longer than they
