@@ -1,0 +1,85 @@
+// The service is ended while four clients send: by SIGTERM, which keeps what was
+// answered, and by a client.
+#include <gtest/gtest.h>
+
+#include <algorithm>
+#include <cstdio>
+
+#include "tests/crash/LoadedService.h"
+
+namespace ostrel::crash {
+namespace {
+
+using namespace std::chrono_literals;
+using std::chrono::microseconds;
+
+constexpr std::int64_t kEndsOfOneStore = 25;
+
+TEST(EndedService, KeepsWhatItAnsweredBeforeSIGTERM) {
+  const std::int64_t ends = timesFrom("OSTREL_TERMINATIONS", /*usual=*/50);
+  const std::uint64_t seed = seedFrom(/*usual=*/20260201);
+  microseconds slowest{0};
+  std::int64_t answered = 0;
+  std::mt19937_64 random(seed);
+  for (std::int64_t end = 0; end < ends;) {
+    SCOPED_TRACE("OSTREL_SEED=" + std::to_string(seed) + ", end " + std::to_string(end));
+    LoadedService service(random(), /*pause=*/100us);
+    for (std::int64_t last = std::min(ends, end + kEndsOfOneStore); end < last; ++end) {
+      service.start();
+      std::this_thread::sleep_for(microseconds(random() % 30'000));
+      const auto accepted = service.takeAccepted();
+      const auto signalled = SteadyClock::now();
+      ASSERT_EQ(service->terminate(), 0) << service->read("log.txt");
+      slowest = std::max(slowest, since(signalled));
+      answered += static_cast<std::int64_t>(accepted.size());
+      service.expectDurable(accepted);
+      ASSERT_FALSE(HasFailure());
+    }
+    service.reader().audit();
+  }
+  std::printf(
+      "%lld ends by SIGTERM, %lld messages answered before, slowest end %.1f ms\n",
+      static_cast<long long>(ends), static_cast<long long>(answered),
+      millisecondsOf(slowest));
+  EXPECT_LT(slowest, 2s * kSlowness);
+}
+
+TEST(EndedService, IsThereAgainAtOnceAfterAClientKilledIt) {
+  const std::int64_t ends = timesFrom("OSTREL_KILLS_BY_CLIENT", /*usual=*/25);
+  const std::uint64_t seed = seedFrom(/*usual=*/20260202);
+  microseconds slowest{0};
+  std::mt19937_64 random(seed);
+  for (std::int64_t end = 0; end < ends;) {
+    SCOPED_TRACE("OSTREL_SEED=" + std::to_string(seed) + ", end " + std::to_string(end));
+    LoadedService service(random(), /*pause=*/100us);
+    for (std::int64_t last = std::min(ends, end + kEndsOfOneStore); end < last; ++end) {
+      const auto begin = SteadyClock::now();
+      service->start();
+      {
+        RecordingClient client(service->socketPath());
+        client->getAllReporters([](const ReporterIDs&) {});
+        client.takeReplies();
+        slowest = std::max(slowest, since(begin));
+        service.reader().check();
+        for (const auto life = microseconds(random() % 40'000);
+             since(begin) < life + 20ms;) {
+          service.reader().look();
+          std::this_thread::sleep_for(1ms);
+        }
+        client->killService([](bool) {});
+        ASSERT_EQ(service->process().wait(), 2) << service->read("log.txt");
+      }
+      ASSERT_FALSE(HasFailure());
+    }
+    service->start();
+    ASSERT_TRUE(eventually([&] { return service.isThere(); }));
+    service.reader().audit();
+    EXPECT_GT(service.reader().seenCount(), 0u);
+  }
+  std::printf("%lld ends by a client, slowest answer after one %.1f ms\n",
+              static_cast<long long>(ends), millisecondsOf(slowest));
+  EXPECT_LT(slowest, 500ms * kSlowness);
+}
+
+}  // namespace
+}  // namespace ostrel::crash
