@@ -31,7 +31,7 @@ void decodeRequest(benchmark::State& state) {
   for (auto _ : state) {
     wire::Request request;
     const auto error = wire::decodeRequest(item, kLimits, limits::kReporterIDs,
-                                           /*account=*/nullptr, request);
+                                           /*owner=*/{}, request);
     if (error) state.SkipWithError("the request is refused");
     benchmark::DoNotOptimize(request);
   }

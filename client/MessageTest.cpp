@@ -110,7 +110,7 @@ wire::Request requestOf(const PreparedMessage& message) {
   const auto error = wire::decodeRequest(
       {bytes + wire::kFrameHeaderSize, message.frame().size() - wire::kFrameHeaderSize},
       {limits::kNesting, limits::kNodes, limits::kKeyBytes}, limits::kReporterIDs,
-      /*account=*/nullptr, request);
+      /*owner=*/{}, request);
   EXPECT_FALSE(error) << *error;
   return request;
 }

@@ -224,14 +224,20 @@ void appendScalarDescription(std::string& out, ValueView value) {
 
 }  // namespace
 
-ValueBuffer ValueBuffer::make(std::size_t size, std::shared_ptr<PayloadAccount> account) {
+ValueBuffer ValueBuffer::makeUncharged(std::size_t size,
+                                       std::shared_ptr<PayloadAccount> account) {
   void* memory = ::operator new(sizeof(Header) + size);
   auto* header = new (memory) Header;
   header->size = size;
   header->account = std::move(account);
-  if (header->account) header->account->charge(sizeof(Header) + size);
   ValueBuffer buffer;
   buffer.header_ = header;
+  return buffer;
+}
+
+ValueBuffer ValueBuffer::make(std::size_t size, std::shared_ptr<PayloadAccount> account) {
+  ValueBuffer buffer = makeUncharged(size, std::move(account));
+  buffer.charge(buffer.memory());
   return buffer;
 }
 
@@ -242,12 +248,19 @@ ValueBuffer ValueBuffer::copyOf(std::span<const std::uint8_t> bytes,
   return buffer;
 }
 
+ValueBuffer ValueBuffer::copyOfInput(std::span<const std::uint8_t> bytes,
+                                     std::shared_ptr<PayloadAccount> account) {
+  ValueBuffer buffer = makeUncharged(bytes.size(), std::move(account));
+  std::memcpy(buffer.data(), bytes.data(), bytes.size());
+  return buffer;
+}
+
 void ValueBuffer::destroy(Header* header) noexcept {
   const std::shared_ptr<PayloadAccount> account = std::move(header->account);
-  const std::size_t size = sizeof(Header) + header->size;
+  const std::size_t charged = header->charged;
   header->~Header();
   ::operator delete(header);
-  if (account) account->relieve(size);
+  if (account) account->relieve(charged);
 }
 
 ValueKind ValueView::kind() const {
@@ -499,6 +512,13 @@ Dictionary Dictionary::copyOf(std::string_view encoded) {
   return Dictionary(buffer, buffer.data());
 }
 
+Dictionary Dictionary::compact() const {
+  if (!owner_ || value().bytes().size() == owner_.size()) return *this;
+  ValueBuffer buffer = ValueBuffer::copyOf(value().bytes(), owner_.account());
+  const std::uint8_t* item = buffer.data();
+  return Dictionary(std::move(buffer), item);
+}
+
 std::optional<Value> Dictionary::get(std::string_view key) const {
   const auto found = find(key);
   if (!found) return std::nullopt;
@@ -562,9 +582,11 @@ void ValueEncoder::date(Date value) {
 }
 
 void ValueEncoder::string(std::string_view text) {
-  head(kText, text.size());
+  beginString(text.size());
   out_.append(text);
 }
+
+void ValueEncoder::beginString(std::size_t bytes) { head(kText, bytes); }
 
 void ValueEncoder::beginArray(std::size_t size) { head(kArrayType, size); }
 

@@ -56,6 +56,10 @@ class ValueBuffer {
   static ValueBuffer make(std::size_t size, std::shared_ptr<PayloadAccount> account = {});
   static ValueBuffer copyOf(std::span<const std::uint8_t> bytes,
                             std::shared_ptr<PayloadAccount> account = {});
+  /// A copy of what one read brought. Charged are only the bytes that `charge` is
+  /// told of: who reads them charges what it makes values of.
+  static ValueBuffer copyOfInput(std::span<const std::uint8_t> bytes,
+                                 std::shared_ptr<PayloadAccount> account);
 
   ValueBuffer(const ValueBuffer& other) noexcept : header_(other.header_) {
     if (header_) header_->references.fetch_add(1, std::memory_order_relaxed);
@@ -81,13 +85,25 @@ class ValueBuffer {
   std::shared_ptr<PayloadAccount> account() const {
     return header_ ? header_->account : nullptr;
   }
+  /// Charges the account `bytes` more, until the last reference goes. Only who made
+  /// the buffer, while holding a reference. Nothing without an account.
+  void charge(std::size_t bytes) noexcept {
+    if (!header_->account) return;
+    header_->charged += bytes;
+    header_->account->charge(bytes);
+  }
+  /// What the buffer takes in memory.
+  std::size_t memory() const { return sizeof(Header) + header_->size; }
 
  private:
   struct Header {
     std::atomic<std::uint32_t> references{1};
     std::size_t size = 0;
+    std::size_t charged = 0;
     std::shared_ptr<PayloadAccount> account;
   };
+  static ValueBuffer makeUncharged(std::size_t size,
+                                   std::shared_ptr<PayloadAccount> account);
   static void destroy(Header* header) noexcept;
 
   Header* header_ = nullptr;
@@ -377,6 +393,10 @@ class Dictionary {
   std::optional<Value> get(std::string_view key) const;
   bool contains(std::string_view key) const { return find(key).has_value(); }
 
+  /// This dictionary, which no longer keeps more alive than itself: a copy when it
+  /// shares its buffer with other values. For those that are kept for long.
+  Dictionary compact() const;
+
   /// This dictionary with `value` under `key`, in the place of what was there or as
   /// the last entry: what a builder makes of it, in one allocation.
   Dictionary with(std::string_view key, const Value& value) const;
@@ -402,6 +422,8 @@ class ValueEncoder {
   void floatingPoint(double value);
   void date(Date value);
   void string(std::string_view text);
+  /// The head of a text of so many bytes, which the caller adds.
+  void beginString(std::size_t bytes);
   void beginArray(std::size_t size);
   void beginDictionary(std::size_t size);
   void item(ValueView value);

@@ -378,6 +378,38 @@ TEST(PayloadAccount, IsChargedForABufferUntilItsLastReferenceGoes) {
   EXPECT_EQ(account->relieved, account->charged);
 }
 
+TEST(PayloadAccount, IsChargedForInputOnlyWhatItsReaderSays) {
+  const auto account = std::make_shared<CountingAccount>();
+  {
+    const Value value("text");
+    ValueBuffer input = ValueBuffer::copyOfInput(value->bytes(), account);
+    EXPECT_EQ(account->charged, 0u);
+    input.charge(3);
+    input.charge(4);
+    EXPECT_EQ(account->charged, 7u);
+  }
+  EXPECT_EQ(account->relieved, 7u);
+}
+
+TEST(Dictionary, CompactsToItsOwnBytesAndKeepsTheAccount) {
+  const auto account = std::make_shared<CountingAccount>();
+  const Dictionary plain{{"a", Value("text")}};
+  std::string bytes(1000, '\0');
+  const auto own = plain.value().bytes();
+  std::copy(own.begin(), own.end(), bytes.begin() + 500);
+  ValueBuffer large = ValueBuffer::copyOf(
+      {reinterpret_cast<const std::uint8_t*>(bytes.data()), bytes.size()}, account);
+  const Dictionary part(large, std::as_const(large).data() + 500);
+
+  const Dictionary compact = part.compact();
+
+  EXPECT_EQ(compact, plain);
+  EXPECT_EQ(compact.owner().size(), own.size());
+  EXPECT_EQ(compact.owner().account(), account);
+  EXPECT_EQ(compact.compact().value().data(), compact.value().data());
+  EXPECT_EQ(Dictionary().compact(), Dictionary());
+}
+
 Dictionary chargedDictionary(const std::shared_ptr<PayloadAccount>& account) {
   const Dictionary plain{{"a", Value("text")}, {"b", Value(2)}};
   ValueBuffer buffer = ValueBuffer::copyOf(plain.value().bytes(), account);

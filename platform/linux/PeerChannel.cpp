@@ -49,13 +49,11 @@ void PeerChannel::reply(wire::RequestNumber number, const wire::ReplyValue& valu
 }
 
 void PeerChannel::charge(std::size_t bytes) noexcept {
-  own_.take(bytes + limits::kRequestBytes);
-  user_->queued().take(bytes + limits::kRequestBytes);
+  own_.take(bytes);
+  user_->queued().take(bytes);
 }
 
-void PeerChannel::relieve(std::size_t bytes) noexcept {
-  give(bytes + limits::kRequestBytes);
-}
+void PeerChannel::relieve(std::size_t bytes) noexcept { give(bytes); }
 
 void PeerChannel::give(std::size_t bytes) noexcept {
   const bool hasOwnEased = own_.give(bytes);

@@ -33,7 +33,6 @@ class PeerChannel final : public PayloadAccount {
   /// or has too many unread.
   void reply(wire::RequestNumber number, const wire::ReplyValue& value);
 
-  /// A payload also costs its place in a queue (`limits::kRequestBytes`).
   void charge(std::size_t bytes) noexcept override;
   void relieve(std::size_t bytes) noexcept override;
   bool keep(std::size_t bytes) noexcept override { return user_->keep(bytes); }

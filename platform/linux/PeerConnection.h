@@ -10,6 +10,7 @@
 #include <string_view>
 
 #include "platform/IPCListener.h"
+#include "platform/Value.h"
 #include "platform/linux/FileDescriptor.h"
 #include "platform/linux/Limits.h"
 #include "platform/linux/PeerChannel.h"
@@ -103,7 +104,8 @@ class PeerConnection final : public IPCConnection {
   ssize_t receive(std::span<std::uint8_t> room);
   std::size_t process(std::span<const std::uint8_t> bytes);
   void processPending();
-  void carryOut(std::span<const std::uint8_t> item);
+  std::size_t carryOut(ValueBuffer& input, std::span<const std::uint8_t> item);
+  void checkNextFrame(std::span<const std::uint8_t> bytes);
   bool holdBackIfFull();
   std::size_t missingBytes() const;
 

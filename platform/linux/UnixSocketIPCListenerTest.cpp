@@ -393,6 +393,54 @@ TEST_F(UnixSocketListener, TakesThousandsOfFramesAtOnce) {
   EXPECT_EQ(service->calls().size(), 20'001);
 }
 
+TEST_F(UnixSocketListener, JoinsTheBeginningOfAFrameWithItsRestAtEveryLength) {
+  serve();
+  RawClient client(path);
+  std::string frame;
+  wire::appendRequest(frame, messageRequest(1, std::string(4200, 'x')));
+  std::string second;
+  wire::appendRequest(second, createRequest(2, 7));
+
+  for (const std::size_t split : {1, 3, 4, 5, 2047, 2048, 2049, 4096, 4200}) {
+    client.send(frame.substr(0, split));
+    EXPECT_FALSE(client.receive(20ms)) << split;
+    client.send(frame.substr(split) + second);
+    EXPECT_EQ(hex(client.receive().value_or("")), "8201f6") << split;
+    EXPECT_EQ(hex(client.receive().value_or("")), "8202f5") << split;
+  }
+}
+
+TEST_F(UnixSocketListener, ChargesAllThatAMessageKeepsInMemory) {
+  ListenerLimits limits;
+  limits.queuedBytes = 64 * 1024;
+  serve(limits);
+  service->holdReplies();
+  RawClient client(path);
+  // One held message among others that are done with at once: a few kilobytes of
+  // input stay alive for it.
+  std::string burst;
+  wire::appendRequest(burst, messageRequest(0, "held"));
+  for (int i = 0; i < 200; ++i) {
+    wire::Request request;
+    request.operation = wire::Operation::kReporterIDValid;
+    wire::appendRequest(burst, request);
+  }
+  constexpr std::size_t kBursts = 400;
+
+  std::thread sender([&] {
+    for (std::size_t i = 0; i < kBursts; ++i) client.send(burst);
+  });
+  ASSERT_TRUE(service->waitForCalls(201));
+  std::this_thread::sleep_for(100ms);
+  const std::size_t whileHeld = service->calls().size();
+  service->releaseReplies();
+
+  EXPECT_TRUE(service->waitForCalls(kBursts * 201));
+  sender.join();
+  const std::size_t inputBytes = whileHeld / 201 * burst.size();
+  EXPECT_LE(inputBytes, 2 * limits.queuedBytes + 64 * 1024);
+}
+
 TEST_F(UnixSocketListener, TakesAFrameOfTheLargestSizeAndNoneLarger) {
   ListenerLimits limits;
   limits.frameBytes = 1000;

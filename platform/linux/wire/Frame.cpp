@@ -108,10 +108,13 @@ DecodeError takeReporterIDs(ItemReader& reader, std::size_t mostIDs, ReporterIDs
   return std::nullopt;
 }
 
+// Copied unless the frame lies in `owner`.
 DecodeError takeDictionary(ItemReader& reader, const PayloadLimits& limits,
-                           const std::shared_ptr<PayloadAccount>& account,
+                           const ValueBuffer& owner,
                            std::optional<Dictionary>& dictionary) {
-  DecodedDictionary decoded = decodeLeadingDictionary(reader.rest(), limits, account);
+  DecodedDictionary decoded =
+      owner ? decodeLeadingDictionary(owner, reader.rest(), limits)
+            : decodeLeadingDictionary(reader.rest(), limits, /*account=*/nullptr);
   if (decoded.error) return decoded.error;
   reader.skip(decoded.size);
   dictionary = std::move(decoded.dictionary);
@@ -129,8 +132,7 @@ DecodeError takeCode(ItemReader& reader, std::string_view error, Code& code) {
 
 DecodeError takeArgument(ItemReader& reader, Argument argument,
                          const PayloadLimits& limits, std::size_t mostIDs,
-                         const std::shared_ptr<PayloadAccount>& account,
-                         Request& request) {
+                         const ValueBuffer& owner, Request& request) {
   switch (argument) {
     case Argument::kReporterID: {
       std::int64_t id;
@@ -146,9 +148,9 @@ DecodeError takeArgument(ItemReader& reader, Argument argument,
       return takeCode(reader, kWrongType, request.type);
     case Argument::kOptionalConfiguration:
       if (reader.takeNull()) return std::nullopt;
-      return takeDictionary(reader, limits, account, request.dictionary);
+      return takeDictionary(reader, limits, owner, request.dictionary);
     case Argument::kMessage:
-      return takeDictionary(reader, limits, account, request.dictionary);
+      return takeDictionary(reader, limits, owner, request.dictionary);
     case Argument::kOptionalReporterIDs:
       if (reader.takeNull()) return std::nullopt;
       return takeReporterIDs(reader, mostIDs, request.reporterIDs.emplace());
@@ -230,8 +232,7 @@ DecodeError takeReplyValue(ItemReader& reader, ReplyKind kind,
       return reader.takeNull() ? DecodeError() : kWrongValue;
     case ReplyKind::kDictionary: {
       std::optional<Dictionary> dictionary;
-      const DecodeError error =
-          takeDictionary(reader, limits, /*account=*/nullptr, dictionary);
+      const DecodeError error = takeDictionary(reader, limits, /*owner=*/{}, dictionary);
       if (!error) value = std::move(*dictionary);
       return error;
     }
@@ -252,8 +253,7 @@ bool takeError(ItemReader& reader, ErrorObject& error) {
 }  // namespace
 
 DecodeError decodeRequest(std::span<const std::uint8_t> item, const PayloadLimits& limits,
-                          std::size_t mostIDs,
-                          const std::shared_ptr<PayloadAccount>& account,
+                          std::size_t mostIDs, const ValueBuffer& owner,
                           Request& request) {
   ItemReader reader(item);
   std::size_t size;
@@ -274,7 +274,7 @@ DecodeError decodeRequest(std::span<const std::uint8_t> item, const PayloadLimit
   }
   for (const Argument argument : row.arguments) {
     const DecodeError error =
-        takeArgument(reader, argument, limits, mostIDs, account, request);
+        takeArgument(reader, argument, limits, mostIDs, owner, request);
     if (error) return error;
   }
   return reader.isAtEnd() ? DecodeError() : kTrailingBytes;

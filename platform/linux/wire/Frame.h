@@ -62,10 +62,10 @@ struct Request {
 };
 
 /// Decodes the item of one frame (without its length). Anything but exactly one
-/// well-formed request with arguments in range is an error.
+/// well-formed request with arguments in range is an error. When the item lies in
+/// `owner`, which may be none, a dictionary is left there; else it is copied.
 DecodeError decodeRequest(std::span<const std::uint8_t> item, const PayloadLimits& limits,
-                          std::size_t mostIDs,
-                          const std::shared_ptr<PayloadAccount>& account,
+                          std::size_t mostIDs, const ValueBuffer& owner,
                           Request& request);
 
 /// Each appends one whole frame, length included. Texts must be UTF-8.

@@ -23,8 +23,7 @@ void expect(bool condition) {
 }
 
 wire::DecodeError decode(Bytes item, wire::Request& request) {
-  return wire::decodeRequest(item, kLimits, limits::kReporterIDs, /*account=*/nullptr,
-                             request);
+  return wire::decodeRequest(item, kLimits, limits::kReporterIDs, /*owner=*/{}, request);
 }
 
 void tryRequest(Bytes item) {

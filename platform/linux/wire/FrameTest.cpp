@@ -54,7 +54,7 @@ Request sampleRequest(Operation operation) {
 DecodeError decode(const std::string& item, Request& request,
                    std::size_t mostIDs = kMostIDs) {
   const ExactBytes exact(item);
-  return decodeRequest(exact.span(), kTestLimits, mostIDs, /*account=*/nullptr, request);
+  return decodeRequest(exact.span(), kTestLimits, mostIDs, /*owner=*/{}, request);
 }
 
 DecodeError decodeErrorOf(const std::string& item, std::size_t mostIDs = kMostIDs) {
@@ -88,7 +88,7 @@ TEST(RequestFrame, ComesBackAsItWasForEveryOperation) {
     const auto item = itemOf(frame);
     Request received;
     const DecodeError error =
-        decodeRequest(item, kTestLimits, kMostIDs, /*account=*/nullptr, received);
+        decodeRequest(item, kTestLimits, kMostIDs, /*owner=*/{}, received);
     EXPECT_EQ(error.value_or(""), "") << kOperationTable[i].name;
     expectEqual(sent, received);
   }
@@ -109,7 +109,7 @@ TEST(RequestFrame, TellsAnAbsentListFromAnEmptyOne) {
     appendRequest(frame, sent);
     Request received;
     EXPECT_FALSE(decodeRequest(itemOf(frame), kTestLimits, kMostIDs,
-                               /*account=*/nullptr, received));
+                               /*owner=*/{}, received));
     EXPECT_EQ(received.reporterIDs.has_value(), isPresent);
   }
 }
@@ -121,7 +121,7 @@ TEST(RequestFrame, CarriesNoConfigurationAsNull) {
   appendRequest(frame, sent);
   Request received;
   EXPECT_FALSE(
-      decodeRequest(itemOf(frame), kTestLimits, kMostIDs, /*account=*/nullptr, received));
+      decodeRequest(itemOf(frame), kTestLimits, kMostIDs, /*owner=*/{}, received));
   EXPECT_FALSE(received.dictionary);
 }
 
@@ -130,7 +130,7 @@ TEST(RequestFrame, TakesAFarewell) {
   appendFarewell(frame);
   Request request;
   EXPECT_FALSE(
-      decodeRequest(itemOf(frame), kTestLimits, kMostIDs, /*account=*/nullptr, request));
+      decodeRequest(itemOf(frame), kTestLimits, kMostIDs, /*owner=*/{}, request));
   EXPECT_EQ(request.operation, Operation::kFarewell);
 }
 

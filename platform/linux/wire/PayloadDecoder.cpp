@@ -503,6 +503,28 @@ class RepeatedKeyRemover {
   std::vector<Entry> entries_;
 };
 
+DecodeError checkDictionary(std::span<const std::uint8_t> bytes,
+                            const PayloadLimits& limits, std::size_t& size,
+                            bool& hasRepeatedKeys) {
+  if (bytes.empty()) return kTruncated;
+  if (bytes[0] >> 5 != kMapItem) return kNotADictionary;
+  return checkItem(bytes, limits, size, hasRepeatedKeys);
+}
+
+Dictionary copyOf(std::span<const std::uint8_t> item,
+                  std::shared_ptr<PayloadAccount> account) {
+  ValueBuffer buffer = ValueBuffer::copyOf(item, std::move(account));
+  const Byte* copied = buffer.data();
+  return Dictionary(std::move(buffer), copied);
+}
+
+Dictionary withoutRepeatedKeys(std::span<const std::uint8_t> item,
+                               std::shared_ptr<PayloadAccount> account) {
+  const std::string rewritten = RepeatedKeyRemover(item).run();
+  const auto* first = reinterpret_cast<const Byte*>(rewritten.data());
+  return copyOf({first, rewritten.size()}, std::move(account));
+}
+
 }  // namespace
 
 bool isUTF8(std::span<const std::uint8_t> text) {
@@ -543,26 +565,33 @@ DecodeError checkItem(std::span<const std::uint8_t> bytes, const PayloadLimits& 
   return check.run(size, hasRepeatedKeys);
 }
 
+DecodedDictionary decodeLeadingDictionary(const ValueBuffer& owner,
+                                          std::span<const std::uint8_t> bytes,
+                                          const PayloadLimits& limits) {
+  std::size_t size = 0;
+  bool hasRepeatedKeys = false;
+  if (auto error = checkDictionary(bytes, limits, size, hasRepeatedKeys)) {
+    return {std::nullopt, error};
+  }
+  if (hasRepeatedKeys) {
+    return {withoutRepeatedKeys(bytes.first(size), owner.account()), std::nullopt, size};
+  }
+  return {Dictionary(owner, bytes.data()), std::nullopt, size};
+}
+
 DecodedDictionary decodeLeadingDictionary(std::span<const std::uint8_t> bytes,
                                           const PayloadLimits& limits,
                                           std::shared_ptr<PayloadAccount> account) {
-  if (bytes.empty()) return {std::nullopt, kTruncated};
-  if (bytes[0] >> 5 != kMapItem) return {std::nullopt, kNotADictionary};
   std::size_t size = 0;
   bool hasRepeatedKeys = false;
-  if (auto error = checkItem(bytes, limits, size, hasRepeatedKeys)) {
+  if (auto error = checkDictionary(bytes, limits, size, hasRepeatedKeys)) {
     return {std::nullopt, error};
   }
-  ValueBuffer buffer;
   if (hasRepeatedKeys) {
-    const std::string rewritten = RepeatedKeyRemover(bytes.first(size)).run();
-    const auto* first = reinterpret_cast<const Byte*>(rewritten.data());
-    buffer = ValueBuffer::copyOf({first, rewritten.size()}, std::move(account));
-  } else {
-    buffer = ValueBuffer::copyOf(bytes.first(size), std::move(account));
+    return {withoutRepeatedKeys(bytes.first(size), std::move(account)), std::nullopt,
+            size};
   }
-  const Byte* item = std::as_const(buffer).data();
-  return {Dictionary(std::move(buffer), item), std::nullopt, size};
+  return {copyOf(bytes.first(size), std::move(account)), std::nullopt, size};
 }
 
 DecodedDictionary decodeDictionary(std::span<const std::uint8_t> bytes,

@@ -43,9 +43,15 @@ struct DecodedDictionary {
   std::size_t size = 0;  // Of the encoding that was decoded.
 };
 
-/// A payload at the start of `bytes`: checked, copied once, and of entries with
-/// one key the last one kept. The memory is charged to `account`, which may be
-/// none. Bytes behind the payload are left alone.
+/// A payload at the start of `bytes`, which lie in `owner`: checked, and left where
+/// it is. Of entries with one key the last one is kept; such a payload is copied, and
+/// charged to the owner's account. Bytes behind the payload are left alone.
+DecodedDictionary decodeLeadingDictionary(const ValueBuffer& owner,
+                                          std::span<const std::uint8_t> bytes,
+                                          const PayloadLimits& limits);
+
+/// As above, copied once from `bytes`, which lie anywhere. The memory is charged to
+/// `account`, which may be none.
 DecodedDictionary decodeLeadingDictionary(std::span<const std::uint8_t> bytes,
                                           const PayloadLimits& limits,
                                           std::shared_ptr<PayloadAccount> account);

@@ -413,6 +413,41 @@ TEST(PayloadDecoder, ChargesNothingForWhatItRejects) {
   EXPECT_EQ(account->bytes(), 0U);
 }
 
+TEST(PayloadDecoder, LeavesADictionaryWhereItLies) {
+  const std::string bytes = bytesOf({0x17, 0xA1, 0x01, 0x02});
+  const ValueBuffer owner = ValueBuffer::copyOf(spanOf(bytes));
+  const auto decoded =
+      decodeLeadingDictionary(owner, {owner.data() + 1, owner.size() - 1}, kTestLimits);
+  ASSERT_TRUE(decoded.dictionary);
+  EXPECT_EQ(decoded.dictionary->value().data(), owner.data() + 1);
+}
+
+TEST(PayloadDecoder, KeepsTheMemoryOfADictionaryThatItLeft) {
+  std::optional<Dictionary> kept;
+  {
+    const std::string bytes = bytesOf({0xA1, 0x01, 0x02});
+    const ValueBuffer owner = ValueBuffer::copyOf(spanOf(bytes));
+    kept = decodeLeadingDictionary(owner, {owner.data(), owner.size()}, kTestLimits)
+               .dictionary;
+  }
+  EXPECT_EQ(description(kept->value()), "{1: 2}");
+}
+
+TEST(PayloadDecoder, CopiesADictionaryWithRepeatedKeysAndChargesTheOwnersAccount) {
+  const auto account = std::make_shared<CountingAccount>();
+  {
+    const std::string bytes = bytesOf({0xA2, 0x01, 0x02, 0x01, 0x03});
+    const ValueBuffer owner = ValueBuffer::copyOfInput(spanOf(bytes), account);
+    const auto decoded =
+        decodeLeadingDictionary(owner, {owner.data(), owner.size()}, kTestLimits);
+    ASSERT_TRUE(decoded.dictionary);
+    EXPECT_EQ(description(decoded.dictionary->value()), "{1: 3}");
+    EXPECT_EQ(decoded.size, bytes.size());
+    EXPECT_GT(account->bytes(), 0U);
+  }
+  EXPECT_EQ(account->bytes(), 0U);
+}
+
 TEST(PayloadText, TellsUTF8ByTheWholeTableOfTwoBytes) {
   for (int first = 0; first < 256; ++first) {
     for (int second = 0; second < 256; ++second) {

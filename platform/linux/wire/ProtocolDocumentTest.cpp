@@ -56,7 +56,7 @@ TEST(ProtocolDocument, ShowsARequestOfEveryOperation) {
     Request request;
     const DecodeError error =
         decodeRequest(itemOf(example.frame), kTestLimits, limits::kReporterIDs,
-                      /*account=*/nullptr, request);
+                      /*owner=*/{}, request);
     EXPECT_EQ(error.value_or(""), "");
     ++seen[request.operation];
     std::string written;
