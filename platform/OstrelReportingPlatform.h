@@ -10,6 +10,7 @@ class ChannelReportingService;
 class Clock;
 class ConditionFactory;
 class DeviceInfo;
+class EntryStorage;
 class FileSystem;
 class JSONSerialization;
 class KernelTrace;
@@ -33,6 +34,7 @@ struct OstrelReportingPlatform {
   std::shared_ptr<Clock> clock;
   std::shared_ptr<Random> random;
   std::shared_ptr<FileSystem> fileSystem;
+  std::shared_ptr<EntryStorage> entryStorage;
   std::shared_ptr<JSONSerialization> json;
   std::shared_ptr<ChangeNotification> notifications;
   std::shared_ptr<UserDefaults> userDefaults;

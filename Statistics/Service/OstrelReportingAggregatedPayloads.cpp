@@ -1,56 +1,74 @@
 #include "Statistics/Service/OstrelReportingAggregatedPayloads.h"
 
-#include <algorithm>
-#include <cstring>
-#include <string>
+#include <array>
+#include <cstdint>
 
 namespace ostrel {
 namespace {
 
-// An idle session has no chunk, a short one a small chunk, and a long one
-// wastes little at the end of its last.
-constexpr std::size_t kFirstChunk = 1024;
-constexpr std::size_t kLargestChunk = 256 * 1024;
+// A payload that no account bears was made by the service itself. From this size on
+// it is a summary, which is dropped with the list soon; to copy it would take as much
+// memory again.
+constexpr std::size_t kLargePayload = 64 * 1024;
+
+StoredEntries::Bytes asBytes(std::string_view text) {
+  return {reinterpret_cast<const std::uint8_t*>(text.data()), text.size()};
+}
 
 }  // namespace
 
-void OstrelReportingAggregatedPayloads::Snapshot::forEach(
+bool OstrelReportingAggregatedPayloads::Snapshot::forEach(
     const EntryCallback& callback) const {
   for (const Dictionary& entry : front_) callback(entry.value());
-  for (const Part& part : parts_) {
-    const std::uint8_t* at = part.bytes.get();
-    const std::uint8_t* const end = at + part.size;
+  auto reference = references_.begin();
+  std::size_t storedBefore = 0;
+  const auto giveReferences = [&] {
+    while (reference != references_.end() && reference->storedBefore == storedBefore) {
+      callback(Dictionary().with(reference->identifier, reference->payload).value());
+      ++reference;
+    }
+  };
+  giveReferences();
+  if (!stored_) return true;
+  return stored_->forEachRun([&](StoredEntries::Bytes entries) {
+    const std::uint8_t* at = entries.data();
+    const std::uint8_t* const end = at + entries.size();
     while (at != end) {
       const ValueView entry(at);
       at = entry.end();
       callback(entry);
+      ++storedBefore;
+      giveReferences();
     }
-  }
+  });
 }
 
 void OstrelReportingAggregatedPayloads::append(std::string_view identifier,
                                                const Dictionary& payload) {
-  head_.clear();
-  ValueEncoder encoder(head_);
+  if (payload.owner().size() >= kLargePayload && !payload.owner().account()) {
+    references_.push_back({storedCount_, std::string(identifier), payload});
+    return;
+  }
+  std::string head;  // So short that it takes no memory of its own.
+  ValueEncoder encoder(head);
   encoder.beginDictionary(1);
-  encoder.string(identifier);
-  const auto bytes = payload.value().bytes();
-  std::uint8_t* at = room(head_.size() + bytes.size());
-  std::memcpy(at, head_.data(), head_.size());
-  std::memcpy(at + head_.size(), bytes.data(), bytes.size());
-  ++size_;
+  encoder.beginString(identifier.size());
+  store(std::array{asBytes(head), asBytes(identifier), payload.value().bytes()}, payload);
 }
 
 void OstrelReportingAggregatedPayloads::append(const Dictionary& entry) {
-  const auto bytes = entry.value().bytes();
-  std::memcpy(room(bytes.size()), bytes.data(), bytes.size());
-  ++size_;
+  store(std::array{entry.value().bytes()}, entry);
+}
+
+void OstrelReportingAggregatedPayloads::store(std::span<const StoredEntries::Bytes> parts,
+                                              const Dictionary& bearer) {
+  if (!stored_) stored_ = storage_.makeEntries(session_);
+  if (stored_->append(parts, bearer.owner().account())) ++storedCount_;
 }
 
 void OstrelReportingAggregatedPayloads::insertFront(
     std::shared_ptr<const MutableDictionary> entry) {
   front_.push_back(std::move(entry));
-  ++size_;
 }
 
 OstrelReportingAggregatedPayloads::Snapshot OstrelReportingAggregatedPayloads::snapshot()
@@ -59,27 +77,9 @@ OstrelReportingAggregatedPayloads::Snapshot OstrelReportingAggregatedPayloads::s
   for (auto entry = front_.rbegin(); entry != front_.rend(); ++entry) {
     snapshot.front_.push_back((*entry)->snapshot());
   }
-  for (const Chunk& chunk : chunks_) {
-    snapshot.parts_.push_back({chunk.bytes, chunk.used});
-  }
+  if (stored_) snapshot.stored_ = stored_->snapshot();
+  snapshot.references_ = references_;
   return snapshot;
-}
-
-// Chunks are never moved nor written before their `used`, so that a snapshot
-// may be read while entries are appended.
-std::uint8_t* OstrelReportingAggregatedPayloads::room(std::size_t bytes) {
-  if (chunks_.empty() || chunks_.back().capacity - chunks_.back().used < bytes) {
-    const std::size_t wanted = chunks_.empty()
-                                   ? kFirstChunk
-                                   : std::min(2 * chunks_.back().capacity, kLargestChunk);
-    const std::size_t capacity = std::max(wanted, bytes);
-    chunks_.push_back(
-        {std::shared_ptr<std::uint8_t[]>(new std::uint8_t[capacity]), capacity});
-  }
-  Chunk& chunk = chunks_.back();
-  std::uint8_t* at = chunk.bytes.get() + chunk.used;
-  chunk.used += bytes;
-  return at;
 }
 
 }  // namespace ostrel

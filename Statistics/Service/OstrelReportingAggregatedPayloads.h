@@ -1,15 +1,17 @@
 #pragma once
 
 #include <cstddef>
-#include <cstdint>
 #include <functional>
 #include <memory>
+#include <span>
 #include <string>
 #include <string_view>
 #include <vector>
 
+#include "Statistics/OstrelReportingTypes.h"
 #include "Statistics/Support/Monitored.h"
 #include "Statistics/Support/MutableDictionary.h"
+#include "platform/EntryStorage.h"
 #include "platform/Value.h"
 
 namespace ostrel {
@@ -18,30 +20,39 @@ namespace ostrel {
 /// stand as one-entry dictionaries {message identifier: payload}, orientation
 /// changes as two-entry ones.
 ///
-/// Entries are kept encoded, one after the other in large chunks, so that a
-/// message costs its own bytes and its identifier's and no allocation.
+/// Entries are handed to the storage encoded, so that a message costs its own bytes
+/// and its identifier's and no allocation. An entry that the storage refuses is not
+/// in the list; the storage says so.
 class OstrelReportingAggregatedPayloads {
  public:
   using EntryCallback = std::function<void(ValueView entry)>;
 
   /// The entries as they were when it was taken; what is appended later does
-  /// not show. Shares the list's memory. May be read on another thread.
+  /// not show. Shares what the list keeps. May be read on another thread.
   class Snapshot {
    public:
-    /// Calls `callback` once for each entry, in order.
-    void forEach(const EntryCallback& callback) const;
+    /// Calls `callback` once for each entry, in order. An entry is valid during the
+    /// call. False: the storage could not read all, and the walk ended there.
+    bool forEach(const EntryCallback& callback) const;
 
    private:
     friend class OstrelReportingAggregatedPayloads;
-    struct Part {
-      std::shared_ptr<const std::uint8_t[]> bytes;
-      std::size_t size;
-    };
     std::vector<Dictionary> front_;
-    std::vector<Part> parts_;
+    std::shared_ptr<const StoredEntries::Snapshot> stored_;
+    struct Reference {
+      std::size_t storedBefore;  // So many stored entries come before it.
+      std::string identifier;
+      Dictionary payload;
+    };
+    std::vector<Reference> references_;
   };
 
-  /// Appends {`identifier`: `payload`}.
+  /// `storage` outlives the list. `session` is the one that it belongs to.
+  OstrelReportingAggregatedPayloads(EntryStorage& storage, ReporterID session)
+      : storage_(storage), session_(session) {}
+
+  /// Appends {`identifier`: `payload`}. A large payload that is nobody's, as a
+  /// summary is, is kept by reference.
   void append(std::string_view identifier, const Dictionary& payload);
   void append(const Dictionary& entry);
 
@@ -49,23 +60,19 @@ class OstrelReportingAggregatedPayloads {
   /// shows in snapshots that are taken later.
   void insertFront(std::shared_ptr<const MutableDictionary> entry);
 
-  bool empty() const { return size_ == 0; }
-  std::size_t size() const { return size_; }
+  bool empty() const { return size() == 0; }
+  std::size_t size() const { return front_.size() + storedCount_ + references_.size(); }
   Snapshot snapshot() const;
 
  private:
-  struct Chunk {
-    std::shared_ptr<std::uint8_t[]> bytes;
-    std::size_t capacity;
-    std::size_t used = 0;
-  };
+  void store(std::span<const StoredEntries::Bytes> parts, const Dictionary& bearer);
 
-  std::uint8_t* room(std::size_t bytes);
-
-  std::size_t size_ = 0;
+  EntryStorage& storage_;
+  const ReporterID session_;
   std::vector<std::shared_ptr<const MutableDictionary>> front_;  // Latest last.
-  std::vector<Chunk> chunks_;
-  std::string head_;  // Of the last message's entry; keeps its memory for the next.
+  std::unique_ptr<StoredEntries> stored_;                        // None until the first.
+  std::size_t storedCount_ = 0;
+  std::vector<Snapshot::Reference> references_;
 };
 
 /// The list with its own monitor.

@@ -18,16 +18,21 @@ std::vector<std::string> entriesOf(
   return entries;
 }
 
-TEST(OstrelReportingAggregatedPayloads, BeginsEmpty) {
-  const OstrelReportingAggregatedPayloads list;
+class OstrelReportingAggregatedPayloadsTest : public CoreTest {
+ protected:
+  EntryStorage& storage_ = *fakes.entryStorage;
+};
+
+TEST_F(OstrelReportingAggregatedPayloadsTest, BeginsEmpty) {
+  const OstrelReportingAggregatedPayloads list(storage_, ReporterID{42});
 
   EXPECT_TRUE(list.empty());
   EXPECT_EQ(list.size(), 0u);
   EXPECT_EQ(entriesOf(list.snapshot()), std::vector<std::string>{});
 }
 
-TEST(OstrelReportingAggregatedPayloads, HoldsEntriesInOrder) {
-  OstrelReportingAggregatedPayloads list;
+TEST_F(OstrelReportingAggregatedPayloadsTest, HoldsEntriesInOrder) {
+  OstrelReportingAggregatedPayloads list(storage_, ReporterID{42});
 
   list.append("first", {{"a", 1}});
   list.append({{"b", 2}, {"c", 3}});
@@ -38,8 +43,8 @@ TEST(OstrelReportingAggregatedPayloads, HoldsEntriesInOrder) {
             (std::vector<std::string>{"{first: {a: 1}}", "{b: 2, c: 3}", "{: {}}"}));
 }
 
-TEST(OstrelReportingAggregatedPayloads, OutlivesWhatWasAppended) {
-  OstrelReportingAggregatedPayloads list;
+TEST_F(OstrelReportingAggregatedPayloadsTest, OutlivesWhatWasAppended) {
+  OstrelReportingAggregatedPayloads list(storage_, ReporterID{42});
   {
     const Dictionary payload{{"a", std::string(100, 'x')}};
     list.append(std::string("first"), payload);
@@ -49,8 +54,8 @@ TEST(OstrelReportingAggregatedPayloads, OutlivesWhatWasAppended) {
             std::vector<std::string>{"{first: {a: " + std::string(100, 'x') + "}}"});
 }
 
-TEST(OstrelReportingAggregatedPayloads, HoldsEntriesOfEverySize) {
-  OstrelReportingAggregatedPayloads list;
+TEST_F(OstrelReportingAggregatedPayloadsTest, HoldsEntriesOfEverySize) {
+  OstrelReportingAggregatedPayloads list(storage_, ReporterID{42});
   std::vector<std::string> expected;
   for (const std::size_t size :
        {0u, 1u, 1000u, 1023u, 1024u, 1025u, 262143u, 262144u, 262145u, 600000u, 3u}) {
@@ -62,8 +67,8 @@ TEST(OstrelReportingAggregatedPayloads, HoldsEntriesOfEverySize) {
   EXPECT_EQ(entriesOf(list.snapshot()), expected);
 }
 
-TEST(OstrelReportingAggregatedPayloads, SnapshotDoesNotShowWhatComesLater) {
-  OstrelReportingAggregatedPayloads list;
+TEST_F(OstrelReportingAggregatedPayloadsTest, SnapshotDoesNotShowWhatComesLater) {
+  OstrelReportingAggregatedPayloads list(storage_, ReporterID{42});
   list.append("a", Dictionary());
 
   const auto snapshot = list.snapshot();
@@ -73,8 +78,9 @@ TEST(OstrelReportingAggregatedPayloads, SnapshotDoesNotShowWhatComesLater) {
   EXPECT_EQ(entriesOf(snapshot), std::vector<std::string>{"{a: {}}"});
 }
 
-TEST(OstrelReportingAggregatedPayloads, SnapshotOutlivesTheList) {
-  auto list = std::make_unique<OstrelReportingAggregatedPayloads>();
+TEST_F(OstrelReportingAggregatedPayloadsTest, SnapshotOutlivesTheList) {
+  auto list =
+      std::make_unique<OstrelReportingAggregatedPayloads>(storage_, ReporterID{42});
   list->append("a", {{"x", 1}});
   const auto snapshot = list->snapshot();
 
@@ -83,8 +89,8 @@ TEST(OstrelReportingAggregatedPayloads, SnapshotOutlivesTheList) {
   EXPECT_EQ(entriesOf(snapshot), std::vector<std::string>{"{a: {x: 1}}"});
 }
 
-TEST(OstrelReportingAggregatedPayloads, SnapshotIsReadWhileEntriesAreAppended) {
-  OstrelReportingAggregatedPayloads list;
+TEST_F(OstrelReportingAggregatedPayloadsTest, SnapshotIsReadWhileEntriesAreAppended) {
+  OstrelReportingAggregatedPayloads list(storage_, ReporterID{42});
   for (int i = 0; i < 100; ++i) list.append("a", {{"i", i}});
   const auto snapshot = list.snapshot();
 
@@ -98,8 +104,8 @@ TEST(OstrelReportingAggregatedPayloads, SnapshotIsReadWhileEntriesAreAppended) {
   EXPECT_EQ(seen, 5000u);
 }
 
-TEST(OstrelReportingAggregatedPayloads, PutsWhatIsInsertedLastFirst) {
-  OstrelReportingAggregatedPayloads list;
+TEST_F(OstrelReportingAggregatedPayloadsTest, PutsWhatIsInsertedLastFirst) {
+  OstrelReportingAggregatedPayloads list(storage_, ReporterID{42});
   list.append("a", Dictionary());
   const auto first = std::make_shared<MutableDictionary>();
   first->merge({{"first", 1}});
@@ -114,8 +120,8 @@ TEST(OstrelReportingAggregatedPayloads, PutsWhatIsInsertedLastFirst) {
             (std::vector<std::string>{"{second: 2}", "{first: 1}", "{a: {}}"}));
 }
 
-TEST(OstrelReportingAggregatedPayloads, ShowsWhatIsMergedLaterInLaterSnapshots) {
-  OstrelReportingAggregatedPayloads list;
+TEST_F(OstrelReportingAggregatedPayloadsTest, ShowsWhatIsMergedLaterInLaterSnapshots) {
+  OstrelReportingAggregatedPayloads list(storage_, ReporterID{42});
   const auto userInfo = std::make_shared<MutableDictionary>();
   list.insertFront(userInfo);
   const auto before = list.snapshot();

@@ -107,7 +107,8 @@ OstrelReportingSession::OstrelReportingSession(Passkey, ReporterID reporterID,
           /*relativePriority=*/0)),
       userInfo_(std::make_shared<MutableDictionary>()),
       serviceName_("unknown"),
-      aggregatedPayloadData_(std::make_shared<AggregatedPayloadData>()) {}
+      aggregatedPayloadData_(
+          std::make_shared<AggregatedPayloadData>(*platform.entryStorage, reporterID)) {}
 
 OstrelReportingSession::~OstrelReportingSession() {
   platform_.kernelTrace->trace(TraceCode::kSessionTeardown);
@@ -182,7 +183,8 @@ void OstrelReportingSession::startStep() {
   }
   orientationCallbackID_.set(format("OstrelReportingService %lli", reporterID_));
   startDate_.set(platform_.clock->now());
-  aggregatedPayloadData_.set(std::make_shared<AggregatedPayloadData>());
+  aggregatedPayloadData_.set(
+      std::make_shared<AggregatedPayloadData>(*platform_.entryStorage, reporterID_));
   platform_.kernelTrace->trace(TraceCode::kSessionStart);
   if (serviceType() == kServiceTypeTest) {
     setStarted(/*started=*/true);

@@ -2,7 +2,6 @@
 
 #include <algorithm>
 #include <cstdint>
-#include <deque>
 #include <functional>
 #include <string>
 #include <string_view>
@@ -19,92 +18,131 @@ bool holdsBlank(ValueView key) {
   return text && text->find(' ') != std::string_view::npos;
 }
 
-// The values of the entries under their keys. A session of a million messages has
-// about as many keys, so that what is kept for each is small: 50 bytes, and no
-// allocation of its own.
-class Grouping {
+// The summary of entries that need not be in memory: they are walked twice. The first
+// walk finds the groups and how long the text of each will be, the second writes the
+// values to their places. A session of a million messages has about as many groups, so
+// that what is kept for each is small: 100 bytes, the key included.
+class Summary {
  public:
-  Grouping(const Value& firstKey, const Value& firstValue,
-           const OstrelReportingAggregatedPayloads::Snapshot& entries) {
-    add(firstKey, firstValue);
-    entries.forEach([this](ValueView entry) {
-      for (const auto& [key, value] : entry.entries()) add(key, value);
-    });
+  /// A value of the first walk.
+  void measure(ValueView key, ValueView value) {
+    const std::size_t number = groupOf(key);
+    groupOfValue_.push_back(number);
+    Group& group = groups_[number];
+    group.textBytes += textOf(value, group).size();
+    group.hasText = true;
   }
 
-  std::size_t groupCount() const { return groups_.size(); }
-
-  /// Calls `use` with each group's key and joined text, encoded.
-  template <typename Use>
-  void forEachGroup(Use use) const {
-    std::string text;
-    std::string encoded;
-    for (const Group& group : groups_) {
-      text.clear();
-      for (std::size_t at = group.first; at != kNone; at = values_[at].next) {
-        if (at != group.first) text += ',';
-        appendDescription(text, values_[at].value);
-      }
-      encoded.clear();
-      ValueEncoder encoder(encoded);
-      encoder.item(group.key);
-      encoder.string(text);
-      use(encoded);
+  /// Between the walks.
+  void layOut() {
+    std::string head;
+    ValueEncoder encoder(head);
+    encoder.beginDictionary(groups_.size());
+    std::size_t size = head.size();
+    for (Group& group : groups_) {
+      textHead(group);
+      size += keyOf(group).size() + head_.size() + group.textBytes;
     }
+    event_ = ValueBuffer::make(size);
+    std::uint8_t* at = std::copy(head.begin(), head.end(), event_.data());
+    for (Group& group : groups_) {
+      const std::string_view key = keyOf(group);
+      at = std::copy(key.begin(), key.end(), at);
+      textHead(group);
+      at = std::copy(head_.begin(), head_.end(), at);
+      group.text = at;
+      group.hasText = false;
+      at += group.textBytes;
+    }
+  }
+
+  /// The same value of the second walk.
+  void write(ValueView value) {
+    if (writtenValues_ == groupOfValue_.size()) return;
+    Group& group = groups_[groupOfValue_[writtenValues_++]];
+    const std::string_view text =
+        std::string_view(textOf(value, group)).substr(0, group.textBytes);
+    group.text = std::copy(text.begin(), text.end(), group.text);
+    group.textBytes -= text.size();
+    group.hasText = true;
+  }
+
+  /// Blank is what the second walk did not come to, for want of a readable list.
+  Dictionary finish() {
+    if (writtenValues_ != groupOfValue_.size()) {
+      for (const Group& group : groups_) std::fill_n(group.text, group.textBytes, ' ');
+    }
+    return Dictionary(event_, std::as_const(event_).data());
   }
 
  private:
   static constexpr std::size_t kNone = SIZE_MAX;
   static constexpr std::size_t kFewestSlots = 64;  // A power of two, as all counts.
-  struct Link {
-    ValueView value;
-    std::size_t next;
-  };
   struct Group {
-    ValueView key;
-    std::size_t first;
-    std::size_t last;
+    std::size_t key;            // In `keys_`.
+    std::size_t textBytes = 0;  // In the second walk: those to come.
+    std::uint8_t* text = nullptr;
+    bool hasText = false;  // Of this walk.
   };
+
+  std::string_view keyOf(const Group& group) const {
+    const char* const key = keys_.data() + group.key;
+    return nameOf(ValueView(reinterpret_cast<const std::uint8_t*>(key)));
+  }
 
   static std::string_view nameOf(ValueView key) {
     const auto bytes = key.bytes();
     return {reinterpret_cast<const char*>(bytes.data()), bytes.size()};
   }
 
-  void add(ValueView key, ValueView value) {
-    const std::size_t link = values_.size();
-    values_.push_back({value, kNone});
+  // What `value` adds to its group's text.
+  const std::string& textOf(ValueView value, const Group& group) {
+    text_.clear();
+    if (group.hasText) text_ += ',';
+    appendDescription(text_, value);
+    return text_;
+  }
+
+  // Into `head_`.
+  void textHead(const Group& group) {
+    head_.clear();
+    ValueEncoder(head_).beginString(group.textBytes);
+  }
+
+  std::size_t groupOf(ValueView key) {
     if (2 * groups_.size() >= slots_.size()) growSlots();
-    std::size_t& slot = findSlot(key);
+    const std::string_view name = nameOf(key);
+    std::size_t& slot = slotOf(name);
     if (slot == kNone) {
       slot = groups_.size();
-      groups_.push_back({key, link, link});
-      return;
+      groups_.push_back({keys_.size()});
+      keys_ += name;
     }
-    Group& group = groups_[slot];
-    values_[group.last].next = link;
-    group.last = link;
+    return slot;
   }
 
   // The slot of the key's group, or the free one where it belongs.
-  std::size_t& findSlot(ValueView key) {
-    const std::string_view name = nameOf(key);
+  std::size_t& slotOf(std::string_view name) {
     std::size_t at = std::hash<std::string_view>()(name);
     while (true) {
       std::size_t& slot = slots_[at++ & (slots_.size() - 1)];
-      if (slot == kNone || nameOf(groups_[slot].key) == name) return slot;
+      if (slot == kNone || keyOf(groups_[slot]) == name) return slot;
     }
   }
 
   void growSlots() {
     slots_.assign(std::max(kFewestSlots, 2 * slots_.size()), kNone);
-    for (std::size_t i = 0; i < groups_.size(); ++i) findSlot(groups_[i].key) = i;
+    for (std::size_t i = 0; i < groups_.size(); ++i) slotOf(keyOf(groups_[i])) = i;
   }
 
-  // A value's place in a group's list; the lists do not move as they grow.
-  std::deque<Link> values_;
-  std::deque<Group> groups_;
+  std::vector<Group> groups_;  // In the order of their first values.
+  std::vector<std::size_t> groupOfValue_;
+  std::size_t writtenValues_ = 0;
+  std::string keys_;                // Encoded, one after the other.
   std::vector<std::size_t> slots_;  // Of `groups_`, by the hash of the key.
+  ValueBuffer event_;
+  std::string text_;
+  std::string head_;
 };
 
 }  // namespace
@@ -131,18 +169,17 @@ Dictionary summaryEvent(ServiceType serviceType,
                         const OstrelReportingAggregatedPayloads::Snapshot& entries) {
   const Value key("Ostrel_Session_Summary_Event");
   const Value type(static_cast<std::uint16_t>(serviceType));
-  const Grouping grouping(key, type, entries);
-  std::string head;
-  ValueEncoder(head).beginDictionary(grouping.groupCount());
-  // The texts are made twice: a summary may be as large as all that it sums up, and
-  // a buffer that grew with it would take as much again.
-  std::size_t size = head.size();
-  grouping.forEachGroup([&](const std::string& group) { size += group.size(); });
-  ValueBuffer event = ValueBuffer::make(size);
-  std::uint8_t* at = std::copy(head.begin(), head.end(), event.data());
-  grouping.forEachGroup(
-      [&](const std::string& group) { at = std::copy(group.begin(), group.end(), at); });
-  return Dictionary(event, std::as_const(event).data());
+  Summary summary;
+  summary.measure(key, type);
+  entries.forEach([&](ValueView entry) {
+    for (const auto& [name, value] : entry.entries()) summary.measure(name, value);
+  });
+  summary.layOut();
+  summary.write(type);
+  entries.forEach([&](ValueView entry) {
+    for (const auto& [name, value] : entry.entries()) summary.write(value);
+  });
+  return summary.finish();
 }
 
 std::string sessionLogFileName(const Clock& clock, Date date,

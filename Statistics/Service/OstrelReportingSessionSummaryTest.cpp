@@ -73,7 +73,7 @@ TEST_F(OstrelReportingSessionSummary, NamesTheServiceTypeByItsNumber) {
 }
 
 TEST_F(OstrelReportingSessionSummary, JoinsThePayloadsOfOneIdentifier) {
-  OstrelReportingAggregatedPayloads list;
+  OstrelReportingAggregatedPayloads list(*fakes.entryStorage, ReporterID{42});
   list.append("Generic_Generic_1", {{"a", 1}});
   list.append("Other_1", {{"b", "x"}});
   list.append("Generic_Generic_1", {{"a", 2}});
@@ -86,7 +86,7 @@ TEST_F(OstrelReportingSessionSummary, JoinsThePayloadsOfOneIdentifier) {
 }
 
 TEST_F(OstrelReportingSessionSummary, GroupsEachKeyOfAnEntryOfSeveral) {
-  OstrelReportingAggregatedPayloads list;
+  OstrelReportingAggregatedPayloads list(*fakes.entryStorage, ReporterID{42});
   list.append({{"device_orientation", "normal"}, {"device_orientation_time", 1.5}});
   list.append({{"device_orientation", "left-up"}, {"device_orientation_time", 2.25}});
 
@@ -97,7 +97,7 @@ TEST_F(OstrelReportingSessionSummary, GroupsEachKeyOfAnEntryOfSeveral) {
 }
 
 TEST_F(OstrelReportingSessionSummary, JoinsUnderItsOwnKeyToo) {
-  OstrelReportingAggregatedPayloads list;
+  OstrelReportingAggregatedPayloads list(*fakes.entryStorage, ReporterID{42});
   list.append("Ostrel_Session_Summary_Event", {{"a", 1}});
 
   EXPECT_EQ(summaryEvent(ServiceType{3}, list.snapshot()),

@@ -24,6 +24,7 @@ OstrelReportingPlatform FakePlatform::platform() const {
           .clock = clock,
           .random = random,
           .fileSystem = fileSystem,
+          .entryStorage = entryStorage,
           .json = json,
           .notifications = notifications,
           .userDefaults = userDefaults,

@@ -8,6 +8,7 @@
 #include "platform/fake/FakeChangeNotification.h"
 #include "platform/fake/FakeChannelReportingService.h"
 #include "platform/fake/FakeDeviceInfo.h"
+#include "platform/fake/FakeEntryStorage.h"
 #include "platform/fake/FakeFileSystem.h"
 #include "platform/fake/FakeIPCListener.h"
 #include "platform/fake/FakeJSONSerialization.h"
@@ -57,6 +58,8 @@ class FakePlatform {
   const std::shared_ptr<FakeRandom> random = std::make_shared<FakeRandom>();
   const std::shared_ptr<FakeFileSystem> fileSystem =
       std::make_shared<FakeFileSystem>(events);
+  const std::shared_ptr<FakeEntryStorage> entryStorage =
+      std::make_shared<FakeEntryStorage>();
   const std::shared_ptr<FakeJSONSerialization> json =
       std::make_shared<FakeJSONSerialization>(events);
   const std::shared_ptr<FakeChangeNotification> notifications =

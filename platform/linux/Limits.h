@@ -76,4 +76,16 @@ inline constexpr std::chrono::milliseconds kAcceptBackOff{100};
 /// How often one kind of misuse by one user is logged.
 inline constexpr std::chrono::seconds kMisuseLogInterval{60};
 
+/// Memory of what one session collects until its stop; what is more lies in a file.
+/// A thousand messages of usual size, which few sessions reach.
+inline constexpr std::size_t kListBytesInMemory = 256 * 1024;
+
+/// The same of all sessions together: a hundred long ones at a time, and a small part of
+/// what the service may have. Each session begins with 1 KiB whatever the others have.
+inline constexpr std::size_t kListsBytesInMemory = 24 * 1024 * 1024;
+
+/// How long that file is left alone once it could not be written: a disk that is full
+/// is not asked with each message.
+inline constexpr std::chrono::milliseconds kPauseOfListsFile{1000};
+
 }  // namespace ostrel::limits

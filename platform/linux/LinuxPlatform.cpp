@@ -6,6 +6,7 @@
 #include "platform/Logging.h"
 #include "platform/linux/DirectoryFileSystem.h"
 #include "platform/linux/EtcDeviceInfo.h"
+#include "platform/linux/FileEntryStorage.h"
 #include "platform/linux/InotifyChangeNotification.h"
 #include "platform/linux/JSONTextSerialization.h"
 #include "platform/linux/JSONUserDefaults.h"
@@ -50,6 +51,8 @@ struct LinuxPlatform::Bindings {
   std::shared_ptr<TimerThread> timers = std::make_shared<TimerThread>();
   std::shared_ptr<ThreadPoolWorkQueues> queues =
       std::make_shared<ThreadPoolWorkQueues>(timers);
+  std::shared_ptr<FileEntryStorage> entries =
+      std::make_shared<FileEntryStorage>(stateDirectory());
   std::shared_ptr<Store> store = Store::open(storePath());
 };
 
@@ -73,6 +76,7 @@ LinuxPlatform::LinuxPlatform(std::unique_ptr<Bindings> bindings)
   platform_.clock = std::make_shared<SystemClock>();
   platform_.random = std::make_shared<SystemRandom>();
   platform_.fileSystem = std::make_shared<DirectoryFileSystem>(diagnosticLogRoot());
+  platform_.entryStorage = bindings_->entries;
   platform_.json = std::make_shared<JSONTextSerialization>();
   platform_.notifications = std::make_shared<InotifyChangeNotification>(
       InotifyChangeNotification::systemDirectory());

@@ -1,0 +1,313 @@
+// A list's entries are copied into chunks of memory, each twice the one before, until
+// they have taken the list's share. Then they are written to the file together, as
+// one extent, and of the chunks only the last stays, to be filled and written again
+// and again. So the file has a list's entries in large pieces, of which a reader has
+// one in memory at a time, and what is in the chunks always comes after what is in
+// the file. An entry lies in one chunk, or in one extent of its own, and is never
+// split.
+//
+// A snapshot copies the places, not the entries. Chunks are never written before
+// their `used`, and not used again once a snapshot has seen them; extents are
+// released with the last of the list and its snapshots.
+#include "platform/linux/FileEntryStorage.h"
+
+#include <algorithm>
+#include <atomic>
+#include <utility>
+#include <vector>
+
+#include "platform/KeptBytes.h"
+#include "platform/Logging.h"
+#include "platform/linux/Limits.h"
+
+namespace ostrel {
+namespace {
+
+// A list without entries has no chunk, a short one a small chunk, and a long one
+// wastes little at the end of its last.
+constexpr std::size_t kFirstChunk = 1024;
+constexpr std::size_t kLargestChunk = 128 * 1024;
+
+// What readers have in memory, but for an entry that is larger alone.
+constexpr std::size_t kLargestExtent = 2 * kLargestChunk;
+
+using Bytes = StoredEntries::Bytes;
+
+}  // namespace
+
+// Outlives the storage as long as a list or a snapshot is left.
+struct FileEntryStorage::State {
+  State(std::string directory, const Limits& given, const SpillCalls& calls)
+      : limits(given), file(std::move(directory), given.pauseOfFile, calls) {}
+
+  bool takeMemory(std::size_t bytes) {
+    std::size_t used = bytesInMemory.load(std::memory_order_relaxed);
+    do {
+      if (bytes > limits.bytesInMemory || used > limits.bytesInMemory - bytes) {
+        return false;
+      }
+    } while (!bytesInMemory.compare_exchange_weak(used, used + bytes));
+    return true;
+  }
+
+  const Limits limits;
+  SpillFile file;
+  std::atomic<std::size_t> bytesInMemory{0};
+  std::atomic<std::uint64_t> refused{0};
+};
+
+/// Memory that is counted while it lives. Whoever makes it has counted it.
+class FileEntryStorage::Memory {
+ public:
+  Memory(std::shared_ptr<State> state, std::size_t size)
+      : state_(std::move(state)), size_(size), bytes_(new std::uint8_t[size]) {}
+  Memory(const Memory&) = delete;
+  Memory& operator=(const Memory&) = delete;
+  ~Memory() { state_->bytesInMemory -= size_; }
+
+  std::size_t size() const { return size_; }
+  std::uint8_t* data() { return bytes_.get(); }
+
+ private:
+  const std::shared_ptr<State> state_;
+  const std::size_t size_;
+  const std::unique_ptr<std::uint8_t[]> bytes_;
+};
+
+/// A list's part of the file.
+class FileEntryStorage::Spilled {
+ public:
+  explicit Spilled(std::shared_ptr<State> state) : state_(std::move(state)) {}
+  Spilled(const Spilled&) = delete;
+  Spilled& operator=(const Spilled&) = delete;
+  ~Spilled() { state_->file.release(extents_); }
+
+  // The list's.
+  bool write(std::span<const Bytes> parts) {
+    const auto extent = state_->file.write(parts);
+    if (!extent) return false;
+    extents_.push_back(*extent);
+    return true;
+  }
+  const std::vector<SpillFile::Extent>& extents() const { return extents_; }
+
+ private:
+  const std::shared_ptr<State> state_;
+  std::vector<SpillFile::Extent> extents_;
+};
+
+class FileEntryStorage::EntriesSnapshot final : public StoredEntries::Snapshot {
+ public:
+  struct Part {
+    std::shared_ptr<Memory> memory;
+    std::size_t size;
+  };
+
+  EntriesSnapshot(ReporterID session, std::shared_ptr<State> state,
+                  std::shared_ptr<const Spilled> spilled, std::vector<Part> parts)
+      : session_(session),
+        state_(std::move(state)),
+        spilled_(std::move(spilled)),
+        extents_(spilled_ ? spilled_->extents() : std::vector<SpillFile::Extent>()),
+        parts_(std::move(parts)) {}
+
+  bool forEachRun(const StoredEntries::RunCallback& callback) const override {
+    std::size_t room = 0;
+    for (const SpillFile::Extent& extent : extents_) room = std::max(room, extent.size);
+    const std::unique_ptr<std::uint8_t[]> buffer(new std::uint8_t[room]);
+    for (const SpillFile::Extent& extent : extents_) {
+      if (const auto error = state_->file.read(extent, buffer.get())) {
+        OSTREL_LOG_ERROR(processLogScope, "%lli: cannot read the session's list back: %@",
+                         session_, *error);
+        return false;
+      }
+      callback({buffer.get(), extent.size});
+    }
+    for (const Part& part : parts_) callback({part.memory->data(), part.size});
+    return true;
+  }
+
+ private:
+  const ReporterID session_;
+  const std::shared_ptr<State> state_;
+  const std::shared_ptr<const Spilled> spilled_;  // Keeps the extents.
+  const std::vector<SpillFile::Extent> extents_;
+  const std::vector<Part> parts_;
+};
+
+class FileEntryStorage::Entries final : public StoredEntries {
+ public:
+  Entries(ReporterID session, std::shared_ptr<State> state)
+      : session_(session), state_(std::move(state)) {}
+
+  bool append(std::span<const Bytes> parts,
+              const std::shared_ptr<PayloadAccount>& account) override {
+    std::size_t size = 0;
+    for (const Bytes part : parts) size += part.size();
+    if (!kept_.keep(account, size)) {
+      return refuse("its client's user has no room left for more");
+    }
+    if (place(parts, size)) return true;
+    kept_.undo(account, size);
+    const auto error = state_->file.latestError();
+    return refuse(error ? error->description : "no memory is left for lists");
+  }
+
+  std::shared_ptr<const Snapshot> snapshot() override {
+    std::vector<EntriesSnapshot::Part> parts;
+    for (Chunk& chunk : chunks_) {
+      chunk.isShared = true;
+      parts.push_back({chunk.memory, chunk.used});
+    }
+    return std::make_shared<const EntriesSnapshot>(session_, state_, spilled_,
+                                                   std::move(parts));
+  }
+
+ private:
+  struct Chunk {
+    std::shared_ptr<Memory> memory;
+    std::size_t used = 0;
+    bool isShared = false;  // With a snapshot.
+  };
+  enum class Share { kOfList, kOfAll };
+
+  bool place(std::span<const Bytes> parts, std::size_t size) {
+    if (!hasRoom(size) && !makeRoom(size)) {
+      if (isMemoryEmpty() && writeToFile(parts)) return true;
+      if (!addChunk(size, Share::kOfAll)) return false;
+    }
+    Chunk& chunk = chunks_.back();
+    std::uint8_t* at = chunk.memory->data() + chunk.used;
+    for (const Bytes part : parts) at = std::copy(part.begin(), part.end(), at);
+    chunk.used += size;
+    return true;
+  }
+
+  bool makeRoom(std::size_t bytes) {
+    if (addChunk(bytes, Share::kOfList)) return true;
+    if (!spill()) return false;
+    if (chunks_.empty() && bytes <= kLargestChunk) beginChunk();
+    return hasRoom(bytes);
+  }
+
+  bool isMemoryEmpty() const {
+    return std::all_of(chunks_.begin(), chunks_.end(),
+                       [](const Chunk& chunk) { return chunk.used == 0; });
+  }
+
+  bool hasRoom(std::size_t bytes) const {
+    return !chunks_.empty() &&
+           chunks_.back().memory->size() - chunks_.back().used >= bytes;
+  }
+
+  // A chunk with room for `bytes`, within the list's share of the memory or only
+  // within that of all.
+  bool addChunk(std::size_t bytes, Share share) {
+    if (share == Share::kOfAll) {
+      return takeChunk(std::max(bytes, kLargestChunk)) || takeChunk(bytes);
+    }
+    if (spilled_) return false;
+    std::size_t taken = 0;
+    for (const Chunk& chunk : chunks_) taken += chunk.memory->size();
+    const std::size_t wanted =
+        chunks_.empty() ? kFirstChunk
+                        : std::min(2 * chunks_.back().memory->size(), kLargestChunk);
+    const std::size_t size = std::max(wanted, bytes);
+    return taken + size <= state_->limits.listBytesInMemory && takeChunk(size);
+  }
+
+  bool takeChunk(std::size_t size) {
+    const bool isFirst = chunks_.empty() && size <= kFirstChunk;
+    if (isFirst) {
+      state_->bytesInMemory += size;
+    } else if (!state_->takeMemory(size)) {
+      return false;
+    }
+    chunks_.push_back({std::make_shared<Memory>(state_, size)});
+    return true;
+  }
+
+  // Moves everything from memory to the file. False: that cannot be written, and
+  // what was left is in memory.
+  bool spill() {
+    while (!isMemoryEmpty()) {
+      std::vector<Bytes> parts;
+      std::size_t size = 0;
+      for (const Chunk& chunk : chunks_) {
+        if (!parts.empty() && size + chunk.used > kLargestExtent) break;
+        parts.emplace_back(chunk.memory->data(), chunk.used);
+        size += chunk.used;
+      }
+      if (!writeToFile(parts)) return false;
+      Chunk last = std::move(chunks_[parts.size() - 1]);
+      chunks_.erase(chunks_.begin(),
+                    chunks_.begin() + static_cast<std::ptrdiff_t>(parts.size()));
+      if (chunks_.empty()) renewChunk(std::move(last));
+    }
+    return true;
+  }
+
+  bool writeToFile(std::span<const Bytes> parts) {
+    if (spilled_) return spilled_->write(parts);
+    auto spilled = std::make_shared<Spilled>(state_);
+    if (!spilled->write(parts)) return false;
+    spilled_ = std::move(spilled);
+    return true;
+  }
+
+  // Goes on with the memory of the chunk that was written, or with more if there is.
+  void renewChunk(Chunk written) {
+    const std::size_t size = written.memory->size();
+    if (written.isShared || size > kLargestChunk) {
+      beginChunk();
+    } else if (size == kLargestChunk || !takeChunk(std::min(2 * size, kLargestChunk))) {
+      written.used = 0;
+      chunks_.push_back(std::move(written));
+    }
+  }
+
+  void beginChunk() {
+    if (!takeChunk(kLargestChunk)) takeChunk(kFirstChunk);
+  }
+
+  bool refuse(std::string_view reason) {
+    ++state_->refused;
+    if (!std::exchange(hasRefused_, true)) {
+      OSTREL_LOG_ERROR(processLogScope,
+                       "%lli: the session's list goes without some messages: %@",
+                       session_, reason);
+    }
+    return false;
+  }
+
+  const ReporterID session_;
+  const std::shared_ptr<State> state_;
+  KeptBytes kept_;
+  std::vector<Chunk> chunks_;  // What comes after the file.
+  std::shared_ptr<Spilled> spilled_;
+  bool hasRefused_ = false;
+};
+
+FileEntryStorage::Limits FileEntryStorage::Limits::ofService() {
+  return {limits::kListBytesInMemory, limits::kListsBytesInMemory,
+          limits::kPauseOfListsFile};
+}
+
+FileEntryStorage::FileEntryStorage(std::string directory)
+    : FileEntryStorage(std::move(directory), Limits::ofService(), SpillCalls::system()) {}
+
+FileEntryStorage::FileEntryStorage(std::string directory, const Limits& limits,
+                                   const SpillCalls& calls)
+    : state_(std::make_shared<State>(std::move(directory), limits, calls)) {}
+
+std::unique_ptr<StoredEntries> FileEntryStorage::makeEntries(ReporterID session) {
+  return std::make_unique<Entries>(session, state_);
+}
+
+std::uint64_t FileEntryStorage::refusedEntries() const { return state_->refused; }
+
+std::size_t FileEntryStorage::bytesInMemory() const { return state_->bytesInMemory; }
+
+bool FileEntryStorage::hasFile() const { return state_->file.isOpen(); }
+
+}  // namespace ostrel

@@ -1,0 +1,53 @@
+#pragma once
+
+#include <chrono>
+#include <cstddef>
+#include <cstdint>
+#include <memory>
+#include <string>
+
+#include "platform/EntryStorage.h"
+#include "platform/linux/SpillFile.h"
+
+namespace ostrel {
+
+/// Lists begin in memory. What is too much for it goes to a file without a name in
+/// `directory`, one for all lists, and comes back from there piece by piece. When the
+/// file cannot be written, entries stay in memory as far as that of all lists goes.
+class FileEntryStorage final : public EntryStorage {
+ public:
+  struct Limits {
+    std::size_t listBytesInMemory;
+    /// Of all lists together; what each list begins with is always there.
+    std::size_t bytesInMemory;
+    /// How long the file is left alone after an error.
+    std::chrono::milliseconds pauseOfFile;
+
+    /// Those of `platform/linux/Limits.h`.
+    static Limits ofService();
+  };
+
+  explicit FileEntryStorage(std::string directory);
+  FileEntryStorage(std::string directory, const Limits& limits, const SpillCalls& calls);
+
+  std::unique_ptr<StoredEntries> makeEntries(ReporterID session) override;
+
+  // Any thread.
+  /// Entries that were not taken, since the service began.
+  std::uint64_t refusedEntries() const;
+  /// What the lists take in memory now.
+  std::size_t bytesInMemory() const;
+  /// Whether there is a file now.
+  bool hasFile() const;
+
+ private:
+  struct State;
+  class Memory;
+  class Spilled;
+  class Entries;
+  class EntriesSnapshot;
+
+  const std::shared_ptr<State> state_;
+};
+
+}  // namespace ostrel
