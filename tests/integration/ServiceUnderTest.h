@@ -70,13 +70,13 @@ class ServiceUnderTest {
             "JOURNAL_STREAM"};
   }
 
-  void start() { start("ostrelreportingd", {}); }
-  /// Another program in its place, with `variables` besides.
-  void start(const std::string& program, const std::vector<std::string>& variables) {
+  void start() { start({programBeside("ostrelreportingd")}, {}); }
+  /// By this command, with `variables` besides.
+  void start(std::vector<std::string> command,
+             const std::vector<std::string>& variables) {
     std::vector<std::string> all = environment();
     all.insert(all.end(), variables.begin(), variables.end());
-    process_ = std::make_unique<ChildProcess>(
-        std::vector<std::string>{programBeside(program)}, *this / "log.txt", all);
+    process_ = std::make_unique<ChildProcess>(std::move(command), *this / "log.txt", all);
   }
   ChildProcess& process() { return *process_; }
   void kill() { process_.reset(); }

@@ -78,23 +78,6 @@ StoreDatabase::Result makeDirectories(const std::string& path) {
   }
 }
 
-// The version that stands in the file itself; 0 when it is too short to have one.
-std::uint32_t versionInHeader(int file) {
-  constexpr off_t kVersionOffset = 60;
-  std::uint8_t bytes[4];
-  if (::pread(file, bytes, sizeof bytes, kVersionOffset) != sizeof bytes) return 0;
-  return static_cast<std::uint32_t>(bytes[0]) << 24 |
-         static_cast<std::uint32_t>(bytes[1]) << 16 |
-         static_cast<std::uint32_t>(bytes[2]) << 8 | bytes[3];
-}
-
-bool isSQLite(int file) {
-  constexpr std::string_view kMagic("SQLite format 3\0", 16);
-  char bytes[16];
-  return ::pread(file, bytes, sizeof bytes, /*offset=*/0) == sizeof bytes &&
-         std::string_view(bytes, sizeof bytes) == kMagic;
-}
-
 StoreFault damaged(std::string description) {
   return {StoreFault::Kind::kDamaged, SQLITE_CORRUPT, std::move(description)};
 }
@@ -203,13 +186,19 @@ void StoreDatabase::close() {
 
 StoreDatabase::Result StoreDatabase::makeFile() {
   if (auto failed = makeDirectories(directoryOf(path_))) return failed;
+  if (auto failed = clearCompanions()) return failed;
   struct stat status;
-  if (::lstat(path_.c_str(), &status) == 0 && !S_ISREG(status.st_mode)) {
-    return damaged("it is not a regular file");
-  }
+  const bool isThere = ::lstat(path_.c_str(), &status) == 0;
+  if (isThere && !S_ISREG(status.st_mode)) return damaged("it is not a regular file");
   const FileDescriptor file(
       ::open(path_.c_str(), O_RDWR | O_CREAT | O_NOFOLLOW | O_CLOEXEC, 0600));
-  if (!file) return systemFault(errno, "open", path_);
+  if (!file) {
+    // One of our own would be no better off if it were set aside for a new one.
+    if (errno == EACCES && isThere && status.st_uid != ::geteuid()) {
+      return damaged("it belongs to user " + std::to_string(status.st_uid));
+    }
+    return systemFault(errno, "open", path_);
+  }
   if (::fstat(file.get(), &status) != 0) return systemFault(errno, "look at", path_);
   if ((status.st_mode & 07777) != 0600 && ::fchmod(file.get(), 0600) != 0) {
     return systemFault(errno, "set the permissions of", path_);
@@ -217,9 +206,41 @@ StoreDatabase::Result StoreDatabase::makeFile() {
   isAnother_ = device_ != status.st_dev || inode_ != status.st_ino;
   device_ = status.st_dev;
   inode_ = status.st_ino;
-  if (status.st_size == 0) return std::nullopt;
-  if (!isSQLite(file.get())) return damaged("it is not a database");
-  const std::uint32_t version = versionInHeader(file.get());
+  return status.st_size == 0 ? std::nullopt : checkHeader(file.get());
+}
+
+// What stands in place of the log or its index and is no file would keep the store from
+// being used; it holds nothing of ours.
+StoreDatabase::Result StoreDatabase::clearCompanions() {
+  for (const char* suffix : {"-wal", "-shm"}) {
+    const std::string path = path_ + suffix;
+    struct stat status;
+    if (::lstat(path.c_str(), &status) != 0 || S_ISREG(status.st_mode)) continue;
+    const std::string target = nameForSetAside();
+    if (::rename(path.c_str(), target.c_str()) != 0) {
+      return systemFault(errno, "set aside", path);
+    }
+    OSTREL_LOG_ERROR(processLogScope, "set %@ aside as %@: it is not a regular file",
+                     path, target);
+    removeOldestSetAside();
+  }
+  return std::nullopt;
+}
+
+StoreDatabase::Result StoreDatabase::checkHeader(int file) {
+  constexpr std::string_view kMagic("SQLite format 3\0", 16);
+  constexpr std::size_t kVersionOffset = 60;
+  std::uint8_t bytes[kVersionOffset + 4] = {};
+  const ssize_t size = ::pread(file, bytes, sizeof bytes, /*offset=*/0);
+  if (size < 0) return systemFault(errno, "read", path_);
+  if (std::memcmp(bytes, kMagic.data(), kMagic.size()) != 0) {
+    return damaged("it is not a database");
+  }
+  const std::uint32_t version =
+      static_cast<std::uint32_t>(bytes[kVersionOffset]) << 24 |
+      static_cast<std::uint32_t>(bytes[kVersionOffset + 1]) << 16 |
+      static_cast<std::uint32_t>(bytes[kVersionOffset + 2]) << 8 |
+      bytes[kVersionOffset + 3];
   if (version > kVersion && version <= INT32_MAX) return newer(version);
   return std::nullopt;
 }
@@ -228,6 +249,7 @@ StoreDatabase::Result StoreDatabase::connect() {
   const int code = sqlite3_open_v2(path_.c_str(), &connection_,
                                    SQLITE_OPEN_READWRITE | SQLITE_OPEN_NOMUTEX, vfs_);
   if (code != SQLITE_OK) return fault(code, "open");
+  keepLogAtClose(/*isKept=*/true);
   sqlite3_extended_result_codes(connection_, /*onoff=*/1);
   sqlite3_busy_timeout(connection_, kBusyMilliseconds);
   if (auto failed = run("PRAGMA page_size = 16384;"
@@ -252,7 +274,16 @@ StoreDatabase::Result StoreDatabase::connect() {
   if (const int registered = registerRowTables(connection_, &rows_)) {
     return fault(registered, "prepare");
   }
-  return prepareStatements();
+  if (auto failed = prepareStatements()) return failed;
+  keepLogAtClose(/*isKept=*/false);
+  return std::nullopt;
+}
+
+// What is damaged, or not ours, is left as it was found.
+void StoreDatabase::keepLogAtClose(bool isKept) {
+  if (connection_ == nullptr) return;
+  sqlite3_db_config(connection_, SQLITE_DBCONFIG_NO_CKPT_ON_CLOSE, isKept ? 1 : 0,
+                    nullptr);
 }
 
 StoreDatabase::Result StoreDatabase::checkVersion(std::int64_t& version) {
@@ -366,17 +397,25 @@ bool StoreDatabase::isInPlace() const {
          status.st_ino == inode_;
 }
 
-StoreDatabase::Result StoreDatabase::setAside(std::string_view reason) {
-  close();
+std::string StoreDatabase::nameForSetAside() const {
   const std::time_t now = std::time(nullptr);
   struct tm calendar;
   char stamp[32];
   std::strftime(stamp, sizeof stamp, "%Y%m%dT%H%M%SZ", ::gmtime_r(&now, &calendar));
-  std::string target = path_ + std::string(kSetAsideSuffix) + stamp;
+  std::string name = path_ + std::string(kSetAsideSuffix) + stamp;
+  const std::size_t size = name.size();
   struct stat status;
-  for (int i = 2; ::lstat(target.c_str(), &status) == 0; ++i) {
-    target = path_ + std::string(kSetAsideSuffix) + stamp + "-" + std::to_string(i);
+  for (int i = 2; ::lstat(name.c_str(), &status) == 0; ++i) {
+    name.resize(size);
+    name += '-' + std::to_string(i);
   }
+  return name;
+}
+
+StoreDatabase::Result StoreDatabase::setAside(std::string_view reason) {
+  keepLogAtClose(/*isKept=*/true);
+  close();
+  const std::string target = nameForSetAside();
   if (::rename(path_.c_str(), target.c_str()) != 0) {
     return systemFault(errno, "set aside", path_);
   }

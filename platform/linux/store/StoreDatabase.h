@@ -111,11 +111,15 @@ class StoreDatabase {
   struct Statements;
 
   Result makeFile();
+  Result clearCompanions();
+  Result checkHeader(int file);
   Result connect();
+  void keepLogAtClose(bool isKept);
   Result checkVersion(std::int64_t& version);
   Result makeSchema();
   Result checkContent();
   Result prepareStatements();
+  std::string nameForSetAside() const;
   void removeOldestSetAside();
 
   Result run(const char* sql);

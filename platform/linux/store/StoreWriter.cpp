@@ -378,6 +378,12 @@ void StoreWriter::fail(const StoreFault& fault) {
     OSTREL_LOG_ERROR(processLogScope, "the store cannot be used: %@", fault.description);
     loggedFault_ = fault.description;
   }
+  if (fault.kind == StoreFault::Kind::kDamaged) {
+    if (!database_.setAside(fault.description)) {
+      counters_.setAside.fetch_add(1, std::memory_order_relaxed);
+    }
+    return;
+  }
   switch (fault.code & 0xFF) {
     case SQLITE_FULL:
     case SQLITE_BUSY:
@@ -387,11 +393,6 @@ void StoreWriter::fail(const StoreFault& fault) {
     default:
       database_.close();
       break;
-  }
-  if (fault.kind == StoreFault::Kind::kDamaged) {
-    if (!database_.setAside(fault.description)) {
-      counters_.setAside.fetch_add(1, std::memory_order_relaxed);
-    }
   }
 }
 
