@@ -54,6 +54,11 @@ inline constexpr std::size_t kKeptBytesOfUser = std::size_t{1} * 1024 * 1024 * 1
 /// queue, the buffer's head.
 inline constexpr std::size_t kRequestBytes = 256;
 
+/// What each delivery of a message costs beyond the first: its step on the queue of the
+/// session, and its place in the store's. A message to all is taken to go to every
+/// session that there is.
+inline constexpr std::size_t kDeliveryBytes = 512;
+
 /// What a request that wants a reply costs besides: the callback, and the reply
 /// that it causes. Keeps the replies to what is queued below `kUnreadReplyBytes`.
 inline constexpr std::size_t kReplyBytes = 256;

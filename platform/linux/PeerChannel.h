@@ -38,6 +38,9 @@ class PeerChannel final : public PayloadAccount {
   bool keep(std::size_t bytes) noexcept override { return user_->keep(bytes); }
   void discard(std::size_t bytes) noexcept override { user_->discard(bytes); }
 
+  /// Of all users.
+  std::size_t sessionsOfAll() const { return user_->sessionsOfAll(); }
+
   /// The loop's: a request without a payload of its own costs `bytes` until a
   /// request up to the mark returned, or a later one, has run.
   std::uint64_t chargeRequest(std::size_t bytes);

@@ -192,10 +192,17 @@ std::size_t PeerConnection::carryOut(ValueBuffer& input,
     ending_ = Ending::kFarewell;
     return 0;
   }
+  // A client that has gone may have left thousands of questions behind.
+  if (isDeaf_ && onlyAsks(request.operation)) return 0;
   std::size_t used = 0;
   if (request.dictionary) {
     used = item.size();
     input.charge(used + limits::kRequestBytes);
+  }
+  if (request.operation == wire::Operation::kSendMessage) {
+    const std::size_t deliveries =
+        request.reporterIDs ? request.reporterIDs->size() : channel_->sessionsOfAll();
+    if (deliveries > 1) input.charge((deliveries - 1) * limits::kDeliveryBytes);
   }
   if (keepsReply(request.operation)) {
     needsProbe_ = true;

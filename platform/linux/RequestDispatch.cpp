@@ -165,6 +165,12 @@ bool keepsReply(wire::Operation operation) {
   return operation == Operation::kStartReportingSessionForID;
 }
 
+bool onlyAsks(wire::Operation operation) {
+  return operation == Operation::kGetServiceNameForReporterID ||
+         operation == Operation::kReporterIDValid ||
+         operation == Operation::kGetAllReporters;
+}
+
 void dispatchProbe(OstrelReportingServiceProtocol& object,
                    const std::shared_ptr<PeerChannel>& channel) {
   object.getAllReporters(Reply(std::make_shared<RequestTicket>(

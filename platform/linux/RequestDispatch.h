@@ -19,6 +19,9 @@ void dispatchRequest(OstrelReportingServiceProtocol& object,
 /// has run.
 bool keepsReply(wire::Operation operation);
 
+/// Whether an operation changes nothing: without anybody to reply to, it need not run.
+bool onlyAsks(wire::Operation operation);
+
 /// Queues a question on `object` whose only purpose is to learn when everything
 /// before it has run.
 void dispatchProbe(OstrelReportingServiceProtocol& object,

@@ -54,6 +54,7 @@ class UserAccount {
   }
 
   std::size_t sessions() const { return sessions_.used(); }
+  std::size_t sessionsOfAll() const { return service_->sessions.used(); }
   std::size_t keptBytes() const { return keptBytes_.used(); }
 
  private:
