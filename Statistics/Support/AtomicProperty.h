@@ -3,6 +3,8 @@
 #include <mutex>
 #include <utility>
 
+#include "platform/SmallMutex.h"
+
 namespace ostrel {
 
 /// A property that any thread may read and replace; a reader gets a copy of one
@@ -25,7 +27,7 @@ class AtomicProperty {
   }
 
  private:
-  mutable std::mutex mutex_;
+  mutable SmallMutex mutex_;
   T value_{};
 };
 

@@ -3,7 +3,7 @@
 #include <mutex>
 #include <utility>
 
-#include "platform/ThreadAnnotations.h"
+#include "platform/SmallMutex.h"
 
 namespace ostrel {
 
@@ -20,7 +20,7 @@ class Monitored {
     Object& operator*() const { return object_; }
 
    private:
-    std::unique_lock<std::mutex> lock_;
+    std::unique_lock<SmallMutex> lock_;
     Object& object_;
   };
 
@@ -34,7 +34,7 @@ class Monitored {
   }
 
  private:
-  mutable std::mutex mutex_;
+  mutable SmallMutex mutex_;
   T value_;
 };
 

@@ -2,6 +2,7 @@
 
 #include <mutex>
 
+#include "platform/SmallMutex.h"
 #include "platform/Value.h"
 
 namespace ostrel {
@@ -22,7 +23,7 @@ class MutableDictionary {
   }
 
  private:
-  mutable std::mutex mutex_;
+  mutable SmallMutex mutex_;
   Dictionary value_;
 };
 

@@ -1,15 +1,18 @@
 // A serial queue is a strand: a list of steps that at most one thread of its
-// pool works off at a time. A strand with steps stands in its pool's line once,
-// or is run by a thread, or is suspended; otherwise it is idle, and then nothing
-// but its owner holds it. Queueing on a strand that is in line or runs is a push
-// under its own short lock and wakes nobody. The thread takes all steps that
-// have gathered in one swap, so the lock is taken once a batch on that side.
+// pool works off at a time. A strand with steps is placed: it stands in its pool's
+// line once, or in a batch's that will be, or is run by a thread. Or it is
+// suspended. Otherwise it is idle, and then nothing but its owner holds it and it
+// holds no memory but its own. Queueing on a strand that is placed is a push under
+// its own short lock and wakes nobody. The thread takes all steps that have gathered
+// at once, so the lock is taken once a batch on that side.
 //
-// The memory of step lists belongs to the pool: an idle strand has none, and a
-// strand that gets into line takes a list that another has left.
+// While a `Batch` runs its queue, the strands that this places gather in lines of the
+// batch, and go into their pool's line together: one lock for up to
+// `kStrandsOfBatch` of them. With a message for each of many sessions this is the
+// difference between a lock that two threads always meet at and one that they rarely
+// do.
 //
-// Locks are taken in the order strand, pool, and no step or destructor of a step
-// runs under one.
+// No lock is taken under another, and no step or destructor of a step runs under one.
 #include "platform/linux/ThreadPoolWorkQueues.h"
 
 #include <algorithm>
@@ -27,20 +30,17 @@
 #include <utility>
 #include <vector>
 
-#include "platform/Logging.h"
+#include "platform/SmallMutex.h"
+#include "platform/linux/QueuedSteps.h"
 #include "platform/linux/Threads.h"
 
 namespace ostrel {
 namespace {
 
-using Steps = std::vector<Task>;
-using Emptied = std::array<Steps, 2>;  // The lists of a strand, to be used again.
-
 /// After so many steps a strand lets the others in line go first.
 constexpr int kStepsOfTurn = 128;
-/// Step lists that a pool keeps for the next strands, and the longest kept.
-constexpr std::size_t kMostSpares = 8;
-constexpr std::size_t kLongestSpare = 512;
+/// A batch that has gathered so many strands hands them over.
+constexpr std::int64_t kStrandsOfBatch = 64;
 
 constexpr std::chrono::milliseconds kThreadRetry{100};
 constexpr std::chrono::seconds kLastWait{2};
@@ -52,19 +52,49 @@ thread_local bool isPoolThread = false;
 
 /// What the pools have in common. Outlives the factory while a queue lives.
 struct ThreadPoolWorkQueues::Shared {
-  /// Strands in line or run, and steps of the background queue likewise.
+  /// Strands that are placed, steps of the background queue likewise, and batches
+  /// with strands of theirs. A thread tells of those that it has finished when it
+  /// finds no other.
   std::atomic<std::int64_t> active{0};
   std::atomic<int> drainers{0};
   std::mutex mutex;
   std::condition_variable becameIdle;
-  std::set<std::string, std::less<>> labels;  // One text for all of a label.
 
-  void begin() { active.fetch_add(1); }
-  void finish() {
-    if (active.fetch_sub(1) != 1 || drainers.load() == 0) return;
+  void begin(std::int64_t count) { active.fetch_add(count); }
+  void finish(std::int64_t count) {
+    if (active.fetch_sub(count) != count || drainers.load() == 0) return;
     const std::lock_guard lock(mutex);
     becameIdle.notify_all();
   }
+};
+
+/// What queues have in common that are made alike.
+struct ThreadPoolWorkQueues::QueueKind {
+  const std::string label;
+  const std::shared_ptr<Pool> pool;
+  const bool isLow;
+};
+
+/// Strands one after the other, which it holds.
+class ThreadPoolWorkQueues::Line {
+ public:
+  bool empty() const { return first_ == nullptr; }
+  void append(std::shared_ptr<Strand> strand);
+  void append(Line&& other);
+  /// None when it is empty.
+  std::shared_ptr<Strand> take();
+
+ private:
+  std::shared_ptr<Strand> first_;
+  Strand* last_ = nullptr;  // Of any use only while there is a first.
+};
+
+/// Lines of strands on their way to a pool.
+struct ThreadPoolWorkQueues::Gathered {
+  std::shared_ptr<Pool> pool;
+  Line line;
+  Line lowLine;
+  std::int64_t count = 0;
 };
 
 /// The threads of one quality of service and the line of what waits for them.
@@ -82,15 +112,19 @@ class ThreadPoolWorkQueues::Pool : public std::enable_shared_from_this<Pool> {
        std::shared_ptr<TimerThread> timers)
       : kind_(kind), shared_(std::move(shared)), timers_(std::move(timers)) {}
 
-  /// Puts a strand into line; an empty `steps` may be given memory. After
-  /// `kWakes` the caller calls `wakeOne`, best without a lock.
-  Placed place(std::shared_ptr<Strand> strand, Steps& steps);
-  void wakeOne() { wake_.notify_one(); }
+  /// Puts a strand into line. After `kWakes` the caller calls `wakeOne`. The strand
+  /// is not taken when it is dropped.
+  Placed place(std::shared_ptr<Strand>&& strand);
+  void wakeOne();
+
+  /// As `place`, for what a batch gathered; wakes threads itself.
+  void place(Gathered& gathered);
 
   /// As `place`, for a strand that a batch runs: it gets into no line.
-  Placed begin(Steps& steps);
+  Placed begin();
   void runHere(std::shared_ptr<Strand> strand);
   bool isBatched() const { return kind_.isBatched; }
+  Shared& shared() { return *shared_; }
 
   void async(Task step);
 
@@ -100,129 +134,146 @@ class ThreadPoolWorkQueues::Pool : public std::enable_shared_from_this<Pool> {
   void end();
 
  private:
-  struct Line {
-    std::shared_ptr<Strand> first;
-    Strand* last = nullptr;
-  };
-
   bool hasEnded() const { return isEnding_ && liveThreads_ == 0; }
-  void giveMemory(Steps& steps);
-  void takeMemory(Emptied& emptied);
-  void append(std::shared_ptr<Strand> strand);
   std::shared_ptr<Strand> takeStrand();
   Placed callThread();
   void addThread();
   void work();
-  /// Without the lock, then with it. True when the strand is in line again.
-  bool runStrand(std::shared_ptr<Strand> strand, std::unique_lock<std::mutex>& lock);
-  void runLoose(std::unique_lock<std::mutex>& lock);
+  void sleep(std::unique_lock<SmallMutex>& lock);
+  /// True when the strand is in line again; else it is finished.
+  bool runStrand(std::shared_ptr<Strand> strand);
+  void runLoose(std::unique_lock<SmallMutex>& lock);
 
   const Kind kind_;
   const std::shared_ptr<Shared> shared_;
   const std::shared_ptr<TimerThread> timers_;
 
   std::atomic<std::int64_t> waiting_{0};  // In line. Written under the lock.
-  mutable std::mutex mutex_;              // Of what follows.
-  std::condition_variable wake_;
+  mutable SmallMutex mutex_;              // Of what follows.
   Line line_;
   Line lowLine_;  // Of the queues with a priority below 0.
   std::deque<Task> loose_;
-  std::vector<Steps> spares_;
   std::vector<std::thread> threads_;
   std::size_t liveThreads_ = 0;
-  std::size_t sleepers_ = 0;  // Threads asleep, less those called already.
-  std::size_t calls_ = 0;     // Wake-ups that no thread has answered yet.
+  std::size_t sleepers_ = 0;  // Threads asleep, less those to be called.
   bool retriesThread_ = false;
   bool isEnding_ = false;
+
+  std::mutex sleepMutex_;  // Of what follows.
+  std::condition_variable wake_;
+  std::size_t calls_ = 0;  // Wake-ups that no thread has answered yet.
+  bool mustNotSleep_ = false;
 };
 
-/// One serial queue.
+/// One serial queue. There are as many as sessions, so it is small.
 class ThreadPoolWorkQueues::Strand final : public WorkQueue,
                                            public std::enable_shared_from_this<Strand> {
  public:
-  Strand(std::shared_ptr<Pool> pool, const std::string& label, bool isLow)
-      : isLow_(isLow), label_(label), pool_(std::move(pool)) {}
+  explicit Strand(std::shared_ptr<const QueueKind> kind) : kind_(std::move(kind)) {}
 
-  void async(Task step) override;
+  void async(Task task) override;
   void suspend() override;
   void resume(Task first) override;
   bool isCurrent() const override { return currentQueue == this; }
-  const std::string& label() const override { return label_; }
+  const std::string& label() const override { return kind_->label; }
 
-  bool isLow() const { return isLow_; }
+  bool isLow() const { return kind_->isLow; }
 
   /// Runs steps on the calling thread. True when there are more and others wait
-  /// in line; else the strand is idle or suspended, and hands over the memory
-  /// of its lists.
-  bool runTurn(Emptied& emptied);
+  /// in line; else the strand is idle or suspended.
+  bool runTurn();
 
-  std::shared_ptr<Strand> next;  // In line. Under the pool's lock.
+  /// Drops what waits, since nothing will run it.
+  void drop();
 
  private:
-  bool runSteps(Emptied& emptied);
-  void placeInLine(std::unique_lock<std::mutex>& lock, Steps& steps, Task& step);
+  friend class Line;
 
-  const bool isLow_;
-  const std::string& label_;  // Lives as long as the pool's `Shared`.
-  const std::shared_ptr<Pool> pool_;
+  bool runSteps();
+  void place();
 
-  // The thread's that runs the strand, from one turn to the next.
-  bool suspendWasCalled_ = false;
-  std::uint32_t nextIndex_ = 0;
-  Steps current_;
-
-  std::mutex mutex_;       // Of what follows.
-  bool isPlaced_ = false;  // In line, or run by a thread.
+  std::shared_ptr<Strand> next_;  // The line's.
+  const std::shared_ptr<const QueueKind> kind_;
+  SmallMutex mutex_;               // Of what follows but `suspendWasCalled_`.
+  bool suspendWasCalled_ = false;  // The thread's that runs the strand.
+  bool isPlaced_ = false;
   bool isSuspended_ = false;
-  Steps incoming_;
-  Steps firsts_;  // Of `resume`; the last goes first.
+  StepList waiting_;
+  StepList firsts_;  // Of `resume` while the strand runs; the last goes first.
 };
 
-void ThreadPoolWorkQueues::Strand::async(Task step) {
-  std::unique_lock lock(mutex_);
-  if (isPlaced_ || isSuspended_) {
-    incoming_.push_back(std::move(step));
-    return;
+void ThreadPoolWorkQueues::Line::append(std::shared_ptr<Strand> strand) {
+  Strand* const added = strand.get();
+  if (first_ == nullptr) {
+    first_ = std::move(strand);
+  } else {
+    last_->next_ = std::move(strand);
   }
-  placeInLine(lock, incoming_, step);
+  last_ = added;
 }
 
-// Appends `step` to `steps` and puts the strand into line. Leaves `step` as it
-// is, to be dropped without the lock, when the pool has ended.
-void ThreadPoolWorkQueues::Strand::placeInLine(std::unique_lock<std::mutex>& lock,
-                                               Steps& steps, Task& step) {
-  isPlaced_ = true;
-  const bool isBatched =
-      currentBatch_ != nullptr && pool_->isBatched() && currentBatch_->takes();
-  const Pool::Placed placed =
-      isBatched ? pool_->begin(incoming_) : pool_->place(shared_from_this(), incoming_);
-  if (placed == Pool::Placed::kDropped) {
-    isPlaced_ = false;
-    lock.unlock();
+void ThreadPoolWorkQueues::Line::append(Line&& other) {
+  if (other.empty()) return;
+  Strand* const last = other.last_;
+  append(std::move(other.first_));
+  last_ = last;
+}
+
+std::shared_ptr<ThreadPoolWorkQueues::Strand> ThreadPoolWorkQueues::Line::take() {
+  std::shared_ptr<Strand> strand = std::move(first_);
+  if (strand != nullptr) first_ = std::move(strand->next_);
+  return strand;
+}
+
+void ThreadPoolWorkQueues::Strand::async(Task task) {
+  QueuedStep* const step = QueuedStep::make(std::move(task));
+  {
+    const std::lock_guard lock(mutex_);
+    waiting_.append(step);
+    if (isPlaced_ || isSuspended_) return;
+    isPlaced_ = true;
+  }
+  place();
+}
+
+void ThreadPoolWorkQueues::Strand::place() {
+  Pool& pool = *kind_->pool;
+  Batch* const batch = currentBatch_;
+  if (batch != nullptr && batch->isRunning_) {
+    batch->gather(shared_from_this(), kind_->pool);
     return;
   }
-  // The thread that takes the strand waits for this lock. Once it has it, the
-  // strand may end.
-  steps.push_back(std::move(step));
-  if (isBatched) currentBatch_->take(shared_from_this(), pool_);
-  if (placed == Pool::Placed::kQuiet) {
-    lock.unlock();
-    return;
-  }
-  const std::shared_ptr<Pool> pool = pool_;
-  lock.unlock();
-  if (currentBatch_ != nullptr) {
-    currentBatch_->wakeLater(pool);
+  Pool::Placed placed;
+  if (batch != nullptr && pool.isBatched() && batch->takes()) {
+    placed = pool.begin();
+    if (placed != Pool::Placed::kDropped) batch->take(shared_from_this(), kind_->pool);
   } else {
-    pool->wakeOne();
+    // The strand may end as soon as it is in line.
+    const std::shared_ptr<const QueueKind> kind = kind_;
+    placed = pool.place(shared_from_this());
+    if (placed == Pool::Placed::kWakes) {
+      if (batch != nullptr) {
+        batch->wakeLater(kind->pool);
+      } else {
+        kind->pool->wakeOne();
+      }
+    }
   }
+  if (placed == Pool::Placed::kDropped) drop();
+}
+
+void ThreadPoolWorkQueues::Strand::drop() {
+  StepList dropped;
+  const std::lock_guard lock(mutex_);
+  isPlaced_ = false;
+  dropped.swap(waiting_);
 }
 
 void ThreadPoolWorkQueues::Strand::suspend() {
   assertCurrent();
   const std::lock_guard lock(mutex_);
   if (isSuspended_) {
-    std::fprintf(stderr, "<2>queue \"%s\" is suspended twice\n", label_.c_str());
+    std::fprintf(stderr, "<2>queue \"%s\" is suspended twice\n", label().c_str());
     std::abort();
   }
   isSuspended_ = true;
@@ -230,97 +281,97 @@ void ThreadPoolWorkQueues::Strand::suspend() {
 }
 
 void ThreadPoolWorkQueues::Strand::resume(Task first) {
-  std::unique_lock lock(mutex_);
-  if (!isSuspended_) {
-    std::fprintf(stderr, "<2>queue \"%s\" is resumed without being suspended\n",
-                 label_.c_str());
-    std::abort();
+  QueuedStep* const step = QueuedStep::make(std::move(first));
+  {
+    const std::lock_guard lock(mutex_);
+    if (!isSuspended_) {
+      std::fprintf(stderr, "<2>queue \"%s\" is resumed without being suspended\n",
+                   label().c_str());
+      std::abort();
+    }
+    isSuspended_ = false;
+    if (isPlaced_) {  // The step that suspended it still runs.
+      firsts_.prepend(step);
+      return;
+    }
+    waiting_.prepend(step);
+    isPlaced_ = true;
   }
-  isSuspended_ = false;
-  if (isPlaced_) {  // The step that suspended it still runs.
-    firsts_.push_back(std::move(first));
-    return;
-  }
-  placeInLine(lock, firsts_, first);
+  place();
 }
 
-bool ThreadPoolWorkQueues::Strand::runTurn(Emptied& emptied) {
+bool ThreadPoolWorkQueues::Strand::runTurn() {
   currentQueue = this;
-  const bool hasMore = runSteps(emptied);
+  const bool hasMore = runSteps();
   currentQueue = nullptr;
   return hasMore;
 }
 
-bool ThreadPoolWorkQueues::Strand::runSteps(Emptied& emptied) {
+bool ThreadPoolWorkQueues::Strand::runSteps() {
+  StepList steps;
   int stepsLeft = kStepsOfTurn;
-  bool mayHaveFirsts = true;
   for (;;) {
-    if (mayHaveFirsts) {
-      std::unique_lock lock(mutex_);
-      if (isSuspended_) {
+    {
+      const std::lock_guard lock(mutex_);
+      waiting_.prepend(steps);
+      if (stepsLeft < 0) return true;
+      waiting_.prepend(firsts_);
+      if (isSuspended_ || waiting_.empty()) {
         isPlaced_ = false;
         return false;
       }
-      if (firsts_.empty()) {
-        mayHaveFirsts = false;
-        continue;
-      }
-      Task first = std::move(firsts_.back());
-      firsts_.pop_back();
-      lock.unlock();
-      first();
-      suspendWasCalled_ = false;  // It is looked at in any case.
-      continue;
+      steps.swap(waiting_);
     }
-    while (nextIndex_ < current_.size()) {
+    while (!steps.empty()) {
       if (stepsLeft-- == 0) {
-        if (pool_->othersWait()) return true;
-        stepsLeft = kStepsOfTurn;
+        if (kind_->pool->othersWait()) break;
+        stepsLeft = kStepsOfTurn - 1;
       }
-      Task& step = current_[nextIndex_++];
-      step();
-      step = Task();
-      if (suspendWasCalled_) {
-        suspendWasCalled_ = false;
-        mayHaveFirsts = true;
-        break;
-      }
-    }
-    if (mayHaveFirsts) continue;
-    current_.clear();
-    nextIndex_ = 0;
-    const std::lock_guard lock(mutex_);
-    current_.swap(incoming_);
-    if (current_.empty()) {
-      emptied = {std::move(current_), std::move(incoming_)};
-      isPlaced_ = false;
-      return false;
+      steps.runFirst();
+      if (std::exchange(suspendWasCalled_, false)) break;
     }
   }
 }
 
 ThreadPoolWorkQueues::Pool::Placed ThreadPoolWorkQueues::Pool::place(
-    std::shared_ptr<Strand> strand, Steps& steps) {
+    std::shared_ptr<Strand>&& strand) {
   const std::lock_guard lock(mutex_);
   if (hasEnded()) return Placed::kDropped;
-  shared_->begin();
-  giveMemory(steps);
-  append(std::move(strand));
+  shared_->begin(/*count=*/1);
+  Line& line = strand->isLow() ? lowLine_ : line_;
+  line.append(std::move(strand));
+  waiting_.fetch_add(1, std::memory_order_relaxed);
   return callThread();
 }
 
-ThreadPoolWorkQueues::Pool::Placed ThreadPoolWorkQueues::Pool::begin(Steps& steps) {
-  const std::lock_guard lock(mutex_);
-  if (hasEnded()) return Placed::kDropped;
-  shared_->begin();
-  giveMemory(steps);
-  return Placed::kQuiet;
+void ThreadPoolWorkQueues::Pool::place(Gathered& gathered) {
+  std::size_t wakes = 0;
+  {
+    const std::lock_guard lock(mutex_);
+    if (!hasEnded()) {
+      shared_->begin(gathered.count);
+      line_.append(std::move(gathered.line));
+      lowLine_.append(std::move(gathered.lowLine));
+      waiting_.fetch_add(gathered.count, std::memory_order_relaxed);
+      const auto most = static_cast<std::int64_t>(kind_.mostThreads);
+      for (auto threads = std::min(gathered.count, most); threads != 0; --threads) {
+        if (callThread() == Placed::kWakes) ++wakes;
+      }
+    }
+  }
+  // What is left has nobody to run it. Ends of steps may gather anew.
+  gathered.count = 0;
+  Line dropped = std::move(gathered.line);
+  dropped.append(std::move(gathered.lowLine));
+  while (const auto strand = dropped.take()) strand->drop();
+  for (; wakes != 0; --wakes) wakeOne();
 }
 
-void ThreadPoolWorkQueues::Pool::giveMemory(Steps& steps) {
-  if (steps.capacity() != 0 || spares_.empty()) return;
-  steps = std::move(spares_.back());
-  spares_.pop_back();
+ThreadPoolWorkQueues::Pool::Placed ThreadPoolWorkQueues::Pool::begin() {
+  const std::lock_guard lock(mutex_);
+  if (hasEnded()) return Placed::kDropped;
+  shared_->begin(/*count=*/1);
+  return Placed::kQuiet;
 }
 
 void ThreadPoolWorkQueues::Pool::async(Task step) {
@@ -328,7 +379,7 @@ void ThreadPoolWorkQueues::Pool::async(Task step) {
   {
     const std::lock_guard lock(mutex_);
     if (hasEnded()) return;
-    shared_->begin();
+    shared_->begin(/*count=*/1);
     loose_.push_back(std::move(step));
     waiting_.fetch_add(1, std::memory_order_relaxed);
     placed = callThread();
@@ -340,7 +391,6 @@ void ThreadPoolWorkQueues::Pool::async(Task step) {
 ThreadPoolWorkQueues::Pool::Placed ThreadPoolWorkQueues::Pool::callThread() {
   if (sleepers_ > 0) {
     --sleepers_;
-    ++calls_;
     return Placed::kWakes;
   }
   if (threads_.size() < kind_.mostThreads && !isEnding_) addThread();
@@ -365,99 +415,95 @@ void ThreadPoolWorkQueues::Pool::addThread() {
   }
 }
 
-void ThreadPoolWorkQueues::Pool::append(std::shared_ptr<Strand> strand) {
-  Line& line = strand->isLow() ? lowLine_ : line_;
-  Strand* const added = strand.get();
-  if (line.first == nullptr) {
-    line.first = std::move(strand);
-  } else {
-    line.last->next = std::move(strand);
-  }
-  line.last = added;
-  waiting_.fetch_add(1, std::memory_order_relaxed);
-}
-
 std::shared_ptr<ThreadPoolWorkQueues::Strand> ThreadPoolWorkQueues::Pool::takeStrand() {
-  Line& line = line_.first != nullptr ? line_ : lowLine_;
-  std::shared_ptr<Strand> strand = std::move(line.first);
-  if (strand == nullptr) return nullptr;
-  line.first = std::move(strand->next);
-  if (line.first == nullptr) line.last = nullptr;
-  waiting_.fetch_sub(1, std::memory_order_relaxed);
+  std::shared_ptr<Strand> strand = (line_.empty() ? lowLine_ : line_).take();
+  if (strand != nullptr) waiting_.fetch_sub(1, std::memory_order_relaxed);
   return strand;
 }
 
 void ThreadPoolWorkQueues::Pool::work() {
   isPoolThread = true;
-  std::unique_lock lock(mutex_);
+  std::int64_t finished = 0;
   bool isLooseNext = false;  // Strands and loose steps take turns.
+  std::unique_lock lock(mutex_);
   for (;;) {
     isLooseNext = !isLooseNext;
     if (!loose_.empty() && isLooseNext) {
       runLoose(lock);
+      ++finished;
     } else if (auto strand = takeStrand()) {
       lock.unlock();
-      runStrand(std::move(strand), lock);
+      if (!runStrand(std::move(strand))) ++finished;
+      lock.lock();
     } else if (!loose_.empty()) {
       runLoose(lock);
+      ++finished;
+    } else if (finished != 0) {
+      lock.unlock();
+      shared_->finish(std::exchange(finished, 0));
+      lock.lock();
     } else if (isEnding_) {
       --liveThreads_;
       return;
     } else {
-      ++sleepers_;
-      wake_.wait(lock, [this] { return calls_ > 0 || isEnding_; });
-      if (calls_ > 0) {
-        --calls_;
-      } else {
-        --sleepers_;
-      }
+      sleep(lock);
     }
   }
 }
 
-bool ThreadPoolWorkQueues::Pool::runStrand(std::shared_ptr<Strand> strand,
-                                           std::unique_lock<std::mutex>& lock) {
-  Emptied emptied;
-  const bool hasMore = strand->runTurn(emptied);
-  if (hasMore) {
-    lock.lock();
-    append(std::move(strand));
-    return true;
-  }
-  strand.reset();  // Perhaps its end.
-  shared_->finish();
-  for (Steps& steps : emptied) {
-    if (steps.capacity() > kLongestSpare) Steps().swap(steps);
+void ThreadPoolWorkQueues::Pool::sleep(std::unique_lock<SmallMutex>& lock) {
+  ++sleepers_;
+  lock.unlock();
+  bool wasCalled = true;
+  {
+    std::unique_lock asleep(sleepMutex_);
+    wake_.wait(asleep, [this] { return calls_ > 0 || mustNotSleep_; });
+    if (calls_ > 0) {
+      --calls_;
+    } else {
+      wasCalled = false;
+    }
   }
   lock.lock();
-  takeMemory(emptied);
-  return false;
+  if (!wasCalled && sleepers_ > 0) --sleepers_;
 }
 
-void ThreadPoolWorkQueues::Pool::takeMemory(Emptied& emptied) {
-  for (Steps& steps : emptied) {
-    if (steps.capacity() > 0 && spares_.size() < kMostSpares) {
-      spares_.push_back(std::move(steps));
-    }
+void ThreadPoolWorkQueues::Pool::wakeOne() {
+  {
+    const std::lock_guard lock(sleepMutex_);
+    ++calls_;
   }
+  wake_.notify_one();
+}
+
+bool ThreadPoolWorkQueues::Pool::runStrand(std::shared_ptr<Strand> strand) {
+  if (!strand->runTurn()) return false;  // With the reference perhaps its end.
+  const std::lock_guard lock(mutex_);
+  Line& line = strand->isLow() ? lowLine_ : line_;
+  line.append(std::move(strand));
+  waiting_.fetch_add(1, std::memory_order_relaxed);
+  return true;
 }
 
 // A thread of the pool does the rest when other strands wait for one.
 void ThreadPoolWorkQueues::Pool::runHere(std::shared_ptr<Strand> strand) {
-  std::unique_lock lock(mutex_, std::defer_lock);
-  if (!runStrand(std::move(strand), lock) || callThread() != Placed::kWakes) return;
+  if (!runStrand(std::move(strand))) {
+    shared_->finish(/*count=*/1);
+    return;
+  }
+  std::unique_lock lock(mutex_);
+  const Placed placed = callThread();
   lock.unlock();
-  wakeOne();
+  if (placed == Placed::kWakes) wakeOne();
 }
 
-void ThreadPoolWorkQueues::Pool::runLoose(std::unique_lock<std::mutex>& lock) {
+void ThreadPoolWorkQueues::Pool::runLoose(std::unique_lock<SmallMutex>& lock) {
   Task step = std::move(loose_.front());
   loose_.pop_front();
   waiting_.fetch_sub(1, std::memory_order_relaxed);
   lock.unlock();
   step();
   step = Task();
-  shared_->finish();
   lock.lock();
 }
 
@@ -472,6 +518,10 @@ void ThreadPoolWorkQueues::Pool::end() {
     const std::lock_guard lock(mutex_);
     isEnding_ = true;
     threads.swap(threads_);
+  }
+  {
+    const std::lock_guard lock(sleepMutex_);
+    mustNotSleep_ = true;
   }
   wake_.notify_all();
   for (std::thread& thread : threads) {
@@ -491,7 +541,29 @@ ThreadPoolWorkQueues::Batch::~Batch() {
   isRunning_ = true;
   if (strand_ != nullptr) pool_->runHere(std::move(strand_));
   currentBatch_ = nullptr;
+  for (const auto& gathered : gathered_) handOver(*gathered);
   for (const auto& pool : poolsToWake_) pool->wakeOne();
+}
+
+void ThreadPoolWorkQueues::Batch::gather(std::shared_ptr<Strand> strand,
+                                         const std::shared_ptr<Pool>& pool) {
+  const auto found =
+      std::find_if(gathered_.begin(), gathered_.end(),
+                   [&](const auto& gathered) { return gathered->pool == pool; });
+  Gathered& gathered = found != gathered_.end()
+                           ? **found
+                           : *gathered_.emplace_back(std::make_unique<Gathered>());
+  if (gathered.pool == nullptr) gathered.pool = pool;
+  if (gathered.count == 0) pool->shared().begin(/*count=*/1);
+  Line& line = strand->isLow() ? gathered.lowLine : gathered.line;
+  line.append(std::move(strand));
+  if (++gathered.count == kStrandsOfBatch) handOver(gathered);
+}
+
+void ThreadPoolWorkQueues::Batch::handOver(Gathered& gathered) {
+  if (gathered.count == 0) return;
+  gathered.pool->place(gathered);
+  gathered.pool->shared().finish(/*count=*/1);
 }
 
 /// The concurrent queue: the background pool without a strand.
@@ -539,15 +611,16 @@ ThreadPoolWorkQueues::~ThreadPoolWorkQueues() {
 
 std::shared_ptr<WorkQueue> ThreadPoolWorkQueues::makeSerialQueue(
     std::string_view label, QualityOfService qualityOfService, int relativePriority) {
-  const std::string* shared = nullptr;
-  {
-    const std::lock_guard lock(shared_->mutex);
-    const auto known = shared_->labels.find(label);
-    shared =
-        known != shared_->labels.end() ? &*known : &*shared_->labels.emplace(label).first;
-  }
-  return std::make_shared<Strand>(pools_[static_cast<std::size_t>(qualityOfService)],
-                                  *shared, relativePriority < 0);
+  const auto& pool = pools_[static_cast<std::size_t>(qualityOfService)];
+  const bool isLow = relativePriority < 0;
+  const std::lock_guard lock(kindsMutex_);
+  const auto known = std::find_if(kinds_.begin(), kinds_.end(), [&](const auto& kind) {
+    return kind->pool == pool && kind->isLow == isLow && kind->label == label;
+  });
+  if (known != kinds_.end()) return std::make_shared<Strand>(*known);
+  kinds_.push_back(
+      std::make_shared<const QueueKind>(QueueKind{std::string(label), pool, isLow}));
+  return std::make_shared<Strand>(kinds_.back());
 }
 
 ConcurrentQueue& ThreadPoolWorkQueues::backgroundQueue() { return *background_; }

@@ -4,6 +4,7 @@
 #include <chrono>
 #include <cstddef>
 #include <memory>
+#include <mutex>
 #include <utility>
 #include <vector>
 
@@ -54,7 +55,10 @@ class ThreadPoolWorkQueues final : public WorkQueueFactory {
 
  private:
   struct Shared;
+  struct QueueKind;
+  struct Gathered;
   class Background;
+  class Line;
   class Pool;
   class Strand;
 
@@ -63,6 +67,9 @@ class ThreadPoolWorkQueues final : public WorkQueueFactory {
   const std::shared_ptr<Shared> shared_;
   const std::array<std::shared_ptr<Pool>, 3> pools_;  // By quality of service.
   const std::unique_ptr<Background> background_;
+
+  std::mutex kindsMutex_;
+  std::vector<std::shared_ptr<const QueueKind>> kinds_;  // Few: labels are.
 };
 
 class ThreadPoolWorkQueues::Batch {
@@ -82,11 +89,15 @@ class ThreadPoolWorkQueues::Batch {
   }
   /// Other pools' threads find a whole batch when they wake up.
   void wakeLater(std::shared_ptr<Pool> pool) { poolsToWake_.push_back(std::move(pool)); }
+  /// Takes a strand for `pool`, to be handed over with others.
+  void gather(std::shared_ptr<Strand> strand, const std::shared_ptr<Pool>& pool);
+  void handOver(Gathered& gathered);
 
   bool isRunning_ = false;
   std::shared_ptr<Strand> strand_;
   std::shared_ptr<Pool> pool_;
   std::vector<std::shared_ptr<Pool>> poolsToWake_;
+  std::vector<std::unique_ptr<Gathered>> gathered_;
 };
 
 }  // namespace ostrel

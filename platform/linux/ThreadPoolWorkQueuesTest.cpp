@@ -7,6 +7,7 @@
 #include <sys/resource.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <atomic>
 #include <fstream>
 #include <mutex>
@@ -157,6 +158,88 @@ TEST_F(ThreadPoolWorkQueuesTest, ABatchTakesNoQueueThatAThreadRuns) {
   gate.open();
   ASSERT_TRUE(drain());
   EXPECT_NE(thread, std::this_thread::get_id());
+}
+
+// More strands than a batch hands over at once.
+TEST_F(ThreadPoolWorkQueuesTest, ABatchHandsOverAnyNumberOfQueues) {
+  constexpr std::size_t kQueues = 1000;
+  constexpr int kRounds = 3;
+  const auto server = makeQueue(QualityOfService::kUserInteractive);
+  std::vector<std::shared_ptr<WorkQueue>> sessions;
+  std::vector<std::vector<int>> ran(kQueues);
+  for (std::size_t i = 0; i < kQueues; ++i) {
+    sessions.push_back(makeQueue(QualityOfService::kUtility,
+                                 /*relativePriority=*/i % 3 == 0 ? -1 : 0));
+  }
+  {
+    const ThreadPoolWorkQueues::Batch batch;
+    for (int round = 0; round < kRounds; ++round) {
+      server->async([&, round] {
+        for (std::size_t i = 0; i < kQueues; ++i) {
+          sessions[i]->async([&ran, i, round] { ran[i].push_back(round); });
+        }
+      });
+    }
+  }
+  ASSERT_TRUE(drain());
+  EXPECT_THAT(ran, testing::Each(testing::ElementsAre(0, 1, 2)));
+}
+
+TEST_F(ThreadPoolWorkQueuesTest, ABatchHandsOverQueuesOfSeveralClasses) {
+  const auto server = makeQueue(QualityOfService::kUserInteractive);
+  const auto other = makeQueue(QualityOfService::kUserInteractive);
+  const auto session = makeQueue(QualityOfService::kUtility);
+  const auto background = makeQueue(QualityOfService::kBackground);
+  std::atomic<int> count{0};
+  {
+    const ThreadPoolWorkQueues::Batch batch;
+    server->async([&] {
+      for (const auto& queue : {other, session, background}) {
+        queue->async([&count] { ++count; });
+      }
+    });
+  }
+  ASSERT_TRUE(drain());
+  EXPECT_EQ(count, 3);
+}
+
+TEST_F(ThreadPoolWorkQueuesTest, WaitsForWhatABatchHasNotHandedOver) {
+  const auto server = makeQueue(QualityOfService::kUserInteractive);
+  const auto session = makeQueue();
+  Gate gate;
+  bool ran = false;
+  std::thread reader([&] {
+    const ThreadPoolWorkQueues::Batch batch;
+    server->async([&] {
+      session->async([&ran] { ran = true; });
+      gate.holdingStep()();
+    });
+  });
+  gate.waitUntilHolding();
+  EXPECT_FALSE(queues_->drain(steady_clock::now()));
+  gate.open();
+  EXPECT_TRUE(drain());
+  reader.join();
+  EXPECT_TRUE(ran);
+}
+
+// What a batch has gathered when the threads have ended is dropped, not lost.
+TEST_F(ThreadPoolWorkQueuesTest, ABatchDropsWhatNobodyWillRun) {
+  const auto server = makeQueue(QualityOfService::kUserInteractive);
+  std::vector<std::shared_ptr<WorkQueue>> sessions;
+  for (int i = 0; i < 100; ++i) sessions.push_back(makeQueue());
+  bool ran = false;
+  auto held = std::make_shared<int>(0);
+  const std::weak_ptr<int> watch = held;
+  {
+    const ThreadPoolWorkQueues::Batch batch;
+    server->async([&, held = std::move(held)]() mutable {
+      std::thread([this] { queues_.reset(); }).join();
+      for (const auto& session : sessions) session->async([&ran, held] { ran = true; });
+    });
+  }
+  EXPECT_TRUE(watch.expired());
+  EXPECT_FALSE(ran);
 }
 
 TEST_F(ThreadPoolWorkQueuesTest, RunsFourBackgroundStepsAtOnce) {
@@ -367,6 +450,27 @@ TEST_F(ThreadPoolWorkQueuesTest, KeepsItsTimerThread) {
   queues_->backgroundQueue().asyncAfter(std::chrono::milliseconds(1),
                                         [&ran] { ran.release(); });
   ran.acquire();
+}
+
+TEST_F(ThreadPoolWorkQueuesTest, RunsTheRestOfATurnBeforeWhatCameMeanwhile) {
+  constexpr int kSteps = 1000;  // Several turns.
+  Gate gate;
+  const auto queue = makeQueue();
+  const auto other = makeQueue();
+  std::vector<int> ran;
+  queue->async(gate.holdingStep());
+  gate.waitUntilHolding();
+  for (int i = 0; i < kSteps; ++i) {
+    queue->async([&, i] {
+      ran.push_back(i);
+      if (i % 100 == 0) queue->async([&ran, i] { ran.push_back(kSteps + i); });
+      other->async([] {});
+    });
+  }
+  gate.open();
+  ASSERT_TRUE(drain());
+  EXPECT_EQ(ran.size(), kSteps + 10u);
+  EXPECT_TRUE(std::is_sorted(ran.begin(), ran.end()));
 }
 
 TEST_F(ThreadPoolWorkQueuesTest, HoldsNoReferenceToAnIdleQueue) {
