@@ -34,6 +34,17 @@ void appendCategoryName(std::string& out, MessageCategory category);
 /// a name. Any thread.
 std::string_view MessageTypeName(MessageType type);
 
+/// What the service calls messages with the same codes. Codes with equal names share
+/// one.
+struct MessageNames {
+  std::string identifier;  // "Routing_RouteChange_Start"; messages are numbered by it.
+  std::string event;       // "com.orbisk.ostrel.Routing_RouteChange.Start".
+};
+
+/// The names of a message with these codes; made when they are first asked for, and
+/// kept as long as the process lives. There are fewer than 700. Any thread.
+const MessageNames& messageNames(MessageCategory category, MessageType type);
+
 /// What stands under "HostApplicationDisplayID", of whatever kind it is;
 /// "Unknown" when nothing does. Any thread.
 Value HostApplicationID(const Dictionary& userInfo);

@@ -168,7 +168,7 @@ void OstrelReportingServiceDelegate::registerClientStep(
   clients_.push_back(client);
   client->registration_ = ++registrations_;
   for (const auto& [reporterID, session] : client->clientReportingSessionMap_) {
-    indexSession(reporterID, *client);
+    indexSession(*session, *client);
   }
   client->clientStartDate_.set(platform_.clock->now());
   client->clientProcessName_.set(processName(pid));
@@ -190,7 +190,7 @@ void OstrelReportingServiceDelegate::removeClientStep(
                    [&](const auto& registered) { return registered.get() == &client; });
   if (found == clients_.end()) return;
   for (const auto& [reporterID, session] : client.clientReportingSessionMap_) {
-    forgetSession(reporterID, client);
+    sessionIndex_.remove(reporterID, client);
   }
   client.registration_ = 0;
   clients_.erase(found);
@@ -198,38 +198,30 @@ void OstrelReportingServiceDelegate::removeClientStep(
                      client.clientID());
 }
 
-void OstrelReportingServiceDelegate::indexSession(ReporterID reporterID,
+void OstrelReportingServiceDelegate::indexSession(OstrelReportingSession& session,
                                                   OstrelReportingServerInstance& client) {
   if (client.registration_ == 0) return;
-  auto& owners = clientsByReporter_[reporterID];
-  const auto place =
-      std::lower_bound(owners.begin(), owners.end(), &client,
-                       [](const auto* a, const auto* b) OSTREL_ON_QUEUE(serverQueueRole) {
-                         return a->registration_ < b->registration_;
-                       });
-  if (place == owners.end() || *place != &client) owners.insert(place, &client);
-}
-
-void OstrelReportingServiceDelegate::forgetSession(
-    ReporterID reporterID, OstrelReportingServerInstance& client) {
-  const auto found = clientsByReporter_.find(reporterID);
-  if (found == clientsByReporter_.end()) return;
-  std::erase(found->second, &client);
-  if (found->second.empty()) clientsByReporter_.erase(found);
+  sessionIndex_.enter(session.reporterID(), {client.registration_, &client, &session});
 }
 
 std::shared_ptr<OstrelReportingSession>
 OstrelReportingServiceDelegate::findReportingSessionForID(ReporterID reporterID) const {
+  OstrelReportingSession* const session =
+      findReportingSessionForID(reporterID, Borrowed());
+  return session != nullptr ? session->shared_from_this() : nullptr;
+}
+
+OstrelReportingSession* OstrelReportingServiceDelegate::findReportingSessionForID(
+    ReporterID reporterID, Borrowed) const {
   if (reporterID == kNoReporter || !reportingEnabled()) return nullptr;
-  const auto found = clientsByReporter_.find(reporterID);
-  if (found == clientsByReporter_.end()) {
+  const auto* const owner = sessionIndex_.find(reporterID);
+  if (owner == nullptr) {
     OSTREL_LOG_ERROR(logScope, "failed to find reporting session %lli", reporterID);
     return nullptr;
   }
-  const OstrelReportingServerInstance& client = *found->second.front();
   OSTREL_LOG_INFO(logScope, "found reporting session %lli for client %i", reporterID,
-                  client.clientID());
-  return client.ownSession(reporterID);
+                  owner->client->clientID());
+  return owner->session;
 }
 
 void OstrelReportingServiceDelegate::listenForDefaultsNotification() {
@@ -329,9 +321,10 @@ void OstrelReportingServerInstance::createReportingSession(ReporterID reporterID
 void OstrelReportingServerInstance::createStep(ReporterID reporterID,
                                                const BoolReply& reply) {
   master_->platform_.kernelTrace->trace(TraceCode::kCreate);
-  clientReportingSessionMap_[reporterID] = OstrelReportingSession::initWithID(
+  auto& session = clientReportingSessionMap_[reporterID];
+  session = OstrelReportingSession::initWithID(
       reporterID, /*processIdentifiers=*/{clientID_}, master_->platform_);
-  master_->indexSession(reporterID, *this);
+  master_->indexSession(*session, *this);
   OSTREL_LOG_DEFAULT(logScope, "session created for reporter %lli", reporterID);
   call(reply, true);
 }
@@ -458,7 +451,8 @@ void OstrelReportingServerInstance::sendMessageStep(
   } else {
     for (const ReporterID reporterID : *reportingIDs) {
       if (reporterID == kNoReporter) continue;
-      if (const auto session = master_->findReportingSessionForID(reporterID)) {
+      if (auto* const session = master_->findReportingSessionForID(
+              reporterID, OstrelReportingServiceDelegate::Borrowed())) {
         session->sendMessage(message, category, type, /*reply=*/nullptr);
       }
     }
@@ -540,7 +534,7 @@ void OstrelReportingServerInstance::destroyStep(ReporterID reporterID,
   if (reporterID == kNoReporter) return;
   if (const auto session = ownSession(reporterID)) {
     if (session->started()) session->stop();
-    master_->forgetSession(reporterID, *this);
+    master_->sessionIndex_.remove(reporterID, *this);
     clientReportingSessionMap_.erase(reporterID);
   }
   OSTREL_LOG_DEFAULT(logScope, "destroying %lli", reporterID);

@@ -12,6 +12,7 @@
 #include "Statistics/OstrelReportingTypes.h"
 #include "Statistics/Service/OstrelReportingServiceProtocol.h"
 #include "Statistics/Service/OstrelReportingSession.h"
+#include "Statistics/Service/OstrelReportingSessionIndex.h"
 #include "Statistics/Support/AtomicProperty.h"
 #include "platform/ChangeNotification.h"
 #include "platform/IPCListener.h"
@@ -94,21 +95,25 @@ class OstrelReportingServiceDelegate final
   std::optional<std::string> processName(ProcessID pid) const;
   void defaultsChangedStep(int token) OSTREL_ON_QUEUE(serverQueueRole);
 
-  // The index of registered clients by the IDs of their sessions, so that a
-  // look-up does not walk all clients.
-  void indexSession(ReporterID reporterID, OstrelReportingServerInstance& client)
+  // The same without a reference: the session lives as long as its client's map.
+  struct Borrowed {};
+  OstrelReportingSession* findReportingSessionForID(ReporterID reporterID, Borrowed) const
       OSTREL_ON_QUEUE(serverQueueRole);
-  void forgetSession(ReporterID reporterID, OstrelReportingServerInstance& client)
+
+  // The index of the sessions of registered clients, so that a look-up does not walk
+  // all clients.
+  void indexSession(OstrelReportingSession& session,
+                    OstrelReportingServerInstance& client)
       OSTREL_ON_QUEUE(serverQueueRole);
 
   // Constant after construction.
   const OstrelReportingPlatform& platform_;
   std::shared_ptr<OstrelReportingDriverUtility> driverUtility_;
 
-  // On the queue. Raw pointers are to members of `clients_`.
+  // On the queue. The index holds sessions of members of
+  // `clients_`.
   Clients clients_ OSTREL_GUARDED_BY(serverQueueRole);
-  std::unordered_map<ReporterID, std::vector<OstrelReportingServerInstance*>>
-      clientsByReporter_ OSTREL_GUARDED_BY(serverQueueRole);
+  OstrelReportingSessionIndex sessionIndex_ OSTREL_GUARDED_BY(serverQueueRole);
   std::uint64_t registrations_ OSTREL_GUARDED_BY(serverQueueRole) = 0;
 
   // Shared, each with its own lock.

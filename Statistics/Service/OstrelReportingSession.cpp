@@ -45,9 +45,6 @@ constexpr std::int32_t kDeviceClassWithoutOrientation = 6;
 constexpr std::string_view kHostApplicationKey = "HostApplicationDisplayID";
 constexpr std::uint32_t kLogDirectoryPermissions = 0777;
 
-// Room for the longest there is, so that an identifier is one allocation.
-constexpr std::size_t kLongestIdentifier = 64;
-
 // Kept: the backend gets the low half of the category, log lines get all of it.
 // [KeepsFullCategoryInLogAndLow16BitsOnTheWire]
 std::uint16_t categoryOnTheWire(MessageCategory category) {
@@ -101,14 +98,10 @@ OstrelReportingSession::OstrelReportingSession(Passkey, ReporterID reporterID,
                                                const OstrelReportingPlatform& platform)
     : platform_(platform),
       reporterID_(reporterID),
-      processIdentifiers_(std::move(processIdentifiers)),
       sessionReportingQueue_(platform.workQueues->makeSerialQueue(
           "com.orbisk.ostrel.reporting.session", QualityOfService::kUtility,
           /*relativePriority=*/0)),
-      userInfo_(std::make_shared<MutableDictionary>()),
-      serviceName_("unknown"),
-      aggregatedPayloadData_(
-          std::make_shared<AggregatedPayloadData>(*platform.entryStorage, reporterID)) {}
+      processIdentifiers_(std::move(processIdentifiers)) {}
 
 OstrelReportingSession::~OstrelReportingSession() {
   platform_.kernelTrace->trace(TraceCode::kSessionTeardown);
@@ -137,15 +130,13 @@ void OstrelReportingSession::setServiceTypeStep(ServiceType serviceType,
 }
 
 void OstrelReportingSession::applyServiceType(ServiceType serviceType) {
-  const std::string name(ServiceTypeName(serviceType));
   serviceType_.store(serviceType, std::memory_order_release);
-  serviceName_.set(name);
-  OSTREL_LOG_INFO(logScope, "setting service type %@", name);
+  OSTREL_LOG_INFO(logScope, "setting service type %@", ServiceTypeName(serviceType));
 }
 
 void OstrelReportingSession::setConfiguration(
     const std::optional<Dictionary>& configuration) {
-  if (configuration) userInfo_->merge(*configuration);
+  if (configuration) mutableUserInfo()->merge(*configuration);
 }
 
 void OstrelReportingSession::updateDefaults(std::optional<Dictionary> defaults) {
@@ -160,7 +151,7 @@ void OstrelReportingSession::updateDefaults(std::optional<Dictionary> defaults) 
 // [KeepsDefaultsMergeNeverRemoving]
 void OstrelReportingSession::updateDefaultsStep(
     const std::optional<Dictionary>& defaults) {
-  if (defaults) userInfo_->merge(*defaults);
+  if (defaults) mutableUserInfo()->merge(*defaults);
 }
 
 void OstrelReportingSession::startSync(bool sync) {
@@ -181,10 +172,9 @@ void OstrelReportingSession::startStep() {
     OSTREL_LOG_INFO(logScope, "%lli is already started", reporterID_);
     return;
   }
-  orientationCallbackID_.set(format("OstrelReportingService %lli", reporterID_));
-  startDate_.set(platform_.clock->now());
-  aggregatedPayloadData_.set(
-      std::make_shared<AggregatedPayloadData>(*platform_.entryStorage, reporterID_));
+  setOrientationCallbackID(format("OstrelReportingService %lli", reporterID_));
+  setStartDate(platform_.clock->now());
+  setAggregatedPayloadData(makeList());
   platform_.kernelTrace->trace(TraceCode::kSessionStart);
   if (serviceType() == kServiceTypeTest) {
     setStarted(/*started=*/true);
@@ -192,8 +182,8 @@ void OstrelReportingSession::startStep() {
   }
   const HierarchyToken token =
       platform_.telemetryBackend->makeHierarchyToken(/*parent=*/std::nullopt);
-  reportingAgentToken_.set(token);
-  reportingSession_.set(makeReportingSession(token));
+  set(&Details::reportingAgentToken, std::optional<HierarchyToken>(token));
+  set(&Details::reportingSession, makeReportingSession(token));
   findBackends();
 }
 
@@ -207,8 +197,8 @@ std::shared_ptr<TelemetrySession> OstrelReportingSession::makeReportingSession(
       {kTelvarSessionInfoHierarchyToken, token}};
   DictionaryBuilder userInfo;
   userInfo.set(kTelvarUserInfoClientName, kClientName);
-  userInfo.set(kTelvarUserInfoServiceName, serviceName_.get() + "_session");
-  userInfo.merge(userInfo_->snapshot());
+  userInfo.set(kTelvarUserInfoServiceName, serviceName() + "_session");
+  userInfo.merge(this->userInfo());
   return platform_.telemetryBackend->createSession(sessionInfo, userInfo.build(),
                                                    /*frameworksToCheck=*/{});
 }
@@ -216,7 +206,7 @@ std::shared_ptr<TelemetrySession> OstrelReportingSession::makeReportingSession(
 void OstrelReportingSession::findBackends() {
   const std::shared_ptr<OstrelReportingSession> self = shared_from_this();
   const std::shared_ptr<Condition> condition = platform_.conditions->makeCondition();
-  reportingSession_.get()->startConfiguration(
+  reportingSession()->startConfiguration(
       [self, condition](std::optional<Array> backends) {
         self->backendCallback(backends, *condition);
       });
@@ -244,7 +234,7 @@ void OstrelReportingSession::backendCallback(const std::optional<Array>& backend
 
 void OstrelReportingSession::finishStartStep(bool foundBackends) {
   if (!foundBackends) {
-    reportingSession_.set(nullptr);
+    set(&Details::reportingSession, std::shared_ptr<TelemetrySession>());
     setStarted(/*started=*/true);
   }
   if (shouldReportOrientation()) registerOrientationObservers();
@@ -265,7 +255,7 @@ void OstrelReportingSession::stopSync(bool sync) {
 
 void OstrelReportingSession::stopStep() {
   if (shouldReportOrientation()) {
-    const std::string id = orientationCallbackID_.get().value_or("");
+    const std::string id = orientationCallbackID().value_or("");
     platform_.orientationService->unregisterDeviceOrientationObserver(id);
     platform_.orientationService->unregisterInterfaceOrientationObserver(id);
   }
@@ -280,24 +270,24 @@ void OstrelReportingSession::stopStep() {
                 /*reply=*/nullptr);
   }
   if (serviceType() != kServiceTypeTest) flushStep();
-  if (const auto list = aggregatedPayloadData_.get()) {
+  if (const auto list = aggregatedPayloadData()) {
     const auto locked = list->lock();
-    aggregatedPayloadData_.set(nullptr);
+    setAggregatedPayloadData(nullptr);
   }
   setStarted(/*started=*/false);
   // Kept: a start is answered here, at each stop, and nowhere else.
   // [KeepsStartReplyAtEveryStop]
-  if (const BoolReply complete = transactionCompleteBlock_.get()) complete(true);
+  if (const BoolReply complete = transactionCompleteBlock()) complete(true);
 }
 
 // The flush is issued before the handle is released.
 void OstrelReportingSession::flushStep() {
-  if (const auto session = reportingSession_.get()) {
+  if (const auto session = reportingSession()) {
     session->flush([](const std::optional<ErrorObject>& error) {
       if (error) OSTREL_LOG_ERROR(logScope, "flush error %@", error->description);
     });
   }
-  reportingSession_.set(nullptr);
+  set(&Details::reportingSession, std::shared_ptr<TelemetrySession>());
 }
 
 void OstrelReportingSession::sendMessage(Dictionary message, MessageCategory category,
@@ -315,61 +305,68 @@ void OstrelReportingSession::sendMessage(Dictionary message, MessageCategory cat
   });
 }
 
+// One lock of the session's for all that the delivery needs of it.
 void OstrelReportingSession::deliverStep(const Dictionary& message,
                                          MessageCategory category, MessageType type,
                                          const ErrorReply& reply) {
-  const Dictionary userInfo = userInfo_->snapshot();
+  const auto [details, list, mutableUserInfo] = takeDelivery();
+  const Dictionary userInfo =
+      mutableUserInfo != nullptr ? mutableUserInfo->snapshot() : Dictionary();
   OstrelReportingTallyraBridge::handleEvent(platform_, &message, category, type,
                                             userInfo);
   OstrelReportingWattlogUtility::handleEvent(platform_, &message, category, type,
                                              userInfo);
   const Dictionary payload = SanitisedPayload(message);
-  aggregate(payload, category, type);
+  aggregate(payload, category, type, details, list.get());
   platform_.kernelTrace->trace(TraceCode::kMessageDelivery);
   if (started()) {
-    sendToBackend(message, payload, category, type, reply);
+    sendToBackend(message, payload, category, type, reply, details);
     return;
   }
   OSTREL_LOG_DEBUG(logScope, "session not started, will send as a single message");
   sendSingleMessage(platform_, payload, category, type, serviceType(), userInfo, reply);
 }
 
+OstrelReportingSession::Delivery OstrelReportingSession::takeDelivery() const {
+  const std::lock_guard lock(mutex_);
+  Details& made = details();
+  return {made, made.aggregatedPayloadData, userInfo_.get()};
+}
+
 // Kept: each entry is a dictionary of its own with the one identifier.
 // [KeepsOneElementEntriesOfMessages]
 void OstrelReportingSession::aggregate(const Dictionary& payload,
-                                       MessageCategory category, MessageType type) {
-  const std::string identifier = messageIdForCategory(category, type);
-  if (const auto list = aggregatedPayloadData_.get()) {
-    list->lock()->append(identifier, payload);
-  }
+                                       MessageCategory category, MessageType type,
+                                       Details& details, AggregatedPayloadData* list) {
+  const MessageIdentifier identifier =
+      details.messageTypeCounts.next(messageNames(category, type));
+  if (list != nullptr) list->lock()->append(identifier.text(), payload);
 }
 
 // Kept: the count belongs to the name; codes with equal names share it.
 // [KeepsSharedCounterForEqualNames]
 std::string OstrelReportingSession::messageIdForCategory(MessageCategory category,
                                                          MessageType type) {
-  std::string identifier;
-  identifier.reserve(kLongestIdentifier);
-  appendCategoryName(identifier, category);
-  identifier += '_';
-  identifier += MessageTypeName(type);
-  const std::int64_t count = ++messageTypeCounts_[identifier];
-  identifier += '_';
-  identifier += std::to_string(count);
-  return identifier;
+  Details& details = takeDelivery().details;
+  return std::string(details.messageTypeCounts.next(messageNames(category, type)).text());
+}
+
+std::map<std::string, std::int64_t> OstrelReportingSession::messageTypeCounts() const {
+  return takeDelivery().details.messageTypeCounts.byName();
 }
 
 void OstrelReportingSession::sendToBackend(const Dictionary& message,
                                            const Dictionary& payload,
                                            MessageCategory category, MessageType type,
-                                           const ErrorReply& reply) {
+                                           const ErrorReply& reply,
+                                           const Details& details) {
   if (serviceType() == kServiceTypeTest) {
     OSTREL_LOG_INFO(logScope, "transactions aren't allowed on this platform");
     call(reply, /*error=*/std::nullopt);
     return;
   }
-  const std::shared_ptr<TelemetrySession> session = reportingSession_.get();
-  if (!session) {
+  TelemetrySession* const session = details.reportingSession.get();
+  if (session == nullptr) {
     const ErrorObject error{std::string(kGeneralErrorDomain), /*code=*/-1,
                             "No valid TelvarSession"};
     OSTREL_LOG_ERROR(logScope, "%@", error.description);
@@ -406,13 +403,13 @@ void OstrelReportingSession::sendSingleMessage(
 }
 
 std::optional<Dictionary> OstrelReportingSession::createSummaryEventForSession() {
-  const auto list = aggregatedPayloadData_.get();
+  const auto list = aggregatedPayloadData();
   if (!list || list->lock()->empty()) return std::nullopt;
   const auto delivered = list->lock()->snapshot();
   Dictionary summary = summaryEvent(serviceType(), delivered);
   // Kept: the user info goes in at the front on every build, at every call, and
   // after the summary is made. [KeepsUserInfoInsertedAtEverySummary]
-  list->lock()->insertFront(userInfo_);
+  list->lock()->insertFront(mutableUserInfo());
   if (IsInternalBuild(platform_)) writeSessionLog(*list);
   return summary;
 }
@@ -441,7 +438,7 @@ void OstrelReportingSession::writeSessionLog(const AggregatedPayloadData& list) 
 
   const std::string name =
       sessionLogFileName(*platform_.clock, platform_.clock->now(),
-                         userInfo_->snapshot().get(kHostApplicationKey), serviceType());
+                         userInfo().get(kHostApplicationKey), serviceType());
   const Success written =
       platform_.fileSystem->writeFileAtomically(directory, name, json.value);
   if (!written.succeeded && written.error) error = written.error;
@@ -449,7 +446,7 @@ void OstrelReportingSession::writeSessionLog(const AggregatedPayloadData& list) 
 }
 
 bool OstrelReportingSession::shouldReportOrientation() const {
-  if (!orientationCallbackID_.get()) return false;
+  if (!orientationCallbackID()) return false;
   if (!IsInternalBuild(platform_)) return false;
   const ServiceType type = serviceType();
   if (type != kServiceTypeLongFormAudio && type != kServiceTypeTelephony) return false;
@@ -459,7 +456,7 @@ bool OstrelReportingSession::shouldReportOrientation() const {
 // The callbacks hold the session until they are unregistered.
 void OstrelReportingSession::registerOrientationObservers() {
   const std::shared_ptr<OstrelReportingSession> self = shared_from_this();
-  const std::string id = orientationCallbackID_.get().value_or("");
+  const std::string id = orientationCallbackID().value_or("");
   platform_.orientationService->registerDeviceOrientationObserver(
       id, [self](OrientationService::OrientationCode code) {
         self->orientationChanged("device", code);
@@ -473,18 +470,55 @@ void OstrelReportingSession::registerOrientationObservers() {
 void OstrelReportingSession::orientationChanged(
     std::string_view mode, OrientationService::OrientationCode code) {
   const std::string name = platform_.orientationService->orientationName(code);
-  const Date start = startDate_.get().value_or(Date{});
+  const Date start = startDate().value_or(Date{});
   const double time = platform_.clock->now().secondsSince1970 - start.secondsSince1970;
   OSTREL_LOG_DEBUG(logScope,
                    "Orientation handler callback mode=%@ orientation=\"%@\" app=\"%@\", "
                    "time=%f, id=\"%@\"",
-                   mode, name, userInfo_->snapshot().get(kHostApplicationKey), time,
-                   orientationCallbackID_.get());
+                   mode, name, userInfo().get(kHostApplicationKey), time,
+                   orientationCallbackID());
   // Kept: name and time stand in one entry. [KeepsTwoElementEntriesOfOrientation]
   const std::string key = std::string(mode) + "_orientation";
-  if (const auto list = aggregatedPayloadData_.get()) {
+  if (const auto list = aggregatedPayloadData()) {
     list->lock()->append(Dictionary{{key, name}, {key + "_time", time}});
   }
+}
+
+std::shared_ptr<AggregatedPayloadData> OstrelReportingSession::makeList() const {
+  return std::make_shared<AggregatedPayloadData>(*platform_.entryStorage, reporterID_);
+}
+
+// A session that was never started has a list too.
+OstrelReportingSession::Details& OstrelReportingSession::details() const {
+  if (details_ == nullptr) {
+    details_ = std::make_unique<Details>();
+    details_->aggregatedPayloadData = makeList();
+  }
+  return *details_;
+}
+
+std::shared_ptr<AggregatedPayloadData> OstrelReportingSession::aggregatedPayloadData()
+    const {
+  return takeDelivery().list;
+}
+
+std::shared_ptr<MutableDictionary> OstrelReportingSession::mutableUserInfo() {
+  const std::lock_guard lock(mutex_);
+  if (userInfo_ == nullptr) userInfo_ = std::make_shared<MutableDictionary>();
+  return userInfo_;
+}
+
+Dictionary OstrelReportingSession::userInfo() const {
+  const MutableDictionary* made;
+  {
+    const std::lock_guard lock(mutex_);
+    made = userInfo_.get();
+  }
+  return made != nullptr ? made->snapshot() : Dictionary();
+}
+
+std::string OstrelReportingSession::serviceName() const {
+  return std::string(ServiceTypeName(serviceType()));
 }
 
 std::string OstrelReportingSession::description() const {

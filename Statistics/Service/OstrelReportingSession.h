@@ -5,19 +5,18 @@
 #include <cstdint>
 #include <map>
 #include <memory>
+#include <mutex>
 #include <optional>
 #include <string>
 #include <vector>
 
-#include "Statistics/OstrelReportingDriverUtility.h"
 #include "Statistics/OstrelReportingTypes.h"
-#include "Statistics/Service/OstrelReportingAggregatedPayloads.h"
-#include "Statistics/Support/AtomicProperty.h"
+#include "Statistics/Service/OstrelReportingSessionDetails.h"
 #include "Statistics/Support/MutableDictionary.h"
 #include "platform/Condition.h"
-#include "platform/IPCListener.h"
 #include "platform/OrientationService.h"
 #include "platform/OstrelReportingPlatform.h"
+#include "platform/SmallMutex.h"
 #include "platform/TelemetryBackend.h"
 #include "platform/WorkQueue.h"
 
@@ -41,6 +40,8 @@ namespace ostrel {
 /// then lost.
 class OstrelReportingSession final
     : public std::enable_shared_from_this<OstrelReportingSession> {
+  using Details = OstrelReportingSessionDetails;
+
  public:
   /// Makes a session that is not started. `processIdentifiers` are the pids of
   /// the client processes that own it. `platform` outlives the session.
@@ -108,52 +109,50 @@ class OstrelReportingSession final
   bool started() const { return started_.load(std::memory_order_acquire); }
   void setStarted(bool started) { started_.store(started, std::memory_order_release); }
   ServiceType serviceType() const { return serviceType_.load(std::memory_order_acquire); }
-  std::string serviceName() const { return serviceName_.get(); }
+  std::string serviceName() const;
   ReporterID reporterID() const { return reporterID_; }
-  const std::vector<ProcessID>& processIdentifiers() const { return processIdentifiers_; }
-  Dictionary userInfo() const { return userInfo_->snapshot(); }
+  std::vector<ProcessID> processIdentifiers() const { return processIdentifiers_.all(); }
+  Dictionary userInfo() const;
   const std::shared_ptr<WorkQueue>& sessionReportingQueue() const {
     return sessionReportingQueue_;
   }
   std::shared_ptr<const DriverSnapShot> driverSnapShot() const {
-    return driverSnapShot_.get();
+    return get(&Details::driverSnapShot);
   }
   void setDriverSnapShot(std::shared_ptr<const DriverSnapShot> snapShot) {
-    driverSnapShot_.set(std::move(snapShot));
+    set(&Details::driverSnapShot, std::move(snapShot));
   }
-  BoolReply transactionCompleteBlock() const { return transactionCompleteBlock_.get(); }
+  BoolReply transactionCompleteBlock() const {
+    return get(&Details::transactionCompleteBlock);
+  }
   /// Called with true as the last step of every stop of the started session;
   /// may be empty.
   void setTransactionCompleteBlock(BoolReply block) {
-    transactionCompleteBlock_.set(std::move(block));
+    set(&Details::transactionCompleteBlock, std::move(block));
   }
   /// None from a stop until the next start.
-  std::shared_ptr<AggregatedPayloadData> aggregatedPayloadData() const {
-    return aggregatedPayloadData_.get();
-  }
+  std::shared_ptr<AggregatedPayloadData> aggregatedPayloadData() const;
   void setAggregatedPayloadData(std::shared_ptr<AggregatedPayloadData> list) {
-    aggregatedPayloadData_.set(std::move(list));
+    set(&Details::aggregatedPayloadData, std::move(list));
   }
   std::optional<std::string> orientationCallbackID() const {
-    return orientationCallbackID_.get();
+    return get(&Details::orientationCallbackID);
   }
   void setOrientationCallbackID(std::optional<std::string> id) {
-    orientationCallbackID_.set(std::move(id));
+    set(&Details::orientationCallbackID, std::move(id));
   }
-  std::optional<Date> startDate() const { return startDate_.get(); }
-  void setStartDate(std::optional<Date> date) { startDate_.set(date); }
+  std::optional<Date> startDate() const { return get(&Details::startDate); }
+  void setStartDate(std::optional<Date> date) { set(&Details::startDate, date); }
   std::shared_ptr<TelemetrySession> reportingSession() const {
-    return reportingSession_.get();
+    return get(&Details::reportingSession);
   }
   std::optional<HierarchyToken> reportingAgentToken() const {
-    return reportingAgentToken_.get();
+    return get(&Details::reportingAgentToken);
   }
 
   /// How many messages had each name, without their numbers.
-  const std::map<std::string, std::int64_t>& messageTypeCounts() const
-      OSTREL_ON_QUEUE(*sessionReportingQueue_) {
-    return messageTypeCounts_;
-  }
+  std::map<std::string, std::int64_t> messageTypeCounts() const
+      OSTREL_ON_QUEUE(*sessionReportingQueue_);
 
   /// "<OstrelReportingSession: 42>".
   std::string description() const;
@@ -167,6 +166,30 @@ class OstrelReportingSession final
                          const OstrelReportingPlatform& platform);
 
  private:
+  // Properties of `Details`. Their lock is held for a copy or a swap; what is
+  // replaced is torn down after it, as the argument.
+  template <typename T>
+  T get(T Details::*property) const {
+    const std::lock_guard lock(mutex_);
+    return details_ != nullptr ? (*details_).*property : T();
+  }
+  template <typename T>
+  void set(T Details::*property, T value) {
+    const std::lock_guard lock(mutex_);
+    std::swap(details().*property, value);
+  }
+  Details& details() const;  // With the lock held.
+  std::shared_ptr<AggregatedPayloadData> makeList() const;
+
+  /// What a delivery needs of the properties.
+  struct Delivery {
+    Details& details;
+    std::shared_ptr<AggregatedPayloadData> list;
+    const MutableDictionary* userInfo;  // May be none.
+  };
+  Delivery takeDelivery() const;
+  std::shared_ptr<MutableDictionary> mutableUserInfo();
+
   void setServiceTypeStep(ServiceType serviceType, ServiceType before)
       OSTREL_ON_QUEUE(*sessionReportingQueue_);
   void applyServiceType(ServiceType serviceType) OSTREL_ON_QUEUE(*sessionReportingQueue_);
@@ -182,11 +205,12 @@ class OstrelReportingSession final
   void flushStep() OSTREL_ON_QUEUE(*sessionReportingQueue_);
   void deliverStep(const Dictionary& message, MessageCategory category, MessageType type,
                    const ErrorReply& reply) OSTREL_ON_QUEUE(*sessionReportingQueue_);
-  void aggregate(const Dictionary& payload, MessageCategory category, MessageType type)
+  void aggregate(const Dictionary& payload, MessageCategory category, MessageType type,
+                 Details& details, AggregatedPayloadData* list)
       OSTREL_ON_QUEUE(*sessionReportingQueue_);
   void sendToBackend(const Dictionary& message, const Dictionary& payload,
-                     MessageCategory category, MessageType type, const ErrorReply& reply)
-      OSTREL_ON_QUEUE(*sessionReportingQueue_);
+                     MessageCategory category, MessageType type, const ErrorReply& reply,
+                     const Details& details) OSTREL_ON_QUEUE(*sessionReportingQueue_);
   void writeSessionLog(const AggregatedPayloadData& list);
   void registerOrientationObservers();
   void orientationChanged(std::string_view mode,
@@ -195,26 +219,18 @@ class OstrelReportingSession final
   // Constant after construction.
   const OstrelReportingPlatform& platform_;
   const ReporterID reporterID_;
-  const std::vector<ProcessID> processIdentifiers_;
   const std::shared_ptr<WorkQueue> sessionReportingQueue_;
-  const std::shared_ptr<MutableDictionary> userInfo_;
 
-  // On the queue.
-  std::map<std::string, std::int64_t> messageTypeCounts_
-      OSTREL_GUARDED_BY(*sessionReportingQueue_);
-
-  // Shared, each with its own lock. The list carries its own monitor:
-  // orientation callbacks append from their own thread.
+  // Shared. One lock for all properties that are not scalars: what a delivery needs
+  // of them it takes at once. The pointers are set once and stay.
+  mutable SmallMutex mutex_;
   std::atomic<bool> started_{false};  // The backend's thread sets it too.
   std::atomic<ServiceType> serviceType_{kServiceTypeUnknown};
-  AtomicProperty<std::string> serviceName_;
-  AtomicProperty<std::shared_ptr<const DriverSnapShot>> driverSnapShot_;
-  AtomicProperty<BoolReply> transactionCompleteBlock_;
-  AtomicProperty<std::shared_ptr<AggregatedPayloadData>> aggregatedPayloadData_;
-  AtomicProperty<std::optional<std::string>> orientationCallbackID_;
-  AtomicProperty<std::optional<Date>> startDate_;
-  AtomicProperty<std::shared_ptr<TelemetrySession>> reportingSession_;
-  AtomicProperty<std::optional<HierarchyToken>> reportingAgentToken_;
+  mutable std::unique_ptr<Details> details_;
+  std::shared_ptr<MutableDictionary> userInfo_;  // None until there is an entry.
+
+  const OstrelReportingProcessIdentifiers
+      processIdentifiers_;  // Constant, and last: seldom needed.
 };
 
 }  // namespace ostrel

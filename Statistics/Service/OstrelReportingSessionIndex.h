@@ -1,0 +1,66 @@
+#pragma once
+
+#include <cstddef>
+#include <cstdint>
+#include <map>
+#include <vector>
+
+#include "Statistics/OstrelReportingTypes.h"
+
+namespace ostrel {
+
+class OstrelReportingServerInstance;
+class OstrelReportingSession;
+
+/// Finds the session of an ID among those of all registered clients.
+///
+/// Each message asks it, so that it is made for that: a row of slots in which an ID is
+/// found with one look at memory nearly always, whatever the number of sessions. That
+/// several clients have a session under one ID is rare; all but the first of them stand
+/// aside.
+class OstrelReportingSessionIndex {
+ public:
+  /// A client and its session under the ID. Both are the client's to keep alive.
+  struct Owner {
+    std::uint64_t registration;  // Of the client; the lowest goes first.
+    OstrelReportingServerInstance* client;
+    OstrelReportingSession* session;
+  };
+
+  OstrelReportingSessionIndex();
+
+  /// Enters `owner`, in the place of what its client had under the ID.
+  void enter(ReporterID reporterID, const Owner& owner);
+
+  /// Takes what the client has under the ID out; nothing happens when it is not there.
+  void remove(ReporterID reporterID, const OstrelReportingServerInstance& client);
+
+  /// The owner that registered first; none without any. Valid until the next change.
+  const Owner* find(ReporterID reporterID) const {
+    for (std::size_t at = home(reporterID);; at = next(at)) {
+      const Slot& slot = slots_[at];
+      if (slot.first.session == nullptr) return nullptr;
+      if (slot.reporterID == reporterID) return &slot.first;
+    }
+  }
+
+ private:
+  struct Slot {
+    ReporterID reporterID{};
+    Owner first{};  // Without a session: nobody's.
+  };
+
+  std::size_t home(ReporterID reporterID) const;
+  std::size_t next(std::size_t at) const { return (at + 1) & (slots_.size() - 1); }
+  std::size_t slotOf(ReporterID reporterID) const;
+  void vacate(std::size_t at);
+  void resize(std::size_t slots);
+
+  // IDs are the clients' choice. Which of them meet in a slot nobody can foresee.
+  const std::uint64_t seed_;
+  std::size_t used_ = 0;
+  std::vector<Slot> slots_;                               // A power of two.
+  std::map<ReporterID, std::vector<Owner>> laterOwners_;  // By registration.
+};
+
+}  // namespace ostrel
