@@ -286,6 +286,24 @@ TEST_F(StoreTest, RefusesMessagesBeyondTheBound) {
   EXPECT_TRUE(session->sendMessage(1, 1, payload).succeeded);
 }
 
+TEST_F(StoreTest, CountsOnlyTheOwnBytesOfAMessageThatSharesItsBuffer) {
+  StoreOptions options;
+  options.queuedBytes = 4096;
+  options.commitWindow = std::chrono::hours(1);
+  open(options);
+  auto session = makeSession(1);
+  std::string burst(64 * 1024, '\0');
+  const auto own = kPayload.value().bytes();
+  std::copy(own.begin(), own.end(), burst.begin());
+  const ValueBuffer shared = ValueBuffer::copyOf(
+      {reinterpret_cast<const std::uint8_t*>(burst.data()), burst.size()});
+  const Dictionary payload(shared, shared.data());
+
+  EXPECT_TRUE(session->sendMessage(1, 1, payload).succeeded);
+  EXPECT_TRUE(session->sendMessage(1, 1, payload).succeeded);
+  EXPECT_EQ(flushed(*session), std::nullopt);
+}
+
 TEST_F(StoreTest, IsDurableWithinTheWindowWithoutAFlush) {
   open(StoreOptions());
   settle();

@@ -174,7 +174,7 @@ StoreWriter::Result StoreWriter::write(StoreOperation& operation, AnalyticsEvent
       OSTREL_LOG_ERROR(processLogScope, "no payload for the analytics event %@",
                        event.name);
     }
-    if (event.payload) uncommittedBytes_ += event.payload->owner().size();
+    if (event.payload) uncommittedBytes_ += event.payload->value().bytes().size();
   }
   if (!event.payload) return std::nullopt;
   AnalyticsRow row;
