@@ -7,6 +7,7 @@
 #include "platform/linux/DirectoryFileSystem.h"
 #include "platform/linux/EtcDeviceInfo.h"
 #include "platform/linux/FileEntryStorage.h"
+#include "platform/linux/Heap.h"
 #include "platform/linux/InotifyChangeNotification.h"
 #include "platform/linux/JSONTextSerialization.h"
 #include "platform/linux/JSONUserDefaults.h"
@@ -57,6 +58,7 @@ struct LinuxPlatform::Bindings {
 };
 
 Outcome<std::unique_ptr<LinuxPlatform>> LinuxPlatform::open() {
+  keepHeapForBursts();
   const std::shared_ptr<JournalLog> log = JournalLog::open();
   setSystemLog(log);
   registerLogScope(processLogScope);

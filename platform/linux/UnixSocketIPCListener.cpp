@@ -14,6 +14,7 @@
 #include <utility>
 
 #include "platform/Logging.h"
+#include "platform/linux/Heap.h"
 #include "platform/linux/ProcProcessInfo.h"
 #include "platform/linux/SystemdService.h"
 #include "platform/linux/ThreadPoolWorkQueues.h"
@@ -33,13 +34,17 @@ constexpr PeerConnection::ID kFirstConnection = 3;
 // Many frames a system call; what is held back of it stays small.
 constexpr std::size_t kReadBytes = 64 * 1024;
 constexpr int kMostEvents = 64;
+
+// After so many rounds of work, and so much time without any, memory is given back.
+constexpr std::size_t kRoundsOfBurst = 64;
+constexpr std::chrono::milliseconds kQuietAfterBurst{500};
 constexpr int kMostAccepted = 64;
 
-void watchDescriptor(int epoll, int descriptor, std::uint64_t id) {
+bool watchDescriptor(int epoll, int descriptor, std::uint64_t id) {
   epoll_event event{};
   event.events = EPOLLIN;
   event.data.u64 = id;
-  ::epoll_ctl(epoll, EPOLL_CTL_ADD, descriptor, &event);
+  return ::epoll_ctl(epoll, EPOLL_CTL_ADD, descriptor, &event) == 0;
 }
 
 PeerIdentity identityOf(int socket) {
@@ -72,9 +77,14 @@ Outcome<std::unique_ptr<UnixSocketIPCListener>> UnixSocketIPCListener::open(
     const std::string& path, std::shared_ptr<PeerRegistry> peers, ListenerLimits limits) {
   auto socket = ServiceSocket::open(path);
   if (!socket.value) return {std::nullopt, std::move(socket.error)};
-  return {std::unique_ptr<UnixSocketIPCListener>(new UnixSocketIPCListener(
-              *std::move(socket.value), std::move(peers), limits)),
-          std::nullopt};
+  auto listener = std::unique_ptr<UnixSocketIPCListener>(
+      new UnixSocketIPCListener(*std::move(socket.value), std::move(peers), limits));
+  if (!listener->watchOwnDescriptors()) {
+    return {std::nullopt,
+            ErrorObject{std::string(kPOSIXErrorDomain), ENOMEM,
+                        "no descriptors or no memory are left to wait for clients"}};
+  }
+  return {std::move(listener), std::nullopt};
 }
 
 UnixSocketIPCListener::UnixSocketIPCListener(ServiceSocket socket,
@@ -85,10 +95,12 @@ UnixSocketIPCListener::UnixSocketIPCListener(ServiceSocket socket,
       peers_(std::move(peers)),
       epoll_(::epoll_create1(EPOLL_CLOEXEC)),
       service_(new ServiceAccount{Share(limits.sessions), Share(limits.keptBytes)}),
-      nextID_(kFirstConnection) {
-  watchDescriptor(epoll_.get(), socket_.descriptor(), kSocketEvent);
-  watchDescriptor(epoll_.get(), waker_->descriptor(), kWakerEvent);
-  watchDescriptor(epoll_.get(), signals_.descriptor(), kSignalEvent);
+      nextID_(kFirstConnection) {}
+
+bool UnixSocketIPCListener::watchOwnDescriptors() {
+  return watchDescriptor(epoll_.get(), socket_.descriptor(), kSocketEvent) &&
+         watchDescriptor(epoll_.get(), waker_->descriptor(), kWakerEvent) &&
+         watchDescriptor(epoll_.get(), signals_.descriptor(), kSignalEvent);
 }
 
 UnixSocketIPCListener::~UnixSocketIPCListener() = default;
@@ -102,6 +114,10 @@ void UnixSocketIPCListener::resume() {
     const int count = ::epoll_wait(epoll_.get(), events.data(), kMostEvents,
                                    mayWait ? millisecondsToWait(Clock::now()) : 0);
     waker_->endWait();
+    if (count > 0) {
+      lastWork_ = Clock::now();
+      ++roundsSinceTidying_;
+    }
     {
       const ThreadPoolWorkQueues::Batch requests;
       for (int i = 0; i < count; ++i) {
@@ -283,8 +299,12 @@ void UnixSocketIPCListener::logMisuse(std::uint32_t user, std::string_view what)
 
 void UnixSocketIPCListener::handleDeadlines(Clock::time_point now) {
   if (isBackedOff_ && now >= acceptAgainAt_) {
-    isBackedOff_ = false;
-    watchDescriptor(epoll_.get(), socket_.descriptor(), kSocketEvent);
+    isBackedOff_ = !watchDescriptor(epoll_.get(), socket_.descriptor(), kSocketEvent);
+    acceptAgainAt_ = now + limits::kAcceptBackOff;
+  }
+  if (roundsSinceTidying_ >= kRoundsOfBurst && now >= lastWork_ + kQuietAfterBurst) {
+    roundsSinceTidying_ = 0;
+    giveBackHeap();
   }
   if (impatient_.empty()) return;
   std::vector<PeerConnection::ID> waiting;
@@ -302,6 +322,9 @@ void UnixSocketIPCListener::handleDeadlines(Clock::time_point now) {
 int UnixSocketIPCListener::millisecondsToWait(Clock::time_point now) const {
   Clock::time_point first = Clock::time_point::max();
   if (isBackedOff_) first = acceptAgainAt_;
+  if (roundsSinceTidying_ >= kRoundsOfBurst) {
+    first = std::min(first, lastWork_ + kQuietAfterBurst);
+  }
   for (const PeerConnection::ID id : impatient_) {
     const auto found = connections_.find(id);
     if (found == connections_.end()) continue;

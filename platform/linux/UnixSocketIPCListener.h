@@ -57,6 +57,7 @@ class UnixSocketIPCListener final : public IPCListener {
 
   void acceptAll();
   void accept(FileDescriptor socket);
+  bool watchOwnDescriptors();
   bool isWithinLimits(const PeerIdentity& peer, int socket);
   void handleEvent(std::uint64_t id, std::uint32_t events);
   void handleWork();
@@ -90,6 +91,8 @@ class UnixSocketIPCListener final : public IPCListener {
   LoopWaker::Work work_;
   std::vector<std::uint8_t> buffer_;
   Clock::time_point acceptAgainAt_{};  // Set while accepting is backed off.
+  Clock::time_point lastWork_{};
+  std::size_t roundsSinceTidying_ = 0;
   bool isBackedOff_ = false;
   bool isStopping_ = false;
 };

@@ -1,0 +1,46 @@
+#include "platform/linux/Heap.h"
+
+#include <gtest/gtest.h>
+#include <unistd.h>
+
+#include <cstddef>
+#include <cstring>
+#include <fstream>
+#include <memory>
+#include <vector>
+
+namespace ostrel {
+namespace {
+
+std::size_t residentBytes() {
+  std::size_t all = 0;
+  std::size_t resident = 0;
+  std::ifstream("/proc/self/statm") >> all >> resident;
+  return resident * static_cast<std::size_t>(::sysconf(_SC_PAGESIZE));
+}
+
+TEST(Heap, GivesBackWhatABurstTook) {
+#if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__)
+  GTEST_SKIP() << "the sanitizers bring a heap of their own";
+#endif
+  constexpr std::size_t kPieces = 40'000;
+  constexpr std::size_t kPieceBytes = 1000;
+  keepHeapForBursts();
+  std::vector<std::unique_ptr<char[]>> pieces(kPieces);
+  const std::size_t before = residentBytes();
+  for (auto& piece : pieces) {
+    piece.reset(new char[kPieceBytes]);
+    std::memset(piece.get(), 1, kPieceBytes);
+  }
+  const std::unique_ptr<char[]> last(new char[kPieceBytes]);  // The heap cannot shrink.
+  const std::size_t during = residentBytes();
+  for (auto& piece : pieces) piece.reset();
+  giveBackHeap();
+  const std::size_t after = residentBytes();
+
+  EXPECT_GT(during, before + kPieces * kPieceBytes / 2);
+  EXPECT_LT(after, before + kPieces * kPieceBytes / 4);
+}
+
+}  // namespace
+}  // namespace ostrel
