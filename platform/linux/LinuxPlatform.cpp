@@ -1,7 +1,9 @@
 #include "platform/linux/LinuxPlatform.h"
 
+#include <atomic>
 #include <future>
 #include <utility>
+#include <vector>
 
 #include "platform/Logging.h"
 #include "platform/linux/DirectoryFileSystem.h"
@@ -14,6 +16,7 @@
 #include "platform/linux/JournalLog.h"
 #include "platform/linux/LinuxOrientationService.h"
 #include "platform/linux/MappedChannelReporting.h"
+#include "platform/linux/MisuseLog.h"
 #include "platform/linux/PeerRegistry.h"
 #include "platform/linux/Places.h"
 #include "platform/linux/ProcProcessInfo.h"
@@ -43,18 +46,60 @@ void awaitStore(Store& store, std::chrono::steady_clock::time_point deadline) {
 
 }  // namespace
 
+// How soon the status shows what clients were cut short of.
+constexpr std::chrono::seconds kStatusDelay{1};
+
+/// Says to the store that counts have changed, however many do, once in a while.
+class StatusNotice : public std::enable_shared_from_this<StatusNotice> {
+ public:
+  explicit StatusNotice(std::shared_ptr<TimerThread> timers)
+      : timers_(std::move(timers)) {}
+
+  void setStore(const std::shared_ptr<Store>& store) { store_ = store; }
+
+  /// Any thread, once there is a store.
+  void give() {
+    if (isGiven_.exchange(true)) return;
+    timers_->scheduleAfter(kStatusDelay, [self = shared_from_this()] {
+      self->isGiven_ = false;
+      if (const auto store = self->store_.lock()) store->noteStatusChange();
+    });
+  }
+
+ private:
+  const std::shared_ptr<TimerThread> timers_;
+  std::weak_ptr<Store> store_;
+  std::atomic<bool> isGiven_{false};
+};
+
 // In the order of making; what is below may use what is above. The socket comes
 // first: a second service must not touch the store of the first.
 struct LinuxPlatform::Bindings {
   std::shared_ptr<JournalLog> log;
   std::shared_ptr<PeerRegistry> peers;
+  std::shared_ptr<TimerThread> timers;
+  std::shared_ptr<StatusNotice> notice;
+  std::shared_ptr<MisuseLog> misuse;
   std::unique_ptr<UnixSocketIPCListener> listener;
-  std::shared_ptr<TimerThread> timers = std::make_shared<TimerThread>();
   std::shared_ptr<ThreadPoolWorkQueues> queues =
       std::make_shared<ThreadPoolWorkQueues>(timers);
   std::shared_ptr<FileEntryStorage> entries =
       std::make_shared<FileEntryStorage>(stateDirectory());
-  std::shared_ptr<Store> store = Store::open(storePath());
+  std::shared_ptr<Store> store = Store::open(storePath(), storeOptions());
+
+  StoreOptions storeOptions() const {
+    StoreOptions options;
+    options.otherCounts = [misuse = misuse, entries = entries] {
+      std::vector<StatusCount> counts;
+      const MisuseLog::Counts refused = misuse->counts();
+      for (std::size_t i = 0; i < MisuseLog::kKinds; ++i) {
+        counts.push_back({MisuseLog::keyOf(static_cast<MisuseLog::Kind>(i)), refused[i]});
+      }
+      counts.push_back({"entries_refused", entries->refusedEntries()});
+      return counts;
+    };
+    return options;
+  }
 };
 
 Outcome<std::unique_ptr<LinuxPlatform>> LinuxPlatform::open() {
@@ -63,10 +108,15 @@ Outcome<std::unique_ptr<LinuxPlatform>> LinuxPlatform::open() {
   setSystemLog(log);
   registerLogScope(processLogScope);
   const auto peers = std::make_shared<PeerRegistry>();
-  auto listener = UnixSocketIPCListener::open(reportingSocketPath(), peers);
+  const auto timers = std::make_shared<TimerThread>();
+  const auto notice = std::make_shared<StatusNotice>(timers);
+  const auto misuse = std::make_shared<MisuseLog>([notice] { notice->give(); });
+  auto listener =
+      UnixSocketIPCListener::open(reportingSocketPath(), peers, ListenerLimits(), misuse);
   if (!listener.value) return {std::nullopt, std::move(listener.error)};
-  auto bindings =
-      std::unique_ptr<Bindings>(new Bindings{log, peers, *std::move(listener.value)});
+  auto bindings = std::unique_ptr<Bindings>(
+      new Bindings{log, peers, timers, notice, misuse, *std::move(listener.value)});
+  notice->setStore(bindings->store);
   return {std::unique_ptr<LinuxPlatform>(new LinuxPlatform(std::move(bindings))),
           std::nullopt};
 }

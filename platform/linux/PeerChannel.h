@@ -38,6 +38,10 @@ class PeerChannel final : public PayloadAccount {
   bool keep(std::size_t bytes) noexcept override { return user_->keep(bytes); }
   void discard(std::size_t bytes) noexcept override { user_->discard(bytes); }
 
+  /// The loop's: one more session of the client's user. False: it has as many as it
+  /// may have, or the service has.
+  bool takeSession() noexcept { return user_->takeSession(); }
+  void giveSessions(std::size_t count) noexcept { user_->giveSessions(count); }
   /// Of all users.
   std::size_t sessionsOfAll() const { return user_->sessionsOfAll(); }
 

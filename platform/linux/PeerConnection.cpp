@@ -56,12 +56,13 @@ std::size_t wholeFrames(std::span<const std::uint8_t> bytes, std::size_t mostByt
 
 PeerConnection::PeerConnection(ID id, FileDescriptor socket, PeerIdentity peer,
                                std::shared_ptr<PeerChannel> channel,
-                               const ListenerLimits& limits)
+                               const ListenerLimits& limits, MisuseLog& misuse)
     : id_(id),
       socket_(std::move(socket)),
       peer_(peer),
       channel_(std::move(channel)),
-      limits_(limits) {}
+      limits_(limits),
+      misuse_(misuse) {}
 
 std::string PeerConnection::description() const {
   return format("<connection %lu of process %i, user %u>", id_, peer_.pid, peer_.user);
@@ -162,6 +163,25 @@ std::size_t PeerConnection::process(std::span<const std::uint8_t> bytes) {
   return done;
 }
 
+// The client's sessions, as they will be when the request has run. False: it would
+// make one too many. A session under the ID 0 cannot be destroyed.
+bool PeerConnection::countSession(const wire::Request& request) {
+  const ReporterID id = request.reporterID;
+  if (request.operation == wire::Operation::kDestroyReportingSession) {
+    if (id != kNoReporter && sessions_.erase(id)) channel_->giveSessions(1);
+    return true;
+  }
+  if (request.operation != wire::Operation::kCreateReportingSession) return true;
+  if (sessions_.contains(id)) return true;
+  if (!channel_->takeSession()) {
+    misuse_.note(peer_.user, MisuseLog::Kind::kSessionRefused, "there are too many",
+                 Clock::now());
+    return false;
+  }
+  sessions_.insert(id);
+  return true;
+}
+
 void PeerConnection::checkNextFrame(std::span<const std::uint8_t> bytes) {
   if (bytes.size() < wire::kFrameHeaderSize || ending_ != Ending::kNone) return;
   const std::size_t length = wire::frameLength(bytes.data());
@@ -194,6 +214,10 @@ std::size_t PeerConnection::carryOut(ValueBuffer& input,
   }
   // A client that has gone may have left thousands of questions behind.
   if (isDeaf_ && onlyAsks(request.operation)) return 0;
+  if (!countSession(request)) {
+    dispatchRefusedSession(*object_, channel_, request);
+    return 0;
+  }
   std::size_t used = 0;
   if (request.dictionary) {
     used = item.size();
@@ -268,6 +292,7 @@ void PeerConnection::breakOff(Ending ending, std::string_view reason) {
 void PeerConnection::invalidate() {
   if (ending_ == Ending::kFarewell) channel_->flush(socket_.get());
   channel_->close();
+  channel_->giveSessions(sessions_.size());
   socket_.reset();
   if (ending_ != Ending::kFarewell && ending_ != Ending::kNone && interrupted_) {
     interrupted_();

@@ -13,7 +13,9 @@
 #include "platform/Value.h"
 #include "platform/linux/FileDescriptor.h"
 #include "platform/linux/Limits.h"
+#include "platform/linux/MisuseLog.h"
 #include "platform/linux/PeerChannel.h"
+#include "platform/linux/ReporterIDSet.h"
 #include "platform/linux/wire/Frame.h"
 
 namespace ostrel {
@@ -59,7 +61,8 @@ class PeerConnection final : public IPCConnection {
   };
 
   PeerConnection(ID id, FileDescriptor socket, PeerIdentity peer,
-                 std::shared_ptr<PeerChannel> channel, const ListenerLimits& limits);
+                 std::shared_ptr<PeerChannel> channel, const ListenerLimits& limits,
+                 MisuseLog& misuse);
 
   ProcessID processIdentifier() const override { return peer_.pid; }
   std::string description() const override;
@@ -105,6 +108,7 @@ class PeerConnection final : public IPCConnection {
   std::size_t process(std::span<const std::uint8_t> bytes);
   void processPending();
   std::size_t carryOut(ValueBuffer& input, std::span<const std::uint8_t> item);
+  bool countSession(const wire::Request& request);
   void checkNextFrame(std::span<const std::uint8_t> bytes);
   bool holdBackIfFull();
   std::size_t missingBytes() const;
@@ -114,6 +118,8 @@ class PeerConnection final : public IPCConnection {
   const PeerIdentity peer_;
   const std::shared_ptr<PeerChannel> channel_;
   const ListenerLimits& limits_;
+  MisuseLog& misuse_;
+  ReporterIDSet sessions_;
 
   std::shared_ptr<OstrelReportingServiceProtocol> object_;
   std::function<void()> interrupted_;

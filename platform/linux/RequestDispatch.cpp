@@ -161,6 +161,16 @@ void dispatchRequest(OstrelReportingServiceProtocol& object,
   kHandlers[row].call(object, request, Reply(std::move(ticket)));
 }
 
+// A configuration of nothing for nobody changes nothing and is answered with YES.
+void dispatchRefusedSession(OstrelReportingServiceProtocol& object,
+                            const std::shared_ptr<PeerChannel>& channel,
+                            const wire::Request& request) {
+  object.setConfiguration(
+      /*configuration=*/std::nullopt, kNoReporter,
+      Reply(std::make_shared<RequestTicket>(
+          channel, request.number, channel->chargeRequest(costOf(request, *channel)))));
+}
+
 bool keepsReply(wire::Operation operation) {
   return operation == Operation::kStartReportingSessionForID;
 }

@@ -15,6 +15,12 @@ namespace ostrel {
 void dispatchRequest(OstrelReportingServiceProtocol& object,
                      const std::shared_ptr<PeerChannel>& channel, wire::Request& request);
 
+/// Answers the creation of a session that is one too many: YES, in its turn, and
+/// nothing is made.
+void dispatchRefusedSession(OstrelReportingServiceProtocol& object,
+                            const std::shared_ptr<PeerChannel>& channel,
+                            const wire::Request& request);
+
 /// Whether the reply callback of an operation may be kept long after the operation
 /// has run.
 bool keepsReply(wire::Operation operation);

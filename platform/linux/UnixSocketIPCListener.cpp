@@ -74,11 +74,13 @@ void sendClosing(int socket, std::string_view reason) {
 }  // namespace
 
 Outcome<std::unique_ptr<UnixSocketIPCListener>> UnixSocketIPCListener::open(
-    const std::string& path, std::shared_ptr<PeerRegistry> peers, ListenerLimits limits) {
+    const std::string& path, std::shared_ptr<PeerRegistry> peers, ListenerLimits limits,
+    std::shared_ptr<MisuseLog> misuse) {
   auto socket = ServiceSocket::open(path);
   if (!socket.value) return {std::nullopt, std::move(socket.error)};
-  auto listener = std::unique_ptr<UnixSocketIPCListener>(
-      new UnixSocketIPCListener(*std::move(socket.value), std::move(peers), limits));
+  auto listener = std::unique_ptr<UnixSocketIPCListener>(new UnixSocketIPCListener(
+      *std::move(socket.value), std::move(peers), limits,
+      misuse ? std::move(misuse) : std::make_shared<MisuseLog>()));
   if (!listener->watchOwnDescriptors()) {
     return {std::nullopt,
             ErrorObject{std::string(kPOSIXErrorDomain), ENOMEM,
@@ -89,10 +91,12 @@ Outcome<std::unique_ptr<UnixSocketIPCListener>> UnixSocketIPCListener::open(
 
 UnixSocketIPCListener::UnixSocketIPCListener(ServiceSocket socket,
                                              std::shared_ptr<PeerRegistry> peers,
-                                             ListenerLimits limits)
+                                             ListenerLimits limits,
+                                             std::shared_ptr<MisuseLog> misuse)
     : limits_(limits),
       socket_(std::move(socket)),
       peers_(std::move(peers)),
+      misuse_(std::move(misuse)),
       epoll_(::epoll_create1(EPOLL_CLOEXEC)),
       service_(new ServiceAccount{Share(limits.sessions), Share(limits.keptBytes)}),
       nextID_(kFirstConnection) {}
@@ -187,7 +191,8 @@ void UnixSocketIPCListener::settle(PeerConnection& connection) {
   if (connection.isHeldBack()) connection.continueReading();
   if (connection.ending() != PeerConnection::Ending::kNone) {
     if (connection.ending() == PeerConnection::Ending::kBrokenRules) {
-      logMisuse(connection.peer().user, connection.endingReason());
+      misuse_->note(connection.peer().user, MisuseLog::Kind::kCutOff,
+                    connection.endingReason(), Clock::now());
     }
     end(connection);
     return;
@@ -264,8 +269,8 @@ void UnixSocketIPCListener::accept(FileDescriptor socket) {
   auto channel = std::make_shared<PeerChannel>(
       id, waker_, user.account,
       PeerChannel::Limits{limits_.queuedBytes, limits_.unreadReplyBytes});
-  auto connection = std::make_shared<PeerConnection>(id, std::move(socket), peer,
-                                                     std::move(channel), limits_);
+  auto connection = std::make_shared<PeerConnection>(
+      id, std::move(socket), peer, std::move(channel), limits_, *misuse_);
   connections_[id] = {connection};
   ++user.connections;
   const bool isAccepted = delegate_ != nullptr &&
@@ -284,17 +289,10 @@ bool UnixSocketIPCListener::isWithinLimits(const PeerIdentity& peer, int socket)
   if (connections_.size() < limits_.connections && ofUser < limits_.connectionsOfUser) {
     return true;
   }
-  logMisuse(peer.user, "too many connections");
+  misuse_->note(peer.user, MisuseLog::Kind::kConnectionRefused, "there are too many",
+                Clock::now());
   sendClosing(socket, "there are too many connections");
   return false;
-}
-
-void UnixSocketIPCListener::logMisuse(std::uint32_t user, std::string_view what) {
-  const Clock::time_point now = Clock::now();
-  User& known = users_[user];
-  if (now < known.mayLogAgain) return;
-  known.mayLogAgain = now + limits::kMisuseLogInterval;
-  OSTREL_LOG_ERROR(processLogScope, "a client of user %u is cut off: %@", user, what);
 }
 
 void UnixSocketIPCListener::handleDeadlines(Clock::time_point now) {

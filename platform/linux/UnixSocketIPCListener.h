@@ -29,10 +29,10 @@ namespace ostrel {
 class UnixSocketIPCListener final : public IPCListener {
  public:
   /// The socket that systemd passed, else one of our own at `path`. An error is a
-  /// sentence for people. `peers` learns who connects.
+  /// sentence for people. `peers` learns who connects, `misuse` who is cut short.
   static Outcome<std::unique_ptr<UnixSocketIPCListener>> open(
       const std::string& path, std::shared_ptr<PeerRegistry> peers,
-      ListenerLimits limits = {});
+      ListenerLimits limits = {}, std::shared_ptr<MisuseLog> misuse = nullptr);
   ~UnixSocketIPCListener() override;
 
   void setDelegate(IPCListenerDelegate* delegate) override { delegate_ = delegate; }
@@ -49,11 +49,10 @@ class UnixSocketIPCListener final : public IPCListener {
   struct User {
     std::size_t connections = 0;
     std::shared_ptr<UserAccount> account;
-    Clock::time_point mayLogAgain{};
   };
 
   UnixSocketIPCListener(ServiceSocket socket, std::shared_ptr<PeerRegistry> peers,
-                        ListenerLimits limits);
+                        ListenerLimits limits, std::shared_ptr<MisuseLog> misuse);
 
   void acceptAll();
   void accept(FileDescriptor socket);
@@ -68,11 +67,11 @@ class UnixSocketIPCListener final : public IPCListener {
   void settle(PeerConnection& connection);
   void watch(PeerConnection& connection);
   void end(PeerConnection& connection);
-  void logMisuse(std::uint32_t user, std::string_view what);
 
   const ListenerLimits limits_;
   const ServiceSocket socket_;
   const std::shared_ptr<PeerRegistry> peers_;
+  const std::shared_ptr<MisuseLog> misuse_;
   const std::shared_ptr<LoopWaker> waker_ = std::make_shared<LoopWaker>();
   TerminationSignals signals_;
   const FileDescriptor epoll_;

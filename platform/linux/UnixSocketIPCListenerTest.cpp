@@ -27,6 +27,7 @@ namespace {
 using namespace std::chrono_literals;
 using testing::ElementsAre;
 using testing::HasSubstr;
+using testing::UnorderedElementsAre;
 using testing_support::CapturedLog;
 using testing_support::TemporaryDirectory;
 
@@ -231,6 +232,12 @@ wire::Request createRequest(wire::RequestNumber number, std::int64_t id) {
   return request;
 }
 
+wire::Request destroyRequest(wire::RequestNumber number, std::int64_t id) {
+  wire::Request request = createRequest(number, id);
+  request.operation = wire::Operation::kDestroyReportingSession;
+  return request;
+}
+
 wire::Request messageRequest(wire::RequestNumber number, const std::string& text) {
   wire::Request request;
   request.operation = wire::Operation::kSendMessage;
@@ -268,7 +275,7 @@ class UnixSocketListener : public testing::Test, public IPCListenerDelegate {
   ~UnixSocketListener() override { stop(); }
 
   void serve(ListenerLimits limits = {}) {
-    auto opened = UnixSocketIPCListener::open(path, peers, limits);
+    auto opened = UnixSocketIPCListener::open(path, peers, limits, misuse);
     ASSERT_TRUE(opened.value) << opened.error->description;
     listener = *std::move(opened.value);
     listener->setDelegate(this);
@@ -307,6 +314,7 @@ class UnixSocketListener : public testing::Test, public IPCListenerDelegate {
   TemporaryDirectory directory;
   const std::string path = directory / "run/reporting.sock";
   const std::shared_ptr<PeerRegistry> peers = std::make_shared<PeerRegistry>();
+  const std::shared_ptr<MisuseLog> misuse = std::make_shared<MisuseLog>();
   const std::shared_ptr<RecordingService> service = std::make_shared<RecordingService>();
   std::unique_ptr<UnixSocketIPCListener> listener;
   std::thread thread;
@@ -635,6 +643,76 @@ TEST_F(UnixSocketListener, ServesAsManyConnectionsAsAllowedAndSaysWhyNoMore) {
   RawClient next(path);
   next.send(createRequest(1, 7));
   EXPECT_TRUE(next.receive());
+}
+
+TEST_F(UnixSocketListener, MakesAsManySessionsAsAllowedAndAnswersYesForOneMore) {
+  ListenerLimits limits;
+  limits.ofUser.sessions = 3;
+  serve(limits);
+  RawClient one(path);
+  RawClient two(path);
+  const auto isAnsweredYes = [](RawClient& client, const std::string& reply) {
+    return hex(client.receive().value_or("")) == reply;
+  };
+  one.send(createRequest(1, 11));
+  one.send(createRequest(2, 12));
+  EXPECT_TRUE(isAnsweredYes(one, "8201f5"));
+  EXPECT_TRUE(isAnsweredYes(one, "8202f5"));
+  two.send(createRequest(1, 11));
+  EXPECT_TRUE(isAnsweredYes(two, "8201f5"));
+  two.send(createRequest(2, 22));
+  EXPECT_TRUE(isAnsweredYes(two, "8202f5"));
+  one.send(createRequest(3, 12));
+  EXPECT_TRUE(isAnsweredYes(one, "8203f5")) << "a session made anew is none more";
+
+  EXPECT_THAT(service->calls(), ElementsAre("create 11", "create 12", "create 11",
+                                            "setConfiguration (null) 0", "create 12"));
+  EXPECT_EQ(misuse->counts(), (MisuseLog::Counts{0, 0, 1}));
+}
+
+TEST_F(UnixSocketListener, MakesASessionAgainOnceOneIsDestroyedOrItsClientGone) {
+  ListenerLimits limits;
+  limits.sessions = 2;
+  serve(limits);
+  RawClient stays(path);
+  stays.send(createRequest(1, 11));
+  stays.send(createRequest(2, 0));
+  stays.send(destroyRequest(3, 0));
+  stays.send(createRequest(4, 12));
+  stays.send(destroyRequest(5, 11));
+  stays.send(destroyRequest(6, 11));
+  stays.send(createRequest(7, 13));
+  for (int i = 0; i < 7; ++i) ASSERT_TRUE(stays.receive());
+  EXPECT_THAT(service->calls(), ElementsAre("create 11", "create 0", "destroy 0",
+                                            "setConfiguration (null) 0", "destroy 11",
+                                            "destroy 11", "create 13"));
+  stays.hangUp();
+  ASSERT_THAT(eventsAfter(3), ElementsAre(accepted(), "interrupted", "invalidated"));
+  RawClient next(path);
+  next.send(createRequest(1, 21));
+  next.send(createRequest(2, 22));
+  ASSERT_TRUE(next.receive());
+  ASSERT_TRUE(next.receive());
+  EXPECT_EQ(service->calls().back(), "create 22");
+}
+
+TEST_F(UnixSocketListener, LogsOneKindOfMisuseOfAUserOnceAMinuteAndCountsAll) {
+  ListenerLimits limits;
+  limits.ofUser.sessions = 0;
+  const CapturedLog log;
+  serve(limits);
+  for (int i = 0; i < 3; ++i) {
+    RawClient client(path);
+    client.send(createRequest(1, 7));
+    ASSERT_TRUE(client.receive());
+    client.send(std::string(4, '\0'));
+    EXPECT_EQ(client.receiveClosing(), "a frame is empty");
+    EXPECT_TRUE(client.isEnded());
+  }
+  EXPECT_EQ(misuse->counts(), (MisuseLog::Counts{3, 0, 3}));
+  EXPECT_THAT(log.lines(LogLevel::kError),
+              UnorderedElementsAre(HasSubstr("gets no session: there are too many"),
+                                   HasSubstr("is cut off: a frame is empty")));
 }
 
 TEST_F(UnixSocketListener, TakesNoDescriptorsFromAClient) {

@@ -54,7 +54,8 @@ std::shared_ptr<Store> Store::open(std::string path, StoreOptions options) {
 
 Store::Store(std::string path, StoreOptions options)
     : options_(std::move(options)),
-      writer_(std::move(path), options_.vfs, options_.retention, counters_),
+      writer_(std::move(path), options_.vfs, options_.retention, counters_,
+              options_.otherCounts),
       retryPause_(options_.firstRetry) {
   // Signals are for the main thread.
   sigset_t all;
@@ -152,6 +153,8 @@ void Store::addPowerEvent(PowerEvent event) {
   counters_.droppedPower.fetch_add(1, std::memory_order_relaxed);
 }
 
+void Store::noteStatusChange() { push({options_.now(), StatusChange{}}); }
+
 void Store::whenKnown(Answer answer) {
   bool isUsable;
   {
@@ -173,16 +176,17 @@ std::optional<ErrorObject> Store::refusal() {
   return faultError_;
 }
 
-// False when there is no room; the steps of sessions always find room, since what
-// is queued points to their session.
+// False when there is no room; the store's own steps always find room: what is queued
+// points to the session that a step begins or ends.
 bool Store::push(StoreOperation operation) {
-  const bool isSessionStep = std::holds_alternative<SessionBegin>(operation.what) ||
-                             std::holds_alternative<SessionEnd>(operation.what);
+  const bool isOwnStep = std::holds_alternative<SessionBegin>(operation.what) ||
+                         std::holds_alternative<SessionEnd>(operation.what) ||
+                         std::holds_alternative<StatusChange>(operation.what);
   const bool isEvent = std::holds_alternative<AnalyticsEvent>(operation.what);
   bool mustWake;
   {
     const std::lock_guard lock(mutex_);
-    if (!isSessionStep && (isStopping_ || queue_.bytes() >= options_.queuedBytes)) {
+    if (!isOwnStep && (isStopping_ || queue_.bytes() >= options_.queuedBytes)) {
       return false;
     }
     if (isEvent && queuedEvents_ >= options_.queuedEvents) return false;
@@ -190,7 +194,7 @@ bool Store::push(StoreOperation operation) {
     // A writer that sleeps until something is due needs no call for a few more.
     mustWake = writerIsIdle_ || queue_.size() == kWriteAhead - 1;
     if (isEvent) ++queuedEvents_;
-    if (!isSessionStep) counters_.accepted.fetch_add(1, std::memory_order_relaxed);
+    if (!isOwnStep) counters_.accepted.fetch_add(1, std::memory_order_relaxed);
     queue_.push(std::move(operation));
   }
   if (mustWake) wakeWriter();

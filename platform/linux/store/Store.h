@@ -37,6 +37,9 @@ struct StoreOptions {
   std::chrono::milliseconds firstRetry{100};
   std::chrono::milliseconds longestRetry{5000};
 
+  /// What others count, for `service_status`.
+  StatusCounts otherCounts;
+
   /// Microseconds since 1970; empty: the system's clock.
   std::function<std::int64_t()> now;
 
@@ -84,6 +87,10 @@ class Store {
   /// Queue an event, or drop and count it.
   void addAnalyticsEvent(std::string name, AnalyticsSink::PayloadProvider provider);
   void addPowerEvent(PowerEvent event);
+
+  /// Others' counts have changed: they are written with the next commit, for which
+  /// this is a reason.
+  void noteStatusChange();
 
   /// Calls `answer` once: at once when it is known whether the store can be used,
   /// else on the writer's thread as soon as it is.

@@ -2,6 +2,9 @@
 
 #include <atomic>
 #include <cstdint>
+#include <functional>
+#include <string_view>
+#include <vector>
 
 namespace ostrel {
 
@@ -17,5 +20,13 @@ struct StoreCounters {
   std::atomic<std::uint64_t> failures{0};          // Of the file, as they were found.
   std::atomic<std::uint64_t> setAside{0};          // Damaged files.
 };
+
+/// A count that somebody else keeps; it stands in `service_status` as well.
+struct StatusCount {
+  std::string_view key;
+  std::uint64_t value;
+};
+/// Called on the writer's thread before each commit. May be none.
+using StatusCounts = std::function<std::vector<StatusCount>()>;
 
 }  // namespace ostrel

@@ -71,10 +71,13 @@ struct PowerEvent {
   std::optional<Dictionary> attachment;
 };
 
+/// Somebody else's counts are to be written.
+struct StatusChange {};
+
 struct StoreOperation {
   std::int64_t time = 0;  // Microseconds since 1970.
   std::variant<SessionBegin, SessionMessage, SessionFlush, SessionEnd, LoneMessage,
-               AnalyticsEvent, PowerEvent>
+               AnalyticsEvent, PowerEvent, StatusChange>
       what;
 
   /// The memory of the payloads that it keeps; those of their clients bear it.

@@ -249,6 +249,25 @@ TEST_F(StoreTest, DropsAnalyticsEventsBeyondTheBoundAndCountsThem) {
             "2");
 }
 
+TEST_F(StoreTest, WritesWhatOthersCountWhenTheySayThatItChanged) {
+  std::atomic<std::uint64_t> refused{0};
+  StoreOptions options;
+  options.otherCounts = [&refused] {
+    return std::vector<StatusCount>{{"sessions_refused", refused.load()}};
+  };
+  open(options);
+  settle();
+  refused = 7;
+  store_->noteStatusChange();
+  OtherConnection reader(path());
+  EXPECT_TRUE(eventually([&] {
+    return reader.one(
+               "SELECT value FROM service_status WHERE key = "
+               "'sessions_refused'") == "7";
+  }));
+  EXPECT_EQ(store_->counters().accepted, 0u);
+}
+
 TEST_F(StoreTest, WritesPowerEvents) {
   open();
   wattlog_->logRegisteredEvent(28, "Mediora_Haptics", {{"EngineOnDuration", Value(1.5)}},

@@ -48,8 +48,12 @@ void appendLenientJSON(std::string& out, const Dictionary& value) {
 }  // namespace
 
 StoreWriter::StoreWriter(std::string path, const char* vfs,
-                         const StoreRetention& retention, StoreCounters& counters)
-    : database_(std::move(path), vfs), retention_(retention), counters_(counters) {
+                         const StoreRetention& retention, StoreCounters& counters,
+                         StatusCounts otherCounts)
+    : database_(std::move(path), vfs),
+      retention_(retention),
+      counters_(counters),
+      otherCounts_(std::move(otherCounts)) {
   fault_ = {StoreFault::Kind::kTransient, SQLITE_CANTOPEN, "the store is not open yet"};
 }
 
@@ -150,6 +154,7 @@ StoreWriter::Result StoreWriter::write(StoreOperation& operation) {
                    return std::nullopt;
                  },
                  [&](PowerEvent& event) { return write(time, event); },
+                 [&](StatusChange&) -> Result { return std::nullopt; },
                  [&](SessionBegin& begin) { return insertSession(*begin.session); },
                  [&](SessionFlush& flush) -> Result {
                    if (Result failed = insertSession(*flush.session)) return failed;
@@ -295,10 +300,7 @@ std::vector<StoreBatch> StoreWriter::takeDone(std::size_t batches) {
 }
 
 StoreWriter::Result StoreWriter::writeStatus() {
-  const struct {
-    const char* key;
-    std::uint64_t value;
-  } rare[] = {
+  std::vector<StatusCount> rare = {
       {"refused", counters_.refused.load(std::memory_order_relaxed)},
       {"lost", counters_.lost.load(std::memory_order_relaxed)},
       {"dropped_analytics", counters_.droppedAnalytics.load(std::memory_order_relaxed)},
@@ -306,6 +308,10 @@ StoreWriter::Result StoreWriter::writeStatus() {
       {"failures", counters_.failures.load(std::memory_order_relaxed)},
       {"set_aside", counters_.setAside.load(std::memory_order_relaxed)},
   };
+  if (otherCounts_) {
+    const std::vector<StatusCount> others = otherCounts_();
+    rare.insert(rare.end(), others.begin(), others.end());
+  }
   std::uint64_t sum = 1;
   for (const auto& [key, value] : rare) sum += value;
   if (sum == writtenStatus_) return std::nullopt;

@@ -28,7 +28,7 @@ struct StoreRetention {
 class StoreWriter {
  public:
   StoreWriter(std::string path, const char* vfs, const StoreRetention& retention,
-              StoreCounters& counters);
+              StoreCounters& counters, StatusCounts otherCounts = nullptr);
 
   /// Opens the database, or opens it again, and writes what is not durable yet. A
   /// damaged file is set aside and a new one begun.
@@ -100,6 +100,7 @@ class StoreWriter {
   StoreDatabase database_;
   const StoreRetention retention_;
   StoreCounters& counters_;
+  const StatusCounts otherCounts_;
 
   std::optional<StoreFault> fault_;
   std::string loggedFault_;

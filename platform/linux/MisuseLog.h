@@ -1,0 +1,48 @@
+#pragma once
+
+#include <array>
+#include <chrono>
+#include <cstddef>
+#include <cstdint>
+#include <functional>
+#include <map>
+#include <mutex>
+#include <string_view>
+#include <utility>
+
+namespace ostrel {
+
+/// What clients were cut short of: counted each time, logged once a minute for each
+/// user. Any thread.
+class MisuseLog {
+ public:
+  using Clock = std::chrono::steady_clock;
+
+  enum class Kind : std::size_t { kCutOff, kConnectionRefused, kSessionRefused };
+  static constexpr std::size_t kKinds = 3;
+
+  using Counts = std::array<std::uint64_t, kKinds>;
+
+  /// `counted` is called after each, on the thread that noted it; may be none.
+  explicit MisuseLog(std::function<void()> counted = nullptr)
+      : counted_(std::move(counted)) {}
+
+  /// `reason` is a few words that continue the kind's sentence.
+  void note(std::uint32_t user, Kind kind, std::string_view reason, Clock::time_point now);
+
+  /// By kind, since the service began.
+  Counts counts() const;
+
+  /// How a kind is called in the service's status.
+  static std::string_view keyOf(Kind kind);
+
+ private:
+  const std::function<void()> counted_;
+
+  mutable std::mutex mutex_;
+  // Guarded by `mutex_`.
+  Counts counts_{};
+  std::map<std::pair<std::uint32_t, Kind>, Clock::time_point> mayLogAgain_;
+};
+
+}  // namespace ostrel
