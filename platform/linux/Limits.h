@@ -93,4 +93,9 @@ inline constexpr std::size_t kListsBytesInMemory = 24 * 1024 * 1024;
 /// is not asked with each message.
 inline constexpr std::chrono::milliseconds kPauseOfListsFile{1000};
 
+/// Sessions that watch the orientation of the device at a time, and that of the
+/// interface. One that its client left while it was starting never ends, and costs some 5
+/// KiB.
+inline constexpr std::size_t kOrientationObservers = 2048;
+
 }  // namespace ostrel::limits

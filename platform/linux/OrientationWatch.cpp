@@ -20,8 +20,10 @@ bool waitForStop(int stopDescriptor, std::chrono::milliseconds time) {
 }
 
 OrientationWatch::OrientationWatch(std::string threadName,
-                                   std::unique_ptr<OrientationSource> source)
+                                   std::unique_ptr<OrientationSource> source,
+                                   std::size_t mostObservers)
     : threadName_(std::move(threadName)),
+      mostObservers_(mostObservers),
       source_(std::move(source)),
       stopEvent_(::eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK)) {}
 
@@ -35,10 +37,36 @@ OrientationWatch::~OrientationWatch() {
 }
 
 void OrientationWatch::add(const std::string& id, Callback callback) {
-  auto observer = std::make_shared<const Callback>(std::move(callback));
+  auto added = std::make_shared<const Callback>(std::move(callback));
+  std::shared_ptr<const Callback> oldest;  // Ends after the lock, as the replaced one.
   const std::lock_guard lock(mutex_);
-  observers_[id].swap(observer);  // The replaced one ends after the lock.
+  Observer& observer = observers_[id];
+  if (observer.callback) byOrder_.erase(observer.order);
+  observer.callback.swap(added);
+  observer.order = nextOrder_++;
+  byOrder_.emplace(observer.order, id);
+  if (observers_.size() > mostObservers_) oldest = takeOldest();
   if (!isRunning_ && source_->isConfigured()) startThread();
+}
+
+// A session that is left while it starts stays with its observer for ever: clients that
+// make such on purpose push one another out, and the memory stays theirs.
+std::shared_ptr<const OrientationWatch::Callback> OrientationWatch::takeOldest() {
+  const auto first = byOrder_.begin();
+  const auto found = observers_.find(first->second);
+  std::shared_ptr<const Callback> callback = std::move(found->second.callback);
+  observers_.erase(found);
+  byOrder_.erase(first);
+  const auto now = std::chrono::steady_clock::now();
+  if (now - crowdLoggedAt_ >= kShortestLogInterval) {
+    crowdLoggedAt_ = now;
+    OSTREL_LOG_ERROR(
+        processLogScope,
+        "more than %lu sessions watch the orientation: the oldest do not any "
+        "more",
+        mostObservers_);
+  }
+  return callback;
 }
 
 void OrientationWatch::remove(const std::string& id) {
@@ -46,7 +74,8 @@ void OrientationWatch::remove(const std::string& id) {
   const std::lock_guard lock(mutex_);
   const auto found = observers_.find(id);
   if (found == observers_.end()) return;
-  removed = std::move(found->second);
+  removed = std::move(found->second.callback);
+  byOrder_.erase(found->second.order);
   observers_.erase(found);
   if (!observers_.empty() || !isRunning_) return;
   const std::uint64_t one = 1;
@@ -90,7 +119,7 @@ void OrientationWatch::report(Code code) {
   std::vector<std::shared_ptr<const Callback>> callbacks;
   {
     const std::lock_guard lock(mutex_);
-    for (const auto& [id, callback] : observers_) callbacks.push_back(callback);
+    for (const auto& [id, observer] : observers_) callbacks.push_back(observer.callback);
   }
   for (const auto& callback : callbacks) (*callback)(code);
 }

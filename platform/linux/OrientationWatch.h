@@ -12,6 +12,7 @@
 
 #include "platform/OrientationService.h"
 #include "platform/linux/FileDescriptor.h"
+#include "platform/linux/Limits.h"
 
 namespace ostrel {
 
@@ -69,8 +70,10 @@ class OrientationWatch {
   /// Between two lines that say how many were dropped.
   static constexpr std::chrono::minutes kShortestLogInterval{1};
 
-  /// `threadName` has at most 15 bytes.
-  OrientationWatch(std::string threadName, std::unique_ptr<OrientationSource> source);
+  /// `threadName` has at most 15 bytes. One observer more than `mostObservers` takes the
+  /// place of the one that is there longest, which a line says once in a while.
+  OrientationWatch(std::string threadName, std::unique_ptr<OrientationSource> source,
+                   std::size_t mostObservers = limits::kOrientationObservers);
   OrientationWatch(const OrientationWatch&) = delete;
   OrientationWatch& operator=(const OrientationWatch&) = delete;
   /// Waits for the thread. Not called by a callback.
@@ -81,12 +84,19 @@ class OrientationWatch {
   void remove(const std::string& id);
 
  private:
+  struct Observer {
+    std::shared_ptr<const Callback> callback;
+    std::uint64_t order = 0;  // Its key in `byOrder_`.
+  };
+
   void startThread();
   void run();
   void report(Code code);
   bool mayHandOn();
+  std::shared_ptr<const Callback> takeOldest();
 
   const std::string threadName_;
+  const std::size_t mostObservers_;
   const std::unique_ptr<OrientationSource> source_;
   const FileDescriptor stopEvent_;
 
@@ -99,7 +109,10 @@ class OrientationWatch {
 
   std::mutex mutex_;  // Guards all below.
   std::condition_variable ended_;
-  std::map<std::string, std::shared_ptr<const Callback>> observers_;
+  std::map<std::string, Observer> observers_;
+  std::map<std::uint64_t, std::string> byOrder_;  // Who came first stands first.
+  std::uint64_t nextOrder_ = 0;
+  std::chrono::steady_clock::time_point crowdLoggedAt_{};
   bool isRunning_ = false;
 };
 

@@ -72,6 +72,35 @@ class OrientationWatchObservers : public testing::Test {
   OrientationWatch watch_{"test", std::make_unique<ScriptedOrientation>(shared_)};
 };
 
+TEST_F(OrientationWatchObservers, BeyondTheLimitTakeThePlaceOfTheOldest) {
+  constexpr std::size_t kMost = 3;
+  OrientationWatch watch("test", std::make_unique<ScriptedOrientation>(shared_), kMost);
+  std::vector<std::weak_ptr<int>> kept;
+  const auto add = [&](const std::string& id) {
+    auto mark = std::make_shared<int>();
+    kept.push_back(mark);
+    watch.add(id, [mark = std::move(mark)](Code) {});
+  };
+  const auto keptNow = [&] {
+    std::string now;
+    for (const auto& each : kept) now += each.expired() ? '-' : '+';
+    return now;
+  };
+  for (const char* id : {"a", "b"}) add(id);
+  EXPECT_EQ(keptNow(), "++");
+  add("c");
+  EXPECT_EQ(keptNow(), "+++");
+  add("d");
+  EXPECT_EQ(keptNow(), "-+++");
+  watch.remove("c");
+  add("b");  // Again: it is the youngest now.
+  EXPECT_EQ(keptNow(), "---++");
+  add("e");
+  EXPECT_EQ(keptNow(), "---+++");
+  add("f");
+  EXPECT_EQ(keptNow(), "----+++");
+}
+
 TEST_F(OrientationWatchObservers, AreToldChangesOnly) {
   watch_.add("a", appendTo(first_));
   say(1);
