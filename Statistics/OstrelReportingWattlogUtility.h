@@ -1,5 +1,7 @@
 #pragma once
 
+#include <string_view>
+
 #include "Statistics/OstrelReportingTypes.h"
 #include "platform/OstrelReportingPlatform.h"
 #include "platform/Value.h"
@@ -10,6 +12,9 @@ namespace ostrel {
 class OstrelReportingWattlogUtility {
  public:
   OstrelReportingWattlogUtility() = delete;
+
+  /// Payloads without this key are none of its business.
+  static constexpr std::string_view kEngineOnTimeKey = "EngineOnTime";
 
   /// Logs a "Mediora_Haptics" event when `payload` (none: nothing happens) has
   /// an "EngineOnTime"; ignores every other message silently. A payload without

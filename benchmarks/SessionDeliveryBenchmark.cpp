@@ -2,8 +2,13 @@
 // identifier, the list and the backend, the last with ends that only count.
 #include <benchmark/benchmark.h>
 
+#include <map>
 #include <memory>
+#include <string>
 
+#include "Statistics/OstrelReportingUtility.h"
+#include "Statistics/Service/OstrelReportingMessageCounts.h"
+#include "Statistics/Service/OstrelReportingPayloadSurvey.h"
 #include "Statistics/Service/OstrelReportingSession.h"
 #include "Statistics/Service/OstrelReportingSessionSummary.h"
 #include "benchmarks/wholepath/CountingRoles.h"
@@ -96,6 +101,48 @@ void sanitisePayload(benchmark::State& state) {
   for (auto _ : state) benchmark::DoNotOptimize(SanitisedPayload(message));
 }
 BENCHMARK(sanitisePayload);
+
+void surveyPayload(benchmark::State& state) {
+  const Dictionary message = Dictionary::copyOf(bench::examplePayload().encoded());
+  for (auto _ : state) benchmark::DoNotOptimize(PayloadSurvey(message));
+}
+BENCHMARK(surveyPayload);
+
+// What the survey spares.
+void walkPayloadForEachPart(benchmark::State& state) {
+  const Dictionary message = Dictionary::copyOf(bench::examplePayload().encoded());
+  for (auto _ : state) {
+    benchmark::DoNotOptimize(SanitisedPayload(message));
+    benchmark::DoNotOptimize(message.get("EngineOnTime"));
+    benchmark::DoNotOptimize(message.value().bytes());
+  }
+}
+BENCHMARK(walkPayloadForEachPart);
+
+void nameMessage(benchmark::State& state) {
+  MessageCounts counts;
+  for (auto _ : state) {
+    benchmark::DoNotOptimize(counts.next(messageNames(kCategory, kType)));
+  }
+}
+BENCHMARK(nameMessage);
+
+// Its name as it was made for each message.
+void composeMessageName(benchmark::State& state) {
+  std::map<std::string, std::int64_t> counts;
+  for (auto _ : state) {
+    std::string identifier;
+    identifier.reserve(64);
+    appendCategoryName(identifier, kCategory);
+    identifier += '_';
+    identifier += MessageTypeName(kType);
+    const std::int64_t count = ++counts[identifier];
+    identifier += '_';
+    identifier += std::to_string(count);
+    benchmark::DoNotOptimize(identifier);
+  }
+}
+BENCHMARK(composeMessageName);
 
 }  // namespace
 }  // namespace ostrel

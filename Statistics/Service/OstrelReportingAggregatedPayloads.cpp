@@ -44,7 +44,8 @@ bool OstrelReportingAggregatedPayloads::Snapshot::forEach(
 }
 
 void OstrelReportingAggregatedPayloads::append(std::string_view identifier,
-                                               const Dictionary& payload) {
+                                               const Dictionary& payload,
+                                               StoredEntries::Bytes encoded) {
   if (payload.owner().size() >= kLargePayload && !payload.owner().account()) {
     references_.push_back({storedCount_, std::string(identifier), payload});
     return;
@@ -53,7 +54,7 @@ void OstrelReportingAggregatedPayloads::append(std::string_view identifier,
   ValueEncoder encoder(head);
   encoder.beginDictionary(1);
   encoder.beginString(identifier.size());
-  store(std::array{asBytes(head), asBytes(identifier), payload.value().bytes()}, payload);
+  store(std::array{asBytes(head), asBytes(identifier), encoded}, payload);
 }
 
 void OstrelReportingAggregatedPayloads::append(const Dictionary& entry) {

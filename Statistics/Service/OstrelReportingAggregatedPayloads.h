@@ -53,7 +53,12 @@ class OstrelReportingAggregatedPayloads {
 
   /// Appends {`identifier`: `payload`}. A large payload that is nobody's, as a
   /// summary is, is kept by reference.
-  void append(std::string_view identifier, const Dictionary& payload);
+  void append(std::string_view identifier, const Dictionary& payload) {
+    append(identifier, payload, payload.value().bytes());
+  }
+  /// The same for who knows the payload's bytes already: their end is found by a walk.
+  void append(std::string_view identifier, const Dictionary& payload,
+              StoredEntries::Bytes encoded);
   void append(const Dictionary& entry);
 
   /// Puts a reference to `entry` before all others: what is merged into it later

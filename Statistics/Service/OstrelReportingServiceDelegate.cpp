@@ -42,8 +42,9 @@ AtomicProperty<std::shared_ptr<WorkQueue>>& serverQueueProperty() {
   return property;
 }
 
-// The queue of the property: asserted several times a request, without its lock.
-std::atomic<const WorkQueue*> assertedServerQueue{nullptr};
+// The queue of the property, for what each message does with it: without its lock and
+// without a reference. A process replaces it only with its root object.
+std::atomic<WorkQueue*> servingQueue{nullptr};
 
 std::atomic<int> defaultsNotifyToken{-1};
 
@@ -116,7 +117,7 @@ void connectionInterrupted(const std::weak_ptr<OstrelReportingServerInstance>& w
 std::shared_ptr<WorkQueue> serverQueue() { return serverQueueProperty().get(); }
 
 void assertOnServerQueue() {
-  if (const auto* queue = assertedServerQueue.load(std::memory_order_acquire)) {
+  if (const auto* queue = servingQueue.load(std::memory_order_acquire)) {
     queue->assertCurrent();
   }
 }
@@ -128,7 +129,7 @@ std::shared_ptr<OstrelReportingServiceDelegate> OstrelReportingServiceDelegate::
   serverQueueProperty().set(platform.workQueues->makeSerialQueue(
       "com.orbisk.ostrel.reporting.server", QualityOfService::kUserInteractive,
       /*relativePriority=*/0));
-  assertedServerQueue.store(serverQueue().get(), std::memory_order_release);
+  servingQueue.store(serverQueue().get(), std::memory_order_release);
   root->listenForDefaultsNotification();
   root->driverUtility_ = OstrelReportingDriverUtility::init(platform);
   return root;
@@ -429,12 +430,12 @@ void OstrelReportingServerInstance::sendMessage(Dictionary message,
                                                 std::optional<ReporterIDs> reportingIDs,
                                                 ErrorReply reply) {
   OSTREL_LOG_DEBUG(logScope, "sending message for reporter %@", reportingIDs);
-  serverQueue()->async([self = shared_from_this(), message = std::move(message), category,
-                        type, reportingIDs = std::move(reportingIDs),
-                        reply = std::move(reply)] {
-    assertOnServerQueue();
-    self->sendMessageStep(message, category, type, reportingIDs, reply);
-  });
+  servingQueue.load(std::memory_order_acquire)
+      ->async([self = shared_from_this(), message = std::move(message), category, type,
+               reportingIDs = std::move(reportingIDs), reply = std::move(reply)] {
+        assertOnServerQueue();
+        self->sendMessageStep(message, category, type, reportingIDs, reply);
+      });
 }
 
 void OstrelReportingServerInstance::sendMessageStep(

@@ -19,6 +19,7 @@
 #include "Statistics/OstrelReportingTallyraBridge.h"
 #include "Statistics/OstrelReportingUtility.h"
 #include "Statistics/OstrelReportingWattlogUtility.h"
+#include "Statistics/Service/OstrelReportingPayloadSurvey.h"
 #include "Statistics/Service/OstrelReportingSessionSummary.h"
 #include "platform/AnalyticsSink.h"
 #include "platform/Clock.h"
@@ -305,19 +306,32 @@ void OstrelReportingSession::sendMessage(Dictionary message, MessageCategory cat
   });
 }
 
-// One lock of the session's for all that the delivery needs of it.
+// One lock of the session's for all that the delivery needs of it, and one walk over
+// the payload for all that its parts ask of that.
 void OstrelReportingSession::deliverStep(const Dictionary& message,
                                          MessageCategory category, MessageType type,
                                          const ErrorReply& reply) {
   const auto [details, list, mutableUserInfo] = takeDelivery();
   const Dictionary userInfo =
       mutableUserInfo != nullptr ? mutableUserInfo->snapshot() : Dictionary();
+  const PayloadSurvey survey(message);
   OstrelReportingTallyraBridge::handleEvent(platform_, &message, category, type,
                                             userInfo);
-  OstrelReportingWattlogUtility::handleEvent(platform_, &message, category, type,
-                                             userInfo);
-  const Dictionary payload = SanitisedPayload(message);
-  aggregate(payload, category, type, details, list.get());
+  if (survey.hasEngineOnTime()) {
+    OstrelReportingWattlogUtility::handleEvent(platform_, &message, category, type,
+                                               userInfo);
+  }
+  std::optional<Dictionary> sanitised;
+  if (survey.hasBlankInKey()) sanitised = SanitisedPayload(message);
+  const Dictionary& payload = sanitised ? *sanitised : message;
+  const MessageIdentifier identifier =
+      details.messageTypeCounts.next(messageNames(category, type));
+  // Kept: each entry is a dictionary of its own with the one identifier.
+  // [KeepsOneElementEntriesOfMessages]
+  if (list != nullptr) {
+    list->lock()->append(identifier.text(), payload,
+                         sanitised ? payload.value().bytes() : survey.bytes());
+  }
   platform_.kernelTrace->trace(TraceCode::kMessageDelivery);
   if (started()) {
     sendToBackend(message, payload, category, type, reply, details);
@@ -331,16 +345,6 @@ OstrelReportingSession::Delivery OstrelReportingSession::takeDelivery() const {
   const std::lock_guard lock(mutex_);
   Details& made = details();
   return {made, made.aggregatedPayloadData, userInfo_.get()};
-}
-
-// Kept: each entry is a dictionary of its own with the one identifier.
-// [KeepsOneElementEntriesOfMessages]
-void OstrelReportingSession::aggregate(const Dictionary& payload,
-                                       MessageCategory category, MessageType type,
-                                       Details& details, AggregatedPayloadData* list) {
-  const MessageIdentifier identifier =
-      details.messageTypeCounts.next(messageNames(category, type));
-  if (list != nullptr) list->lock()->append(identifier.text(), payload);
 }
 
 // Kept: the count belongs to the name; codes with equal names share it.

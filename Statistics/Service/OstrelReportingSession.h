@@ -205,9 +205,6 @@ class OstrelReportingSession final
   void flushStep() OSTREL_ON_QUEUE(*sessionReportingQueue_);
   void deliverStep(const Dictionary& message, MessageCategory category, MessageType type,
                    const ErrorReply& reply) OSTREL_ON_QUEUE(*sessionReportingQueue_);
-  void aggregate(const Dictionary& payload, MessageCategory category, MessageType type,
-                 Details& details, AggregatedPayloadData* list)
-      OSTREL_ON_QUEUE(*sessionReportingQueue_);
   void sendToBackend(const Dictionary& message, const Dictionary& payload,
                      MessageCategory category, MessageType type, const ErrorReply& reply,
                      const Details& details) OSTREL_ON_QUEUE(*sessionReportingQueue_);

@@ -82,7 +82,7 @@ QueuedStep* takeMemory() {
 
 }  // namespace
 
-QueuedStep* QueuedStep::make(Task task) {
+QueuedStep* QueuedStep::make(Task&& task) {
   QueuedStep* const step = takeMemory();
   step->task = std::move(task);
   return step;

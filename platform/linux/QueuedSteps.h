@@ -15,7 +15,7 @@ namespace ostrel {
 class QueuedStep {
  public:
   /// A step with `task`. Any thread.
-  static QueuedStep* make(Task task);
+  static QueuedStep* make(Task&& task);
   /// Takes back the memory of a step whose task was reset. Any thread.
   static void takeBack(QueuedStep* step) noexcept;
 

@@ -1,0 +1,49 @@
+#include "Statistics/Service/OstrelReportingPayloadSurvey.h"
+
+#include <cstring>
+#include <string_view>
+
+#include "Statistics/OstrelReportingWattlogUtility.h"
+
+namespace ostrel {
+namespace {
+
+// Not 0 when one of the eight characters is a blank.
+std::uint64_t blanksIn8(const char* text) {
+  constexpr std::uint64_t kOnes = 0x0101010101010101;
+  std::uint64_t word;
+  std::memcpy(&word, text, sizeof word);
+  word ^= kOnes * ' ';
+  return (word - kOnes) & ~word & (kOnes << 7);
+}
+
+// Keys are short: a call of `memchr` takes longer than the search.
+bool holdsBlank(std::string_view text) {
+  if (text.size() < 8) {
+    bool isFound = false;
+    for (const char character : text) isFound |= character == ' ';
+    return isFound;
+  }
+  std::uint64_t found = blanksIn8(text.data() + text.size() - 8);
+  for (std::size_t at = 0; at + 8 < text.size(); at += 8) {
+    found |= blanksIn8(text.data() + at);
+  }
+  return found != 0;
+}
+
+}  // namespace
+
+PayloadSurvey::PayloadSurvey(const Dictionary& payload) : begin_(payload.value().data()) {
+  const DictionaryView entries = payload.view();
+  ValueView last = payload.value();
+  for (const auto& [key, value] : entries) {
+    last = value;
+    const auto text = key.string();
+    if (!text) continue;
+    hasBlankInKey_ |= holdsBlank(*text);
+    hasEngineOnTime_ |= *text == OstrelReportingWattlogUtility::kEngineOnTimeKey;
+  }
+  end_ = last.end();  // Of the last value, or of the dictionary without any.
+}
+
+}  // namespace ostrel
