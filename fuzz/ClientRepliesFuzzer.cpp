@@ -84,8 +84,11 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
   expect(ended.starts >= 1);
   // Its attempts to reach the service again are not the next client's.
   pollfd waiting{listener.get(), POLLIN, /*revents=*/0};
-  while (::poll(&waiting, 1, /*timeout=*/0) > 0) {
-    FileDescriptor(::accept4(listener.get(), nullptr, nullptr, SOCK_CLOEXEC));
+  for (int ready = 1; ready != 0;) {
+    ready = ::poll(&waiting, 1, /*timeout=*/0);
+    if (ready > 0) {
+      FileDescriptor(::accept4(listener.get(), nullptr, nullptr, SOCK_CLOEXEC));
+    }
   }
   return 0;
 }

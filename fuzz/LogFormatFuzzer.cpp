@@ -54,9 +54,10 @@ void fillWithValues(std::span<const std::uint8_t> bytes) {
 }
 
 void fillAnyFormat(std::string_view anyFormat, std::string_view text) {
-  const LogArgument arguments[] = {LogArgument(text),
-                                   LogArgument(std::numeric_limits<double>::infinity()),
-                                   LogArgument(UINT64_MAX)};
+  const double endless = std::numeric_limits<double>::infinity();
+  const std::uint64_t large = UINT64_MAX;
+  const LogArgument arguments[] = {LogArgument(text), LogArgument(endless),
+                                   LogArgument(large)};
   for (std::size_t count = 0; count <= std::size(arguments); ++count) {
     expect(formatText(anyFormat, {arguments, count}).size() <=
            anyFormat.size() + count * kMostBytes);
