@@ -1,5 +1,5 @@
 #!/usr/bin/env python3
-"""Tests of check_includes and check_kept on small trees of their own."""
+"""Tests of check_includes, check_kept and limits on small trees of their own."""
 
 import pathlib
 import subprocess
@@ -128,6 +128,42 @@ class CheckKept(CheckTest):
         self.write("Statistics/A.cpp", "")
         self.write("Statistics/ATest.cpp", "")
         self.assert_fault("nothing is marked", "--check")
+
+
+class Limits(CheckTest):
+    script = "limits"
+
+    HEADER = "// Says what\n// it is.\n\n\n\n\n// Requests\n\n"
+    LIMIT = ("/// Of one frame.\n/// [Frame.IsLimited]\n"
+             "inline constexpr std::size_t kFrameBytes = 2 * 1024;\n")
+
+    def write_limits(self, text, tests="TEST(Frame, IsLimited) {"):
+        self.write("platform/linux/Limits.h", self.HEADER + text)
+        self.write("platform/linux/FrameTest.cpp", tests)
+        self.write("docs/limits.md", "")
+
+    def test_writes_each_limit_with_its_value_reason_and_test(self):
+        self.write_limits(self.LIMIT + "inline constexpr std::size_t kHalf = "
+                          "kFrameBytes / 2;\n")
+        self.assert_fine()
+        text = (self.root / "docs/limits.md").read_text(encoding="utf-8")
+        self.assertIn("- **kFrameBytes: 2 KiB.** Of one frame. (`Frame.IsLimited`)", text)
+        self.assertIn("- **kHalf: 1,024.** Of one frame.", text)
+        self.assert_fine("--check")
+
+    def test_refuses_a_page_that_is_not_up_to_date(self):
+        self.write_limits(self.LIMIT)
+        self.assert_fault("docs/limits.md: not up to date", "--check")
+
+    def test_refuses_a_limit_without_a_test_or_with_one_that_there_is_not(self):
+        self.write_limits(self.LIMIT.replace("/// [Frame.IsLimited]\n", ""))
+        self.assert_fault("kFrameBytes names no test")
+        self.write_limits(self.LIMIT, tests="")
+        self.assert_fault("kFrameBytes: there is no test Frame.IsLimited")
+
+    def test_refuses_a_limit_without_a_reason(self):
+        self.write_limits("inline constexpr std::size_t kFrameBytes = 2;\n")
+        self.assert_fault("kFrameBytes gives no reason")
 
 
 if __name__ == "__main__":

@@ -5,6 +5,7 @@
 #include <utility>
 
 #include "platform/linux/ChannelSource.h"
+#include "platform/linux/Limits.h"
 
 namespace ostrel {
 
@@ -18,7 +19,7 @@ Outcome<std::vector<ChannelValue>> readChannelFile(const std::string& path);
 class ChannelFileFinder final : public ChannelFinder {
  public:
   /// Files that are looked at in one directory, of whatever kind.
-  static constexpr std::size_t kMostFiles = 4096;
+  static constexpr std::size_t kMostFiles = limits::kChannelFiles;
 
   /// `directory` need not exist.
   explicit ChannelFileFinder(std::string directory) : directory_(std::move(directory)) {}

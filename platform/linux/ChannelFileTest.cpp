@@ -262,6 +262,21 @@ TEST_F(ChannelFileFinding, PassesOverOtherFiles) {
   EXPECT_EQ(all.error, std::nullopt);
 }
 
+TEST_F(ChannelFileFinding, LooksAtTheMostFilesAndNoMore) {
+  // The directory itself and the one above it are entries too.
+  std::size_t made = 2;
+  for (; made < ChannelFileFinder::kMostFiles - 1; ++made) {
+    directory_.write("other-" + std::to_string(made), "");
+  }
+  EXPECT_EQ(finder_.find(std::nullopt, std::nullopt).error, std::nullopt);
+  directory_.write("other-last", "");
+  EXPECT_EQ(finder_.find(std::nullopt, std::nullopt).error, std::nullopt);
+  directory_.write("other-too-many", "");
+  const auto found = finder_.find(std::nullopt, std::nullopt);
+  ASSERT_TRUE(found.error);
+  EXPECT_EQ(found.error->code, EFBIG);
+}
+
 TEST_F(ChannelFileFinding, GivesAnErrorForAFileThatCannotBeRead) {
   add("Speaker", "Stats");
   directory_.write("Speaker.Bad", "junk");

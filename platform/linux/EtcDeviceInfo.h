@@ -9,6 +9,7 @@
 #include <vector>
 
 #include "platform/DeviceInfo.h"
+#include "platform/linux/Limits.h"
 
 namespace ostrel {
 
@@ -33,7 +34,7 @@ class EtcDeviceInfo final : public DeviceInfo {
   /// How long the first question waits for files on a disk that hangs. They
   /// count as missing then.
   static constexpr std::chrono::seconds kMostWait{1};
-  static constexpr std::size_t kMostFileBytes = 64 * 1024;
+  static constexpr std::size_t kMostFileBytes = limits::kDeviceFileBytes;
 
   /// The system's files; `$SYSTEMD_ETC_MACHINE_INFO` and `$SYSTEMD_OS_RELEASE`
   /// name others.

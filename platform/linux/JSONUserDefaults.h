@@ -7,6 +7,7 @@
 #include <utility>
 
 #include "platform/UserDefaults.h"
+#include "platform/linux/Limits.h"
 
 namespace ostrel {
 
@@ -16,8 +17,8 @@ namespace ostrel {
 /// `kMostTextBytes`, is left out with an error logged.
 class JSONUserDefaults final : public UserDefaults {
  public:
-  static constexpr std::size_t kMostFileBytes = 64 * 1024;
-  static constexpr std::size_t kMostTextBytes = 4 * 1024;
+  static constexpr std::size_t kMostFileBytes = limits::kDefaultsFileBytes;
+  static constexpr std::size_t kMostTextBytes = limits::kDefaultsTextBytes;
 
   /// `directory` need not exist.
   explicit JSONUserDefaults(std::string directory) : directory_(std::move(directory)) {}

@@ -13,6 +13,7 @@
 
 #include "platform/ScopedLog.h"
 #include "platform/linux/FileDescriptor.h"
+#include "platform/linux/Limits.h"
 
 namespace ostrel {
 
@@ -42,9 +43,9 @@ class LogSink {
 /// the reader.
 class JournalLog final : public ScopedLog {
  public:
-  static constexpr std::size_t kMostWaitingBytes = 256 * 1024;
+  static constexpr std::size_t kMostWaitingBytes = limits::kLogWaitingBytes;
   /// The rest of a longer line is cut off.
-  static constexpr std::size_t kMostLineBytes = 64 * 1024;
+  static constexpr std::size_t kMostLineBytes = limits::kLogLineBytes;
   /// How long the destructor waits for a slow reader.
   static constexpr std::chrono::milliseconds kFarewell{500};
 

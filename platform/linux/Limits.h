@@ -1,31 +1,43 @@
-// Every limit of the service, each with its reason. Limits live in the bindings;
+// Every limit of the service, each with its reason and, in brackets, with the tests that
+// show it. `scripts/limits` writes docs/limits.md from it. Limits live in the bindings;
 // the core knows none.
 #pragma once
 
 #include <chrono>
 #include <cstddef>
+#include <cstdint>
 
 namespace ostrel::limits {
 
+// What one request may be
+
 /// Of one frame, its length field left out. Payloads of 256 KiB must fit with
 /// their request around them.
+/// [UnixSocketListener.TakesAFrameOfTheLargestSizeAndNoneLarger]
 inline constexpr std::size_t kFrameBytes = 320 * 1024;
 
 /// Arrays and dictionaries within one another in a payload. Deeper ones are no
 /// reports; walks stay short.
+/// [PayloadCheck.TakesNestingUpToTheLimit]
 inline constexpr std::size_t kNesting = 32;
 
 /// Values in one payload, keys included: bounds the work that one frame causes.
+/// [PayloadCheck.TakesValuesUpToTheLimit]
 inline constexpr std::size_t kNodes = 65536;
 
 /// Of one text key.
+/// [PayloadCheck.TakesKeysUpToTheLimit]
 inline constexpr std::size_t kKeyBytes = 1024;
 
 /// IDs in one request: each is one delivery.
+/// [RequestFrame.TakesIDsUpToTheLimit]
 inline constexpr std::size_t kReporterIDs = 1024;
+
+// What the clients of a user may have and have under way
 
 /// Connections in all, and of one user. Room for 512 and for load tests of
 /// 1,000 by one user.
+/// [UnixSocketListener.ServesAsManyConnectionsAsAllowedAndSaysWhyNoMore]
 inline constexpr std::size_t kConnections = 2048;
 inline constexpr std::size_t kConnectionsOfUser = 1536;
 
@@ -33,69 +45,178 @@ inline constexpr std::size_t kConnectionsOfUser = 1536;
 /// delivered and stored. Beyond it the socket is not read until half of it is free
 /// again. Some 10,000 messages of usual size: the store's next commit always finds
 /// enough to write.
+/// [RequestBudget.IsExceededBeyondItsBytes,
+/// UnixSocketListener.HoldsBackAClientWithTooMuchUnderWayAndLosesNothing]
 inline constexpr std::size_t kQueuedBytes = 4 * 1024 * 1024;
 
 /// The same of all connections of one user, so that many connections do not make
 /// many times the memory.
+/// [RequestBudget.IsExceededBeyondItsBytes,
+/// PeerChannelBudget.IsThatOfAllConnectionsOfTheUserToo]
 inline constexpr std::size_t kQueuedBytesOfUser = 32 * 1024 * 1024;
 
 /// Sessions in all, and of one user. Room for the 16,384 that are promised and for
 /// load tests of 100,000 by one user; an idle session costs some 500 bytes.
+/// [UserAccount.TakesSessionsUpToTheUsersShareAndTheServices,
+/// UnixSocketListener.MakesAsManySessionsAsAllowedAndAnswersYesForOneMore]
 inline constexpr std::size_t kSessions = 256 * 1024;
 inline constexpr std::size_t kSessionsOfUser = 128 * 1024;
 
 /// Bytes of the entries that sessions keep for their summaries, in all, and of the
 /// messages of one user's clients. Room for a session of a million messages with its
 /// summary, twice. What is beyond a small budget in memory is in files.
+/// [UserAccount.KeepsBytesUpToTheUsersShareAndTheServices]
 inline constexpr std::size_t kKeptBytes = std::size_t{2} * 1024 * 1024 * 1024;
 inline constexpr std::size_t kKeptBytesOfUser = std::size_t{1} * 1024 * 1024 * 1024;
 
 /// What a request costs on a queue beside its payload: the step, its place in the
 /// queue, the buffer's head.
+/// [UnixSocketListener.HoldsBackAClientThatFloodsRequestsWithoutPayload]
 inline constexpr std::size_t kRequestBytes = 256;
 
 /// What each delivery of a message costs beyond the first: its step on the queue of the
 /// session, and its place in the store's. A message to all is taken to go to every
 /// session that there is.
+/// [UnixSocketListener.ChargesEachDeliveryOfAMessage]
 inline constexpr std::size_t kDeliveryBytes = 512;
 
 /// What a request that wants a reply costs besides: the callback, and the reply
 /// that it causes. Keeps the replies to what is queued below `kUnreadReplyBytes`.
+/// [UnixSocketListener.CutsOffAClientThatNeverReadsItsReplies]
 inline constexpr std::size_t kReplyBytes = 256;
+
+// Replies
 
 /// Reply bytes that a client has not read. Beyond it the client is cut off. A reply
 /// that is larger alone is sent all the same.
+/// [PeerChannelReplies.StayUnreadUpToTheLimit]
 inline constexpr std::size_t kUnreadReplyBytes = 1024 * 1024;
 
 /// Reply bytes from which on no further requests are read; a client that is merely
 /// slow stays below `kUnreadReplyBytes` by it.
+/// [UnixSocketListener.SendsALargeReplyToAClientThatReadsSlowly]
 inline constexpr std::size_t kUnreadReplyBytesToPause = kUnreadReplyBytes / 4;
 
 /// How long such a client may read nothing at all before it is cut off.
+/// [UnixSocketListener.CutsOffAClientThatNeverReadsItsReplies]
 inline constexpr std::chrono::seconds kUnreadPatience{3};
+
+// Refusals
 
 /// How long no connection is accepted once the process or the system has no
 /// descriptor left.
+/// [UnixSocketListener.AcceptsAgainOnceThereAreDescriptors]
 inline constexpr std::chrono::milliseconds kAcceptBackOff{100};
 
 /// How often one kind of misuse by one user is logged.
+/// [MisuseLog.LogsAKindOfAUserAgainAfterTheInterval]
 inline constexpr std::chrono::seconds kMisuseLogInterval{60};
+
+// What a session collects
 
 /// Memory of what one session collects until its stop; what is more lies in a file.
 /// A thousand messages of usual size, which few sessions reach.
+/// [FileEntryStorageTest.LeavesAListInMemoryUpToItsShare]
 inline constexpr std::size_t kListBytesInMemory = 256 * 1024;
 
 /// The same of all sessions together: a hundred long ones at a time, and a small part of
 /// what the service may have. Each session begins with 1 KiB whatever the others have.
+/// [FileEntryStorageTest.RefusesWhatFitsNeitherDiskNorMemory]
 inline constexpr std::size_t kListsBytesInMemory = 24 * 1024 * 1024;
 
 /// How long that file is left alone once it could not be written: a disk that is full
 /// is not asked with each message.
+/// [FileEntryStorageTest.LeavesAFullDiskAloneForAWhile]
 inline constexpr std::chrono::milliseconds kPauseOfListsFile{1000};
+
+// What comes from elsewhere
 
 /// Sessions that watch the orientation of the device at a time, and that of the
 /// interface. One that its client left while it was starting never ends, and costs some 5
 /// KiB.
+/// [OrientationWatchObservers.BeyondTheLimitTakeThePlaceOfTheOldest]
 inline constexpr std::size_t kOrientationObservers = 2048;
+
+/// Changes of orientation that are handed on in a second: hands turn a device less
+/// often. What is more is dropped and counted.
+/// [OrientationWatchObservers.AreSparedAFlood]
+inline constexpr int kOrientationChangesPerSecond = 50;
+
+/// How long an operation on drivers waits for one that does not answer: four in a row
+/// hold the clients' requests up for 250 ms at most.
+/// [MappedChannelReportingHanging.GivesAnErrorAndHoldsTheCallerBrieflyOnce]
+inline constexpr std::chrono::milliseconds kDriverWait{150};
+
+/// Drivers that may hang at a time, a thread each.
+/// [MappedChannelReportingHanging.OfAllDriversHoldsTheCallerBrieflyToo]
+inline constexpr std::size_t kHangingDrivers = 4;
+
+/// Channels of one driver group, in all its files: a report of that many is a payload
+/// that is allowed.
+/// [MappedChannelReportingSources.HaveTheMostChannelsInAll]
+inline constexpr std::size_t kDriverChannels = 16384;
+
+/// Files that are looked at in the directory of channels, of whatever kind.
+/// [ChannelFileFinding.LooksAtTheMostFilesAndNoMore]
+inline constexpr std::size_t kChannelFiles = 4096;
+
+/// Of the defaults file: a dozen entries are a few hundred bytes.
+/// [JSONUserDefaultsSuite.IsReadUpToTheLargestFile]
+inline constexpr std::size_t kDefaultsFileBytes = 64 * 1024;
+
+/// Of one text in it.
+/// [JSONUserDefaultsSuite.MayHoldTextsUpToTheLongest]
+inline constexpr std::size_t kDefaultsTextBytes = 4 * 1024;
+
+/// Of the files with the device's facts.
+/// [EtcDeviceInfoFiles.OfTheLargestSizeAreRead]
+inline constexpr std::size_t kDeviceFileBytes = 64 * 1024;
+
+// The store and the log
+
+/// Memory of what waits for the store's writer, of all clients; what clients have under
+/// way is mostly that. A message beyond it is refused with an error, an event dropped
+/// and counted.
+/// [StoreTest.RefusesMessagesBeyondTheBound]
+inline constexpr std::size_t kStoreQueuedBytes = 64 * 1024 * 1024;
+
+/// Analytics events that wait for it.
+/// [StoreTest.DropsAnalyticsEventsBeyondTheBoundAndCountsThem]
+inline constexpr std::size_t kStoreQueuedEvents = 100'000;
+
+/// Operations that are kept while the file cannot be written: a quarter of a minute of a
+/// busy device. The oldest are given up and counted.
+/// [StoreFaults.GivesUpTheOldestInALongFaultAndCountsThem]
+inline constexpr std::size_t kStoreKeptThroughFault = 16384;
+
+/// Damaged files that are kept for those who want to know why.
+/// [StoreFaults.KeepsOnlyTwoFilesSetAside]
+inline constexpr std::size_t kStoreFilesSetAside = 2;
+
+/// Of the store: more than a device reports in months, and a share of its flash that
+/// nobody misses. The oldest rows go.
+/// [StoreTest.RemovesTheOldestRowsOfALargeStore]
+inline constexpr std::int64_t kStoreBytes = std::int64_t{4} * 1024 * 1024 * 1024;
+
+/// How old a row may become.
+/// [StoreTest.RemovesRowsThatAreTooOld]
+inline constexpr std::chrono::hours kStoreAge{24 * 30};
+
+/// Log lines that wait for their reader. What is more is dropped, and a line says how
+/// many were lost: nobody waits for the log.
+/// [JournalLogLines.AreCountedWhereTheyAreLost]
+inline constexpr std::size_t kLogWaitingBytes = 256 * 1024;
+
+/// Of one log line; the rest is cut off.
+/// [JournalLogLines.AreCutAtTheLongestLine]
+inline constexpr std::size_t kLogLineBytes = 64 * 1024;
+
+// Threads
+
+/// Of each class of queues: two cores, and those that wait for files in the background.
+/// [ThreadPoolWorkQueuesTest.HasAFewThreadsForAnyNumberOfQueues]
+inline constexpr std::size_t kInteractiveThreads = 2;
+inline constexpr std::size_t kUtilityThreads = 2;
+inline constexpr std::size_t kBackgroundThreads = 4;
 
 }  // namespace ostrel::limits

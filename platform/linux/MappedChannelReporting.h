@@ -8,6 +8,7 @@
 #include "platform/ChannelReportingService.h"
 #include "platform/linux/ChannelSource.h"
 #include "platform/linux/DeadlineRunner.h"
+#include "platform/linux/Limits.h"
 
 namespace ostrel {
 
@@ -24,12 +25,12 @@ namespace ostrel {
 /// 0 then; a counter that wraps around has moved by what it counted.
 class MappedChannelReporting final : public ChannelReportingService {
  public:
-  static constexpr std::chrono::milliseconds kMostWait{150};
+  static constexpr std::chrono::milliseconds kMostWait = limits::kDriverWait;
   static constexpr std::chrono::milliseconds kWaitBehindAnother{10};
   /// Operations that may hang at a time, one a driver.
-  static constexpr std::size_t kMostHanging = 4;
+  static constexpr std::size_t kMostHanging = limits::kHangingDrivers;
   /// Of one subscription. A report of that many is a payload that is allowed.
-  static constexpr std::size_t kMostChannels = 16384;
+  static constexpr std::size_t kMostChannels = limits::kDriverChannels;
 
   using Finders = std::vector<std::shared_ptr<const ChannelFinder>>;
 

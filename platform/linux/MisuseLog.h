@@ -28,7 +28,8 @@ class MisuseLog {
       : counted_(std::move(counted)) {}
 
   /// `reason` is a few words that continue the kind's sentence.
-  void note(std::uint32_t user, Kind kind, std::string_view reason, Clock::time_point now);
+  void note(std::uint32_t user, Kind kind, std::string_view reason,
+            Clock::time_point now);
 
   /// By kind, since the service began.
   Counts counts() const;

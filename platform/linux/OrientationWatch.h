@@ -66,7 +66,7 @@ class OrientationWatch {
   using Callback = OrientationService::Callback;
 
   /// Changes handed on per second; what exceeds them is dropped and counted.
-  static constexpr int kMostChangesPerSecond = 50;
+  static constexpr int kMostChangesPerSecond = limits::kOrientationChangesPerSecond;
   /// Between two lines that say how many were dropped.
   static constexpr std::chrono::minutes kShortestLogInterval{1};
 

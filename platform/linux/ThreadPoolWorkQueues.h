@@ -9,6 +9,7 @@
 #include <vector>
 
 #include "platform/WorkQueue.h"
+#include "platform/linux/Limits.h"
 #include "platform/linux/TimerThread.h"
 
 namespace ostrel {
@@ -28,9 +29,9 @@ class ThreadPoolWorkQueues final : public WorkQueueFactory {
   /// read it. At most one a thread; not on a queue.
   class Batch;
 
-  static constexpr std::size_t kMostInteractiveThreads = 2;
-  static constexpr std::size_t kMostUtilityThreads = 2;
-  static constexpr std::size_t kMostBackgroundThreads = 4;
+  static constexpr std::size_t kMostInteractiveThreads = limits::kInteractiveThreads;
+  static constexpr std::size_t kMostUtilityThreads = limits::kUtilityThreads;
+  static constexpr std::size_t kMostBackgroundThreads = limits::kBackgroundThreads;
 
   explicit ThreadPoolWorkQueues(std::shared_ptr<TimerThread> timers);
   /// Waits up to 2 s for what is queued, then ends the threads; a step that runs

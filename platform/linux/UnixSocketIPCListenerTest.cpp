@@ -3,6 +3,7 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <poll.h>
+#include <sys/resource.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/un.h>
@@ -591,6 +592,50 @@ TEST_F(UnixSocketListener, HoldsBackAClientThatFloodsRequestsWithoutPayload) {
   EXPECT_TRUE(service->waitForCalls(kRequests));
   sender.join();
   EXPECT_LE(whileHeld, 64u * 1024 / limits::kRequestBytes + 1);
+}
+
+TEST_F(UnixSocketListener, ChargesEachDeliveryOfAMessage) {
+  ListenerLimits limits;
+  limits.queuedBytes = 64 * 1024;
+  serve(limits);
+  service->holdReplies();
+  constexpr std::size_t kDeliveries = 32;
+  constexpr std::size_t kMessages = 50;
+  wire::Request message = messageRequest(0, "x");
+  message.reporterIDs = ReporterIDs(kDeliveries, ReporterID{1});
+  RawClient client(path);
+
+  for (std::size_t i = 0; i < kMessages; ++i) client.send(message);
+  ASSERT_TRUE(service->waitForCalls(1));
+  std::this_thread::sleep_for(100ms);
+  const std::size_t whileHeld = service->calls().size();
+  service->releaseReplies();
+
+  EXPECT_TRUE(service->waitForCalls(kMessages));
+  EXPECT_LE(whileHeld,
+            limits.queuedBytes / ((kDeliveries - 1) * limits::kDeliveryBytes) + 1);
+}
+
+TEST_F(UnixSocketListener, AcceptsAgainOnceThereAreDescriptors) {
+  const CapturedLog log;
+  serve();
+  rlimit usual{};
+  ASSERT_EQ(::getrlimit(RLIMIT_NOFILE, &usual), 0);
+  // One for the client, none for the service.
+  FileDescriptor next(::dup(0));
+  const rlimit scarce{static_cast<rlim_t>(next.get()) + 1, usual.rlim_max};
+  next.reset();
+  ASSERT_EQ(::setrlimit(RLIMIT_NOFILE, &scarce), 0);
+  RawClient client(path);
+  client.send(createRequest(1, 7));
+  EXPECT_FALSE(client.receive(20ms));
+  ASSERT_EQ(::setrlimit(RLIMIT_NOFILE, &usual), 0);
+
+  EXPECT_EQ(hex(client.receive().value_or("")), "8201f5");
+  const auto lines = log.lines(LogLevel::kError);
+  ASSERT_FALSE(lines.empty());
+  EXPECT_THAT(lines.front(), HasSubstr("no connection can be accepted now"));
+  EXPECT_LT(lines.size(), 100u) << "it is tried ten times a second";
 }
 
 TEST_F(UnixSocketListener, CutsOffAClientThatNeverReadsItsReplies) {

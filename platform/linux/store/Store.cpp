@@ -20,9 +20,6 @@ constexpr std::size_t kWriteAhead = 512;
 // the other half is filled meanwhile.
 constexpr std::size_t kCommitBytes = limits::kQueuedBytes / 2;
 
-// Operations kept through a fault.
-constexpr std::size_t kKeptThroughFault = 16384;
-
 // Codes of errors that are not SQLite's, which are positive.
 constexpr int kQueueIsFull = -1;
 constexpr int kStopped = -2;
@@ -275,7 +272,7 @@ void Store::work() {
   }
   publishState();  // Before a caller learns of it from its flush.
   writer_.failFlushes();
-  writer_.keepAtMost(kKeptThroughFault);
+  writer_.keepAtMost(limits::kStoreKeptThroughFault);
 }
 
 bool Store::isCommitDue() const {

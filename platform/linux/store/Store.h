@@ -14,6 +14,7 @@
 #include <vector>
 
 #include "platform/ErrorObject.h"
+#include "platform/linux/Limits.h"
 #include "platform/linux/store/StoreCounters.h"
 #include "platform/linux/store/StoreOperation.h"
 #include "platform/linux/store/StoreWriter.h"
@@ -28,8 +29,8 @@ struct StoreOptions {
 
   /// Memory of what waits for the writer, and analytics events that wait. More is
   /// refused or dropped.
-  std::size_t queuedBytes = 64 * 1024 * 1024;
-  std::size_t queuedEvents = 100'000;
+  std::size_t queuedBytes = limits::kStoreQueuedBytes;
+  std::size_t queuedEvents = limits::kStoreQueuedEvents;
 
   StoreRetention retention;
 

@@ -23,6 +23,7 @@
 
 #include "platform/Logging.h"
 #include "platform/linux/FileDescriptor.h"
+#include "platform/linux/Limits.h"
 #include "platform/linux/store/StoreRowTables.h"
 
 namespace ostrel {
@@ -53,7 +54,6 @@ CREATE TABLE service_status (key TEXT PRIMARY KEY, value);
 constexpr off_t kCheckedAtOpenBytes = 4 * 1024 * 1024;
 
 constexpr int kBusyMilliseconds = 100;
-constexpr std::size_t kFilesSetAside = 2;
 constexpr std::string_view kSetAsideSuffix = ".damaged-";
 
 std::string directoryOf(const std::string& path) {
@@ -439,7 +439,7 @@ void StoreDatabase::removeOldestSetAside() {
     if (name.starts_with(prefix) && !name.ends_with("-wal")) names.emplace_back(name);
   }
   std::sort(names.begin(), names.end());
-  for (std::size_t i = 0; i + kFilesSetAside < names.size(); ++i) {
+  for (std::size_t i = 0; i + limits::kStoreFilesSetAside < names.size(); ++i) {
     const std::string path = directory + "/" + names[i];
     ::unlink(path.c_str());
     ::unlink((path + "-wal").c_str());

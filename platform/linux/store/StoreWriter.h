@@ -8,6 +8,7 @@
 #include <utility>
 #include <vector>
 
+#include "platform/linux/Limits.h"
 #include "platform/linux/store/StoreCounters.h"
 #include "platform/linux/store/StoreDatabase.h"
 #include "platform/linux/store/StoreOperation.h"
@@ -16,10 +17,8 @@ namespace ostrel {
 
 /// What the store keeps.
 struct StoreRetention {
-  /// The store's own: more than a device reports in months, and a share of its flash
-  /// that nobody misses.
-  std::int64_t bytes = std::int64_t{4} * 1024 * 1024 * 1024;
-  std::chrono::microseconds age = std::chrono::hours(24 * 30);
+  std::int64_t bytes = limits::kStoreBytes;
+  std::chrono::microseconds age = limits::kStoreAge;
 };
 
 /// Writes operations to the database and bears its faults. What was handed over

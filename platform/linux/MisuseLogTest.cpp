@@ -1,0 +1,71 @@
+#include "platform/linux/MisuseLog.h"
+
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+
+#include "platform/linux/Limits.h"
+#include "platform/linux/TestSupport.h"
+
+namespace ostrel {
+namespace {
+
+using namespace std::chrono_literals;
+using testing::ElementsAre;
+using testing::HasSubstr;
+using testing::SizeIs;
+using testing_support::CapturedLog;
+using Kind = MisuseLog::Kind;
+
+const MisuseLog::Clock::time_point kNow{std::chrono::hours(1)};
+
+TEST(MisuseLog, SaysWhoWhatAndWhy) {
+  const CapturedLog log;
+  MisuseLog misuse;
+  misuse.note(1000, Kind::kCutOff, "a frame is empty", kNow);
+  misuse.note(1001, Kind::kConnectionRefused, "there are too many", kNow);
+  misuse.note(1002, Kind::kSessionRefused, "there are too many", kNow);
+  EXPECT_THAT(
+      log.lines(LogLevel::kError),
+      ElementsAre(
+          HasSubstr("a client of user 1000 is cut off: a frame is empty"),
+          HasSubstr("a client of user 1001 is not let in: there are too many"),
+          HasSubstr("a client of user 1002 gets no session: there are too many")));
+}
+
+TEST(MisuseLog, LogsAKindOfAUserAgainAfterTheInterval) {
+  const CapturedLog log;
+  MisuseLog misuse;
+  const auto noteAt = [&](std::chrono::nanoseconds time) {
+    misuse.note(1000, Kind::kCutOff, "a frame is empty", kNow + time);
+  };
+  noteAt(0ns);
+  noteAt(limits::kMisuseLogInterval - 1ns);
+  EXPECT_THAT(log.lines(LogLevel::kError), SizeIs(1));
+  noteAt(limits::kMisuseLogInterval);
+  EXPECT_THAT(log.lines(LogLevel::kError), SizeIs(2));
+  noteAt(limits::kMisuseLogInterval + 1ns);
+  EXPECT_THAT(log.lines(LogLevel::kError), SizeIs(2));
+}
+
+TEST(MisuseLog, KeepsUsersAndKindsApart) {
+  const CapturedLog log;
+  MisuseLog misuse;
+  misuse.note(1000, Kind::kCutOff, "x", kNow);
+  misuse.note(1001, Kind::kCutOff, "x", kNow);
+  misuse.note(1000, Kind::kSessionRefused, "x", kNow);
+  misuse.note(1000, Kind::kCutOff, "y", kNow);
+  EXPECT_THAT(log.lines(LogLevel::kError), SizeIs(3));
+}
+
+TEST(MisuseLog, CountsAllAndTellsOfEach) {
+  const CapturedLog log;
+  int told = 0;
+  MisuseLog misuse([&told] { ++told; });
+  for (int i = 0; i < 5; ++i) misuse.note(1000, Kind::kSessionRefused, "x", kNow);
+  misuse.note(1000, Kind::kConnectionRefused, "x", kNow);
+  EXPECT_EQ(misuse.counts(), (MisuseLog::Counts{0, 1, 5}));
+  EXPECT_EQ(told, 6);
+}
+
+}  // namespace
+}  // namespace ostrel

@@ -1,0 +1,102 @@
+#include "platform/linux/PeerChannel.h"
+
+#include <gtest/gtest.h>
+
+#include <string>
+
+namespace ostrel {
+namespace {
+
+constexpr std::size_t kMostUnread = 1000;
+
+class PeerChannelTest : public testing::Test {
+ protected:
+  /// A reply whose frame has `size` bytes.
+  static std::string textForFrameOf(std::size_t size) {
+    std::string frame;
+    wire::appendReply(frame, 1, ErrorObject{"", 0, ""});
+    const std::size_t bare = frame.size();
+    // From 256 bytes on, the text's length takes two bytes more.
+    std::string text(size - bare - 2, 'x');
+    frame.clear();
+    wire::appendReply(frame, 1, ErrorObject{"", 0, text});
+    EXPECT_EQ(frame.size(), size);
+    return text;
+  }
+
+  void replyWithFrameOf(std::size_t size) {
+    channel_.reply(1, ErrorObject{"", 0, textForFrameOf(size)});
+  }
+
+  const std::shared_ptr<ServiceAccount> service_{
+      new ServiceAccount{Share(10), Share(1000)}};
+  const std::shared_ptr<UserAccount> user_ = std::make_shared<UserAccount>(
+      1000, UserAccount::Limits{/*queuedBytes=*/100, /*sessions=*/10, /*keptBytes=*/500},
+      service_);
+  PeerChannel channel_{1, std::make_shared<LoopWaker>(), user_,
+                       PeerChannel::Limits{/*queuedBytes=*/60, kMostUnread}};
+};
+
+using PeerChannelReplies = PeerChannelTest;
+using PeerChannelBudget = PeerChannelTest;
+
+TEST_F(PeerChannelReplies, StayUnreadUpToTheLimit) {
+  for (const std::size_t second : {499, 500}) {
+    PeerChannel channel(1, std::make_shared<LoopWaker>(), user_,
+                        PeerChannel::Limits{/*queuedBytes=*/60, kMostUnread});
+    channel.reply(1, ErrorObject{"", 0, textForFrameOf(500)});
+    channel.reply(1, ErrorObject{"", 0, textForFrameOf(second)});
+    EXPECT_FALSE(channel.hasTooManyUnread()) << second;
+    EXPECT_EQ(channel.unreadBytes(), 500 + second);
+  }
+  replyWithFrameOf(500);
+  replyWithFrameOf(501);
+  EXPECT_TRUE(channel_.hasTooManyUnread());
+  EXPECT_EQ(channel_.unreadBytes(), 500u);
+}
+
+TEST_F(PeerChannelReplies, MayBeLargerAloneThanTheLimit) {
+  replyWithFrameOf(kMostUnread + 500);
+  EXPECT_FALSE(channel_.hasTooManyUnread());
+}
+
+TEST_F(PeerChannelBudget, IsTheConnectionsOwn) {
+  channel_.charge(60);
+  EXPECT_FALSE(channel_.isOverBudget());
+  channel_.charge(1);
+  EXPECT_TRUE(channel_.isOverBudget());
+  channel_.relieve(1);
+  EXPECT_FALSE(channel_.isOverBudget());
+}
+
+TEST_F(PeerChannelBudget, IsThatOfAllConnectionsOfTheUserToo) {
+  PeerChannel other(2, std::make_shared<LoopWaker>(), user_,
+                    PeerChannel::Limits{/*queuedBytes=*/60, kMostUnread});
+  channel_.charge(50);
+  other.charge(50);
+  EXPECT_FALSE(other.isOverBudget());
+  other.charge(1);
+  EXPECT_TRUE(other.isOverBudget());
+  EXPECT_TRUE(channel_.isOverBudget()) << "the user's is used up for all";
+  channel_.relieve(50);
+  EXPECT_FALSE(other.isOverBudget());
+}
+
+TEST_F(PeerChannelBudget, IsGivenBackWithTheConnectionsRequests) {
+  {
+    PeerChannel other(2, std::make_shared<LoopWaker>(), user_,
+                      PeerChannel::Limits{/*queuedBytes=*/60, kMostUnread});
+    other.chargeRequest(40);
+  }
+  EXPECT_EQ(user_->queued().used(), 0u);
+}
+
+TEST_F(PeerChannelBudget, KeepsEntriesInTheUsersName) {
+  EXPECT_TRUE(channel_.keep(500));
+  EXPECT_FALSE(channel_.keep(1));
+  channel_.discard(500);
+  EXPECT_EQ(user_->keptBytes(), 0u);
+}
+
+}  // namespace
+}  // namespace ostrel

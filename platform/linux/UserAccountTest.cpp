@@ -1,0 +1,112 @@
+#include "platform/linux/UserAccount.h"
+
+#include <gtest/gtest.h>
+
+#include <memory>
+#include <thread>
+#include <vector>
+
+namespace ostrel {
+namespace {
+
+std::shared_ptr<ServiceAccount> serviceWith(std::size_t sessions, std::size_t keptBytes) {
+  return std::shared_ptr<ServiceAccount>(
+      new ServiceAccount{Share(sessions), Share(keptBytes)});
+}
+
+TEST(Share, GivesWhatIsThereAndNoMore) {
+  Share share(100);
+  EXPECT_TRUE(share.take(99));
+  EXPECT_TRUE(share.take(1));
+  EXPECT_FALSE(share.take(1));
+  share.give(1);
+  EXPECT_FALSE(share.take(2));
+  EXPECT_TRUE(share.take(1));
+  EXPECT_EQ(share.used(), 100u);
+}
+
+TEST(Share, IsNotFooledByAnAmountThatOverflows) {
+  Share share(100);
+  EXPECT_TRUE(share.take(50));
+  EXPECT_FALSE(share.take(SIZE_MAX - 10));
+  EXPECT_EQ(share.used(), 50u);
+}
+
+TEST(Share, IsExactAmongThreads) {
+  constexpr std::size_t kMost = 1000;
+  Share share(kMost);
+  std::atomic<std::size_t> taken{0};
+  std::vector<std::thread> threads;
+  for (int i = 0; i < 4; ++i) {
+    threads.emplace_back([&] {
+      for (int j = 0; j < 1000; ++j) {
+        if (share.take(1)) ++taken;
+      }
+    });
+  }
+  for (std::thread& thread : threads) thread.join();
+  EXPECT_EQ(taken, kMost);
+  EXPECT_EQ(share.used(), kMost);
+}
+
+TEST(RequestBudget, IsExceededBeyondItsBytes) {
+  RequestBudget budget(100);
+  budget.take(99);
+  EXPECT_FALSE(budget.isExceeded());
+  budget.take(1);
+  EXPECT_FALSE(budget.isExceeded());
+  budget.take(1);
+  EXPECT_TRUE(budget.isExceeded());
+}
+
+TEST(RequestBudget, TellsAWaiterOnceWhenHalfIsFree) {
+  RequestBudget budget(100);
+  budget.take(101);
+  EXPECT_TRUE(budget.await());
+  EXPECT_FALSE(budget.give(50)) << "51 are used";
+  EXPECT_TRUE(budget.give(1));
+  EXPECT_FALSE(budget.give(1)) << "nobody waits any more";
+}
+
+TEST(RequestBudget, DoesNotLetWaitWhenHalfIsFreeAlready) {
+  RequestBudget budget(100);
+  budget.take(50);
+  EXPECT_FALSE(budget.await());
+}
+
+TEST(UserAccount, TakesSessionsUpToTheUsersShareAndTheServices) {
+  const auto service = serviceWith(/*sessions=*/5, /*keptBytes=*/0);
+  const UserAccount::Limits limits{/*queuedBytes=*/0, /*sessions=*/3, /*keptBytes=*/0};
+  UserAccount one(1000, limits, service);
+  UserAccount two(1001, limits, service);
+  EXPECT_TRUE(one.takeSession());
+  EXPECT_TRUE(one.takeSession());
+  EXPECT_TRUE(one.takeSession());
+  EXPECT_FALSE(one.takeSession()) << "the user's share";
+  EXPECT_TRUE(two.takeSession());
+  EXPECT_TRUE(two.takeSession());
+  EXPECT_FALSE(two.takeSession()) << "the service's";
+  EXPECT_EQ(two.sessions(), 2u) << "nothing is taken by a refusal";
+  one.giveSessions(3);
+  EXPECT_TRUE(two.takeSession());
+  EXPECT_EQ(two.sessionsOfAll(), 3u);
+}
+
+TEST(UserAccount, KeepsBytesUpToTheUsersShareAndTheServices) {
+  const auto service = serviceWith(/*sessions=*/0, /*keptBytes=*/1500);
+  const UserAccount::Limits limits{/*queuedBytes=*/0, /*sessions=*/0, /*keptBytes=*/1000};
+  UserAccount one(1000, limits, service);
+  UserAccount two(1001, limits, service);
+  EXPECT_TRUE(one.keep(999));
+  EXPECT_TRUE(one.keep(1));
+  EXPECT_FALSE(one.keep(1));
+  EXPECT_TRUE(two.keep(499));
+  EXPECT_FALSE(two.keep(2));
+  EXPECT_TRUE(two.keep(1));
+  one.discard(1000);
+  EXPECT_EQ(one.keptBytes(), 0u);
+  EXPECT_TRUE(two.keep(500));
+}
+
+}  // namespace
+}  // namespace ostrel
