@@ -117,10 +117,9 @@ std::optional<std::vector<std::int64_t>> anyIDs(Dice& dice) {
   return ids;
 }
 
-Action randomAction(Dice& dice) {
-  Action action{anyKind(dice), {}, std::nullopt};
-  auto& [first, second, third, fourth] = action.numbers;
-  first = roll(dice, 4);  // A slot; others replace it.
+// What a client's action needs besides its slot.
+void rollRequest(Action& action, Dice& dice) {
+  auto& [slot, second, third, fourth] = action.numbers;
   switch (action.kind) {
     case ActionKind::kConnect:
       second = roll(dice, 6);
@@ -147,6 +146,15 @@ Action randomAction(Dice& dice) {
       fourth = anyMessageType(dice);
       action.ids = anyIDs(dice);
       break;
+    default:
+      break;
+  }
+}
+
+// `first` was rolled as a slot is, of four.
+void rollSteering(Action& action, Dice& dice) {
+  auto& [first, second, third, fourth] = action.numbers;
+  switch (action.kind) {
     case ActionKind::kRun:
       first = roll(dice, 60);
       second = roll(dice, 60);
@@ -203,15 +211,17 @@ Action randomAction(Dice& dice) {
     case ActionKind::kFailFiles:
       first = roll(dice, 5);
       break;
-    case ActionKind::kInterrupt:
-    case ActionKind::kOnlyInterrupt:
-    case ActionKind::kInvalidate:
-    case ActionKind::kGetAll:
-    case ActionKind::kKill:
-    case ActionKind::kForgetDiscovery:
-    case ActionKind::kSetFlush:
-    case ActionKind::kWakeSpuriously:
+    default:
       break;
+  }
+}
+
+Action randomAction(Dice& dice) {
+  Action action{anyKind(dice), {roll(dice, 4)}, std::nullopt};
+  if (action.kind <= ActionKind::kKill) {
+    rollRequest(action, dice);
+  } else {
+    rollSteering(action, dice);
   }
   return action;
 }

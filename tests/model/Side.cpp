@@ -256,7 +256,9 @@ void Side::request(OstrelReportingServiceProtocol& client, const Action& action)
       break;
     case ActionKind::kValidate:
       client.reporterIDValid(
-          id, [reply](const Dictionary& value) { reply(description(value)); });
+          id, [events = around.events, number = requests_](const Dictionary& value) {
+            events->add("reply " + std::to_string(number), {value.value()});
+          });
       break;
     case ActionKind::kGetAll:
       client.getAllReporters(
