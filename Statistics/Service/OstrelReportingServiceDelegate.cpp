@@ -215,14 +215,14 @@ OstrelReportingServiceDelegate::findReportingSessionForID(ReporterID reporterID)
 OstrelReportingSession* OstrelReportingServiceDelegate::findReportingSessionForID(
     ReporterID reporterID, Borrowed) const {
   if (reporterID == kNoReporter || !reportingEnabled()) return nullptr;
-  const auto* const owner = sessionIndex_.find(reporterID);
-  if (owner == nullptr) {
+  OstrelReportingSession* const session = sessionIndex_.find(reporterID);
+  if (session == nullptr) {
     OSTREL_LOG_ERROR(logScope, "failed to find reporting session %lli", reporterID);
     return nullptr;
   }
   OSTREL_LOG_INFO(logScope, "found reporting session %lli for client %i", reporterID,
-                  owner->client->clientID());
-  return owner->session;
+                  sessionIndex_.clientOf(reporterID)->clientID());
+  return session;
 }
 
 void OstrelReportingServiceDelegate::listenForDefaultsNotification() {

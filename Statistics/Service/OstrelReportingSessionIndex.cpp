@@ -5,13 +5,14 @@
 #include "Statistics/Service/OstrelReportingSessionIndex.h"
 
 #include <algorithm>
-#include <memory>
-#include <utility>
 
 namespace ostrel {
 namespace {
 
 constexpr std::size_t kFewestSlots = 16;
+
+// So many IDs in a row have homes in a row: slots that share a line of the cache.
+constexpr std::uint64_t kRow = 4;
 
 // The system puts the stack and code at another place in each process.
 std::uint64_t makeSeed() {
@@ -24,38 +25,43 @@ std::uint64_t makeSeed() {
 }  // namespace
 
 OstrelReportingSessionIndex::OstrelReportingSessionIndex()
-    : seed_(makeSeed()), slots_(kFewestSlots) {}
+    : seed_(makeSeed()), slots_(kFewestSlots), bearers_(kFewestSlots) {}
 
+// Clients count their sessions, so that IDs in a row are asked for in a row.
 std::size_t OstrelReportingSessionIndex::home(ReporterID reporterID) const {
-  std::uint64_t hash = static_cast<std::uint64_t>(reporterID) ^ seed_;
+  const auto id = static_cast<std::uint64_t>(reporterID);
+  std::uint64_t hash = id / kRow ^ seed_;
   hash = (hash ^ (hash >> 32)) * 0xD6E8FEB86659FD93;
   hash = (hash ^ (hash >> 32)) * 0xD6E8FEB86659FD93;
-  return (hash ^ (hash >> 32)) & (slots_.size() - 1);
+  hash ^= hash >> 32;
+  return (hash * kRow + id % kRow) & (slots_.size() - 1);
 }
 
-// Its slot, or the free one where it would stand.
-std::size_t OstrelReportingSessionIndex::slotOf(ReporterID reporterID) const {
-  std::size_t at = home(reporterID);
-  while (slots_[at].first.session != nullptr && slots_[at].reporterID != reporterID) {
-    at = next(at);
-  }
-  return at;
+OstrelReportingSessionIndex::Owner OstrelReportingSessionIndex::ownerAt(
+    std::size_t at) const {
+  return {bearers_[at].registration, bearers_[at].client, slots_[at].session};
+}
+
+void OstrelReportingSessionIndex::put(std::size_t at, ReporterID reporterID,
+                                      const Owner& owner) {
+  slots_[at] = {reporterID, owner.session};
+  bearers_[at] = {owner.registration, owner.client};
 }
 
 void OstrelReportingSessionIndex::enter(ReporterID reporterID, const Owner& owner) {
   if (4 * (used_ + 1) > 3 * slots_.size()) resize(2 * slots_.size());
-  Slot& slot = slots_[slotOf(reporterID)];
-  if (slot.first.session == nullptr) {
-    slot = {reporterID, owner};
-    ++used_;
-    return;
-  }
-  if (slot.first.client == owner.client) {
-    slot.first = owner;
+  const std::size_t at = slotOf(reporterID);
+  const Owner first = ownerAt(at);
+  if (first.session == nullptr || first.client == owner.client) {
+    if (first.session == nullptr) ++used_;
+    put(at, reporterID, owner);
     return;
   }
   Owner later = owner;
-  if (later.registration < slot.first.registration) std::swap(slot.first, later);
+  if (later.registration < first.registration) {
+    put(at, reporterID, owner);
+    later = first;
+  }
   auto& owners = laterOwners_[reporterID];
   const auto place = std::lower_bound(
       owners.begin(), owners.end(), later,
@@ -70,9 +76,8 @@ void OstrelReportingSessionIndex::enter(ReporterID reporterID, const Owner& owne
 void OstrelReportingSessionIndex::remove(ReporterID reporterID,
                                          const OstrelReportingServerInstance& client) {
   const std::size_t at = slotOf(reporterID);
-  Slot& slot = slots_[at];
-  if (slot.first.session == nullptr) return;
-  const bool isFirst = slot.first.client == &client;
+  if (slots_[at].session == nullptr) return;
+  const bool isFirst = bearers_[at].client == &client;
   const auto found = laterOwners_.find(reporterID);
   if (found == laterOwners_.end()) {
     if (isFirst) vacate(at);
@@ -80,7 +85,7 @@ void OstrelReportingSessionIndex::remove(ReporterID reporterID,
   }
   auto& owners = found->second;
   if (isFirst) {
-    slot.first = owners.front();
+    put(at, reporterID, owners.front());
     owners.erase(owners.begin());
   } else {
     std::erase_if(owners, [&](const Owner& owner) { return owner.client == &client; });
@@ -91,14 +96,13 @@ void OstrelReportingSessionIndex::remove(ReporterID reporterID,
 // Each ID that follows without a gap moves down if that brings it towards its home.
 void OstrelReportingSessionIndex::vacate(std::size_t at) {
   const std::size_t mask = slots_.size() - 1;
-  for (std::size_t from = next(at); slots_[from].first.session != nullptr;
-       from = next(from)) {
+  for (std::size_t from = next(at); slots_[from].session != nullptr; from = next(from)) {
     const std::size_t distance = (from - home(slots_[from].reporterID)) & mask;
     if (distance < ((from - at) & mask)) continue;
-    slots_[at] = slots_[from];
+    put(at, slots_[from].reporterID, ownerAt(from));
     at = from;
   }
-  slots_[at] = Slot();
+  put(at, ReporterID{}, Owner{});
   --used_;
   if (slots_.size() > kFewestSlots && 8 * used_ < slots_.size()) {
     resize(slots_.size() / 2);
@@ -106,10 +110,15 @@ void OstrelReportingSessionIndex::vacate(std::size_t at) {
 }
 
 void OstrelReportingSessionIndex::resize(std::size_t slots) {
-  std::vector<Slot> old(slots);
-  old.swap(slots_);
-  for (const Slot& slot : old) {
-    if (slot.first.session != nullptr) slots_[slotOf(slot.reporterID)] = slot;
+  std::vector<Slot> oldSlots(slots);
+  std::vector<Bearer> oldBearers(slots);
+  oldSlots.swap(slots_);
+  oldBearers.swap(bearers_);
+  for (std::size_t i = 0; i < oldSlots.size(); ++i) {
+    const auto& [reporterID, session] = oldSlots[i];
+    if (session == nullptr) continue;
+    put(slotOf(reporterID), reporterID,
+        {oldBearers[i].registration, oldBearers[i].client, session});
   }
 }
 

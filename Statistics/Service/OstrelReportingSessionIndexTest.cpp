@@ -24,8 +24,7 @@ class OstrelReportingSessionIndexTest : public testing::Test {
     return {registration, client(registration), session(sessionNumber)};
   }
   OstrelReportingSession* found(std::int64_t reporterID) const {
-    const Owner* owner = index_.find(ReporterID{reporterID});
-    return owner != nullptr ? owner->session : nullptr;
+    return index_.find(ReporterID{reporterID});
   }
 
   std::array<char, 256> memory_{};
@@ -38,7 +37,7 @@ TEST_F(OstrelReportingSessionIndexTest, FindsWhatWasEntered) {
   index_.enter(ReporterID{-7}, owner(1, 11));
   EXPECT_EQ(found(7), session(10));
   EXPECT_EQ(found(-7), session(11));
-  EXPECT_EQ(index_.find(ReporterID{7})->client, client(1));
+  EXPECT_EQ(index_.clientOf(ReporterID{7}), client(1));
 }
 
 TEST_F(OstrelReportingSessionIndexTest, ReplacesTheSessionOfTheSameClient) {
@@ -54,8 +53,10 @@ TEST_F(OstrelReportingSessionIndexTest, FindsTheClientThatRegisteredFirst) {
   index_.enter(ReporterID{7}, owner(3, 13));
   index_.enter(ReporterID{7}, owner(1, 11));
   EXPECT_EQ(found(7), session(11));
+  EXPECT_EQ(index_.clientOf(ReporterID{7}), client(1));
   index_.remove(ReporterID{7}, *client(1));
   EXPECT_EQ(found(7), session(12));
+  EXPECT_EQ(index_.clientOf(ReporterID{7}), client(2));
   index_.remove(ReporterID{7}, *client(3));
   EXPECT_EQ(found(7), session(12));
   index_.remove(ReporterID{7}, *client(2));
