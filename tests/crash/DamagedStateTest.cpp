@@ -182,18 +182,21 @@ const State kStates[] = {
      }},
     {"FileAsStateDirectory", Before::kNone, After::kRefused, "Not a directory",
      [](const auto& service) { replace(service, "state", "no directory"); }},
-    {"LinkToNothingAsStateDirectory", Before::kNone, After::kRefused, "state",
+    {"LinkToNothingAsStateDirectory", Before::kNone, After::kRefused,
+     "reports.db: No such file or directory",
      [](const auto& service) { replaceByLink(service, "state", "/nonexistent/dir"); }},
     // The directory of the session logs.
-    {"FileAsLogDirectory", Before::kKept, After::kStored, "logs",
+    {"FileAsLogDirectory", Before::kKept, After::kStored, "logs: Not a directory",
      [](const auto& service) { replace(service, "logs", "no directory"); }},
-    {"FileInTheLogDirectory", Before::kKept, After::kStored, "logs",
+    {"FileInTheLogDirectory", Before::kKept, After::kStored, "Reporting: Not a directory",
      [](const auto& service) { replace(service, "logs/Audio", "no directory"); }},
-    {"LinkToNothingAsLogDirectory", Before::kKept, After::kStored, "logs",
+    {"LinkToNothingAsLogDirectory", Before::kKept, After::kStored,
+     "logs: No such file or directory",
      [](const auto& service) { replaceByLink(service, "logs", "/nonexistent/dir"); }},
-    {"LinkInTheLogDirectory", Before::kKept, After::kStored, "logs",
+    {"LinkInTheLogDirectory", Before::kKept, After::kStored, "Reporting: Not a directory",
      [](const auto& service) { replaceByLink(service, "logs/Audio", "/tmp"); }},
-    {"LogDirectoryReadOnly", Before::kKept, After::kStored, "logs",
+    {"LogDirectoryReadOnly", Before::kKept, After::kStored,
+     "Reporting: Permission denied",
      [](const auto& service) {
        fs::remove_all(service / "logs");
        fs::create_directories(service / "logs");
