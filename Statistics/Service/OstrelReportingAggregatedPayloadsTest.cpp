@@ -2,6 +2,7 @@
 
 #include <gtest/gtest.h>
 
+#include <optional>
 #include <string>
 #include <thread>
 #include <vector>
@@ -130,6 +131,106 @@ TEST_F(OstrelReportingAggregatedPayloadsTest, ShowsWhatIsMergedLaterInLaterSnaps
 
   EXPECT_EQ(entriesOf(before), std::vector<std::string>{"{}"});
   EXPECT_EQ(entriesOf(list.snapshot()), std::vector<std::string>{"{a: 1}"});
+}
+
+TEST_F(OstrelReportingAggregatedPayloadsTest, LeavesOutWhatTheStorageRefuses) {
+  OstrelReportingAggregatedPayloads list(storage_, ReporterID{42});
+  list.append("a", {{"x", 1}});
+  fakes.entryStorage->setMostBytesOfList(14);
+
+  list.append("b", {{"text", "too long"}});
+  list.append("c", {{"x", 2}});
+
+  EXPECT_EQ(list.size(), 2u);
+  EXPECT_EQ(entriesOf(list.snapshot()),
+            (std::vector<std::string>{"{a: {x: 1}}", "{c: {x: 2}}"}));
+}
+
+TEST_F(OstrelReportingAggregatedPayloadsTest, SaysWhenItCouldNotReadAll) {
+  OstrelReportingAggregatedPayloads list(storage_, ReporterID{42});
+  list.append("a", Dictionary());
+  list.insertFront(std::make_shared<MutableDictionary>());
+  EXPECT_TRUE(list.snapshot().forEach([](ValueView) {}));
+
+  fakes.entryStorage->setReadableRuns(0);
+
+  EXPECT_FALSE(list.snapshot().forEach([](ValueView) {}));
+  EXPECT_EQ(entriesOf(list.snapshot()), std::vector<std::string>{"{}"});
+}
+
+// A dictionary of that size, encoded.
+Dictionary payloadOf(std::size_t bytes) {
+  const std::size_t heads = bytes <= 65535 + 9 ? 9 : 11;
+  return {{"text", std::string(bytes - heads, 'x')}};
+}
+
+TEST_F(OstrelReportingAggregatedPayloadsTest, RefersToALargePayloadOfTheService) {
+  OstrelReportingAggregatedPayloads list(storage_, ReporterID{42});
+  fakes.entryStorage->setMostBytesOfList(64);
+  std::vector<std::string> expected;
+  for (const std::size_t size : {65535u, 65536u, 65537u}) {
+    const Dictionary payload = payloadOf(size);
+    ASSERT_EQ(payload.owner().size(), size);
+    list.append("small", Dictionary());
+    list.append("large", payload);
+    expected.emplace_back("{small: {}}");
+    if (size >= 65536) expected.push_back("{large: " + description(payload) + "}");
+  }
+  list.append("last", Dictionary());
+  expected.emplace_back("{last: {}}");
+
+  EXPECT_EQ(list.size(), expected.size());
+  EXPECT_EQ(entriesOf(list.snapshot()), expected);
+}
+
+TEST_F(OstrelReportingAggregatedPayloadsTest, ReferenceOutlivesWhatWasAppended) {
+  OstrelReportingAggregatedPayloads list(storage_, ReporterID{42});
+  std::optional<Dictionary> payload = payloadOf(70'000);
+  const std::string expected = "{large: " + description(*payload) + "}";
+  list.append("large", *payload);
+  const auto snapshot = list.snapshot();
+  list.append("larger", *payload);
+  payload.reset();
+
+  EXPECT_EQ(entriesOf(snapshot), std::vector<std::string>{expected});
+  EXPECT_EQ(list.size(), 2u);
+}
+
+class ClientAccount final : public PayloadAccount {
+ public:
+  void charge(std::size_t) noexcept override {}
+  void relieve(std::size_t) noexcept override {}
+  bool keep(std::size_t bytes) noexcept override {
+    kept += bytes;
+    return true;
+  }
+  void discard(std::size_t bytes) noexcept override { kept -= bytes; }
+  std::size_t kept = 0;
+};
+
+Dictionary ofClient(const Dictionary& plain,
+                    const std::shared_ptr<ClientAccount>& client) {
+  ValueBuffer buffer = ValueBuffer::copyOf(plain.value().bytes(), client);
+  const std::uint8_t* const item = std::as_const(buffer).data();
+  return Dictionary(std::move(buffer), item);
+}
+
+TEST_F(OstrelReportingAggregatedPayloadsTest, ChargesTheClientForWhatItKeeps) {
+  const auto client = std::make_shared<ClientAccount>();
+  {
+    OstrelReportingAggregatedPayloads list(storage_, ReporterID{42});
+    const Dictionary small{{"a", 1}};
+    list.append("id", ofClient(small, client));
+    const std::size_t entry = 1 + 3 + small.value().bytes().size();
+    EXPECT_EQ(client->kept, entry);
+    const Dictionary large = payloadOf(100'000);
+    list.append("id", ofClient(large, client));  // Copied: it is the client's.
+    EXPECT_EQ(client->kept, entry + 1 + 3 + 100'000);
+    list.append("id", small);
+    EXPECT_EQ(client->kept, entry + 1 + 3 + 100'000);
+    EXPECT_EQ(list.size(), 3u);
+  }
+  EXPECT_EQ(client->kept, 0u);
 }
 
 }  // namespace

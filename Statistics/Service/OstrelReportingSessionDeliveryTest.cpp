@@ -57,6 +57,21 @@ TEST_F(OstrelReportingSessionDelivery, DeliversInItsOrder) {
   EXPECT_EQ(replies, Replies{std::nullopt});
 }
 
+TEST_F(OstrelReportingSessionDelivery, GoesOnWithoutTheEntryThatIsRefused) {
+  const auto session = makeStarted(kHaptics);
+  fakes.entryStorage->setMostBytesOfList(0);
+
+  sendForReply(*session, {{"a", 1}}, 1, 0);
+  sendForReply(*session, {{"b", 2}}, 1, 0);
+
+  EXPECT_EQ(sent().size(), 2u);
+  EXPECT_EQ(fakes.analyticsSink->names().size(), 2u);
+  EXPECT_EQ(replies, (Replies{std::nullopt, std::nullopt}));
+  EXPECT_EQ(entriesOf(*session), Events{});
+  EXPECT_EQ(fakes.log->texts(LogLevel::kError).size(), 1u);
+  EXPECT_EQ(session->createSummaryEventForSession(), std::nullopt);
+}
+
 TEST_F(OstrelReportingSessionDelivery, MirrorsBeforeItAggregates) {
   const auto session = makeStarted(kHaptics);
   fakes.telemetryBackend->setOnSend([&](const FakeTelemetryMessage&) {

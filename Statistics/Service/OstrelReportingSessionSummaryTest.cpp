@@ -2,8 +2,11 @@
 
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <chrono>
 #include <limits>
+#include <random>
+#include <utility>
 
 #include "Statistics/Service/SessionTestFixture.h"
 
@@ -83,6 +86,67 @@ TEST_F(OstrelReportingSessionSummary, JoinsThePayloadsOfOneIdentifier) {
             (Dictionary{{"Ostrel_Session_Summary_Event", "65535"},
                         {"Generic_Generic_1", "{a: 1},{a: 2},{}"},
                         {"Other_1", "{b: x}"}}));
+}
+
+// The same, made the plain way.
+Dictionary plainSummary(const std::vector<Dictionary>& entries) {
+  std::vector<std::pair<std::string, std::string>> groups;
+  for (const Dictionary& entry : entries) {
+    for (const auto& [key, value] : entry) {
+      const std::string name(*key.string());
+      const auto group =
+          std::find_if(groups.begin(), groups.end(),
+                       [&](const auto& known) { return known.first == name; });
+      if (group == groups.end()) {
+        groups.emplace_back(name, description(value));
+      } else {
+        group->second += ',' + description(value);
+      }
+    }
+  }
+  DictionaryBuilder summary;
+  summary.set("Ostrel_Session_Summary_Event", "3");
+  for (const auto& [key, text] : groups) summary.set(key, Value(text));
+  return summary.build();
+}
+
+TEST_F(OstrelReportingSessionSummary, GroupsAnyEntriesInTheOrderOfTheirFirstKeys) {
+  std::mt19937 random(3);
+  for (const std::size_t keys : {1u, 31u, 32u, 33u, 1000u}) {
+    OstrelReportingAggregatedPayloads list(*fakes.entryStorage, ReporterID{42});
+    std::vector<Dictionary> entries;
+    for (int i = 0; i < 400; ++i) {
+      DictionaryBuilder entry;
+      for (std::size_t values = random() % 3; values != 0; --values) {
+        entry.set("k" + std::to_string(random() % keys),
+                  std::string(random() % 300, static_cast<char>('a' + i % 26)));
+      }
+      entries.push_back(entry.build());
+      list.append(entries.back());
+    }
+    const Dictionary summary = summaryEvent(ServiceType{3}, list.snapshot());
+    const Dictionary expected = plainSummary(entries);
+    ASSERT_TRUE(std::ranges::equal(summary.value().bytes(), expected.value().bytes()))
+        << keys;
+  }
+}
+
+TEST_F(OstrelReportingSessionSummary, IsADictionaryStillWhenTheListCannotBeRead) {
+  OstrelReportingAggregatedPayloads list(*fakes.entryStorage, ReporterID{42});
+  list.append("a", {{"x", 1}});
+  fakes.entryStorage->setReadableRuns(0);
+  EXPECT_EQ(summaryEvent(ServiceType{3}, list.snapshot()),
+            (Dictionary{{"Ostrel_Session_Summary_Event", "3"}}));
+}
+
+TEST_F(OstrelReportingSessionSummary, HasBlanksForWhatCouldBeReadOnlyOnce) {
+  OstrelReportingAggregatedPayloads list(*fakes.entryStorage, ReporterID{42});
+  for (int i = 0; i < 4; ++i) list.append(i % 2 == 0 ? "a" : "b", {{"x", i}});
+  fakes.entryStorage->setReadableRuns(3);  // Two of the first walk, one of the second.
+  EXPECT_EQ(summaryEvent(ServiceType{3}, list.snapshot()),
+            (Dictionary{{"Ostrel_Session_Summary_Event", "3"},
+                        {"a", "{x: 0},{x: 2}"},
+                        {"b", "{x: 1}       "}}));
 }
 
 TEST_F(OstrelReportingSessionSummary, GroupsEachKeyOfAnEntryOfSeveral) {

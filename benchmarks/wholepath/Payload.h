@@ -2,6 +2,7 @@
 
 #include <cstddef>
 #include <string>
+#include <string_view>
 
 #include "ostrel/Message.h"
 
@@ -14,6 +15,8 @@ inline constexpr std::size_t kPayloadBytes = 185;
 
 inline constexpr reporting::Category kExampleCategory{0x40000007};
 inline constexpr reporting::MessageType kExampleType{1};
+/// Of its identifiers, which end with its number in the session.
+inline constexpr std::string_view kExampleName = "Routing_RouteChange_Start_";
 
 /// The frame of the same payload without anything of ours around it: a length of 4
 /// bytes and the payload.

@@ -49,10 +49,11 @@ class FakeEntries final : public StoredEntries {
 
     bool forEachRun(const RunCallback& callback) const override {
       for (std::size_t first = 0; first < entries_.size(); first += kEntriesOfRun) {
-        if (state_->isUnreadable) {
+        if (state_->readableRuns == 0) {
           OSTREL_LOG_ERROR(processLogScope, "cannot read the list back");
           return false;
         }
+        --state_->readableRuns;
         std::string run;
         const std::size_t end = std::min(first + kEntriesOfRun, entries_.size());
         for (std::size_t i = first; i < end; ++i) run += *entries_[i];

@@ -18,8 +18,8 @@ class FakeEntryStorage final : public EntryStorage {
 
   /// Each list takes this many bytes from now on, what it has included.
   void setMostBytesOfList(std::size_t bytes) { state_->mostBytes = bytes; }
-  /// Whether runs from now on cannot be read.
-  void setUnreadable(bool isUnreadable) { state_->isUnreadable = isUnreadable; }
+  /// After so many runs from now on, none can be read.
+  void setReadableRuns(std::uint64_t runs) { state_->readableRuns = runs; }
 
   std::uint64_t refusedEntries() const { return state_->refused; }
 
@@ -27,7 +27,7 @@ class FakeEntryStorage final : public EntryStorage {
   friend class FakeEntries;
   struct State {
     std::atomic<std::size_t> mostBytes{std::numeric_limits<std::size_t>::max()};
-    std::atomic<bool> isUnreadable{false};
+    std::atomic<std::uint64_t> readableRuns{std::numeric_limits<std::uint64_t>::max()};
     std::atomic<std::uint64_t> refused{0};
   };
 

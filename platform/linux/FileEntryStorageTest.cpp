@@ -1,0 +1,367 @@
+#include "platform/linux/FileEntryStorage.h"
+
+#include <fcntl.h>
+#include <gtest/gtest.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <cerrno>
+#include <filesystem>
+#include <random>
+
+#include "platform/linux/Limits.h"
+#include "platform/linux/TestSupport.h"
+
+namespace ostrel {
+namespace {
+
+constexpr ReporterID kSession{42};
+constexpr std::chrono::milliseconds kNoPause{0};
+constexpr std::size_t kFirstChunk = 1024;
+
+// What the calls below do; as the system's own unless a test says otherwise.
+struct Faults {
+  std::atomic<int> openError{0};
+  std::atomic<int> writeError{0};
+  std::atomic<int> readError{0};
+  std::atomic<bool> writesAreShort{false};
+  std::atomic<int> writes{0};
+};
+Faults faults;
+
+template <typename Result, typename Call>
+Result failingWith(int error, Call call) {
+  if (error == 0) return call();
+  errno = error;
+  return -1;
+}
+
+SpillCalls faultyCalls() {
+  return {[](const char* path, int flags, mode_t mode) {
+            return failingWith<int>(faults.openError,
+                                    [&] { return ::open(path, flags, mode); });
+          },
+          ::mkostemp,
+          [](int file, const iovec* parts, int count, off_t begin) {
+            ++faults.writes;
+            return failingWith<ssize_t>(faults.writeError, [&] {
+              if (!faults.writesAreShort) return ::pwritev(file, parts, count, begin);
+              return ::pwrite(file, parts->iov_base, (parts->iov_len + 1) / 2, begin);
+            });
+          },
+          [](int file, void* to, std::size_t size, off_t begin) {
+            return failingWith<ssize_t>(faults.readError,
+                                        [&] { return ::pread(file, to, size, begin); });
+          }};
+}
+
+bool append(StoredEntries& entries, std::string_view text) {
+  const StoredEntries::Bytes parts[] = {
+      {reinterpret_cast<const std::uint8_t*>(text.data()), text.size()}};
+  return entries.append(parts, nullptr);
+}
+
+std::string bytesOf(const StoredEntries::Snapshot& snapshot) {
+  std::string all;
+  EXPECT_TRUE(snapshot.forEachRun(
+      [&](StoredEntries::Bytes run) { all.append(run.begin(), run.end()); }));
+  return all;
+}
+
+// The descriptors of files without a name below `directory`.
+std::vector<int> namelessFiles(const std::string& directory) {
+  std::vector<int> found;
+  for (const auto& entry : std::filesystem::directory_iterator("/proc/self/fd")) {
+    std::error_code error;
+    const std::string target = std::filesystem::read_symlink(entry.path(), error);
+    if (target.starts_with(directory + "/") && target.ends_with(" (deleted)")) {
+      found.push_back(std::stoi(entry.path().filename()));
+    }
+  }
+  return found;
+}
+
+std::size_t openDescriptors() {
+  return static_cast<std::size_t>(
+      std::distance(std::filesystem::directory_iterator("/proc/self/fd"),
+                    std::filesystem::directory_iterator()));
+}
+
+class FileEntryStorageTest : public testing::Test {
+ protected:
+  FileEntryStorageTest() {
+    faults.openError = 0;
+    faults.writeError = 0;
+    faults.readError = 0;
+    faults.writesAreShort = false;
+    faults.writes = 0;
+  }
+
+  FileEntryStorage storageOf(std::size_t bytesOfList, std::size_t bytesOfAll) {
+    return FileEntryStorage(directory_.path(), {bytesOfList, bytesOfAll, kNoPause},
+                            faultyCalls());
+  }
+
+  void expectOneError(const std::string& end) {
+    const auto lines = log_.lines(LogLevel::kError);
+    ASSERT_EQ(lines.size(), 1u);
+    EXPECT_TRUE(lines[0].ends_with(end)) << lines[0];
+  }
+
+  testing_support::CapturedLog log_;
+  testing_support::TemporaryDirectory directory_;
+};
+
+TEST_F(FileEntryStorageTest, HasNoMemoryForAListWithoutEntries) {
+  FileEntryStorage storage(directory_.path());
+  const auto entries = storage.makeEntries(kSession);
+  EXPECT_EQ(storage.bytesInMemory(), 0u);
+  append(*entries, "x");
+  EXPECT_EQ(storage.bytesInMemory(), kFirstChunk);
+}
+
+TEST_F(FileEntryStorageTest, LeavesAListInMemoryUpToItsShare) {
+  // Two chunks: 1 KiB and 2 KiB.
+  for (const std::size_t share : {3071u, 3072u, 3073u}) {
+    FileEntryStorage storage = storageOf(share, /*bytesOfAll=*/1 << 20);
+    const auto entries = storage.makeEntries(kSession);
+    const std::string entry(64, 'x');
+    for (int i = 0; i < 48; ++i) append(*entries, entry);
+    EXPECT_EQ(storage.hasFile(), share < 3072) << share;
+    append(*entries, entry);
+    EXPECT_TRUE(storage.hasFile()) << share;
+    EXPECT_EQ(bytesOf(*entries->snapshot()).size(), 49u * 64) << share;
+  }
+}
+
+TEST_F(FileEntryStorageTest, HasNoMoreMemoryForALongListThanItsShare) {
+  FileEntryStorage storage(directory_.path());
+  const auto entries = storage.makeEntries(kSession);
+  const std::string entry(200, 'x');
+  std::size_t most = 0;
+  for (int i = 0; i < 10000; ++i) {
+    append(*entries, entry);
+    most = std::max(most, storage.bytesInMemory());
+  }
+  EXPECT_LE(most, limits::kListBytesInMemory);
+  EXPECT_TRUE(storage.hasFile());
+}
+
+TEST_F(FileEntryStorageTest, HasNoMoreMemoryForAllListsThanTheirShare) {
+  constexpr std::size_t kLists = 100;
+  constexpr std::size_t kAll = 200 * 1024;
+  FileEntryStorage storage = storageOf(limits::kListBytesInMemory, kAll);
+  std::vector<std::unique_ptr<StoredEntries>> lists;
+  for (std::size_t i = 0; i < kLists; ++i) lists.push_back(storage.makeEntries(kSession));
+  for (int i = 0; i < 100; ++i) {
+    for (const auto& list : lists) ASSERT_TRUE(append(*list, std::string(100, 'x')));
+    ASSERT_LE(storage.bytesInMemory(), kAll + kLists * kFirstChunk);
+  }
+  for (const auto& list : lists) {
+    EXPECT_EQ(bytesOf(*list->snapshot()), std::string(10000, 'x'));
+  }
+  lists.clear();
+  EXPECT_EQ(storage.bytesInMemory(), 0u);
+}
+
+TEST_F(FileEntryStorageTest, ReadsBackWithoutHavingTheListInMemory) {
+  FileEntryStorage storage(directory_.path());
+  const auto entries = storage.makeEntries(kSession);
+  for (int i = 0; i < 20000; ++i) append(*entries, std::string(200, 'x'));
+  std::size_t largest = 0;
+  entries->snapshot()->forEachRun(
+      [&](StoredEntries::Bytes run) { largest = std::max(largest, run.size()); });
+  EXPECT_LE(largest, 256u * 1024);
+}
+
+TEST_F(FileEntryStorageTest, HasOneFileThatOnlyTheServiceCanRead) {
+  const std::size_t before = openDescriptors();
+  FileEntryStorage storage = storageOf(/*bytesOfList=*/1, /*bytesOfAll=*/1);
+  std::vector<std::unique_ptr<StoredEntries>> lists;
+  for (int i = 0; i < 20; ++i) {
+    lists.push_back(storage.makeEntries(kSession));
+    for (int j = 0; j < 20; ++j) append(*lists.back(), std::string(500, 'x'));
+  }
+  EXPECT_TRUE(std::filesystem::is_empty(directory_.path()));
+  EXPECT_EQ(openDescriptors(), before + 1);
+  const auto files = namelessFiles(directory_.path());
+  ASSERT_EQ(files.size(), 1u);
+  struct stat status {};
+  ASSERT_EQ(::fstat(files[0], &status), 0);
+  EXPECT_EQ(status.st_mode & 07777, 0600u);
+  EXPECT_EQ(status.st_nlink, 0u);
+  EXPECT_EQ(::fcntl(files[0], F_GETFD), FD_CLOEXEC);
+  lists.clear();
+  EXPECT_EQ(openDescriptors(), before);
+}
+
+TEST_F(FileEntryStorageTest, LeavesNoFileBehindWhereEachHasAName) {
+  for (const int error : {EOPNOTSUPP, EISDIR}) {
+    faults.openError = error;
+    FileEntryStorage storage = storageOf(/*bytesOfList=*/1, /*bytesOfAll=*/1);
+    const auto entries = storage.makeEntries(kSession);
+    for (int i = 0; i < 20; ++i) EXPECT_TRUE(append(*entries, std::string(500, 'x')));
+    EXPECT_TRUE(storage.hasFile());
+    EXPECT_TRUE(std::filesystem::is_empty(directory_.path()));
+    EXPECT_EQ(bytesOf(*entries->snapshot()), std::string(10000, 'x'));
+  }
+}
+
+TEST_F(FileEntryStorageTest, GivesTheRoomOnTheDiskBackWithEachList) {
+  FileEntryStorage storage(directory_.path());
+  const auto small = storage.makeEntries(kSession);
+  auto large = storage.makeEntries(kSession);
+  const std::string entry(1000, 'x');
+  for (int i = 0; i < 300; ++i) append(*small, entry);
+  for (int i = 0; i < 4000; ++i) append(*large, entry);
+  const auto files = namelessFiles(directory_.path());
+  ASSERT_EQ(files.size(), 1u);
+  struct stat before {};
+  ::fstat(files[0], &before);
+
+  large.reset();
+
+  struct stat after {};
+  ::fstat(files[0], &after);
+  EXPECT_LT(after.st_blocks, before.st_blocks / 2);
+  EXPECT_EQ(bytesOf(*small->snapshot()), std::string(300'000, 'x'));
+}
+
+TEST_F(FileEntryStorageTest, GoesOnAfterAWriteThatTookAPart) {
+  faults.writesAreShort = true;
+  FileEntryStorage storage = storageOf(/*bytesOfList=*/4096, /*bytesOfAll=*/4096);
+  const auto entries = storage.makeEntries(kSession);
+  std::string expected;
+  for (int i = 0; i < 500; ++i) {
+    const std::string entry = std::to_string(i) + std::string(200, ',');
+    ASSERT_TRUE(append(*entries, entry));
+    expected += entry;
+  }
+  EXPECT_EQ(bytesOf(*entries->snapshot()), expected);
+}
+
+TEST_F(FileEntryStorageTest, KeepsEntriesInMemoryWhileTheDiskIsFull) {
+  FileEntryStorage storage = storageOf(/*bytesOfList=*/4096, /*bytesOfAll=*/1 << 20);
+  const auto entries = storage.makeEntries(kSession);
+  const std::string entry(100, 'x');
+  for (int i = 0; i < 100; ++i) append(*entries, entry);
+  ASSERT_TRUE(storage.hasFile());
+
+  faults.writeError = ENOSPC;
+  for (int i = 0; i < 5000; ++i) ASSERT_TRUE(append(*entries, entry));
+  EXPECT_EQ(bytesOf(*entries->snapshot()), std::string(510'000, 'x'));
+  EXPECT_EQ(storage.refusedEntries(), 0u);
+
+  faults.writeError = 0;
+  for (int i = 0; i < 5000; ++i) ASSERT_TRUE(append(*entries, entry));
+  EXPECT_EQ(bytesOf(*entries->snapshot()), std::string(1'010'000, 'x'));
+  EXPECT_LE(storage.bytesInMemory(), 128u * 1024);
+}
+
+TEST_F(FileEntryStorageTest, RefusesWhatFitsNeitherDiskNorMemory) {
+  faults.writeError = ENOSPC;
+  FileEntryStorage storage = storageOf(/*bytesOfList=*/4096, /*bytesOfAll=*/10'000);
+  const auto entries = storage.makeEntries(kSession);
+  std::string expected;
+  std::uint64_t refused = 0;
+  for (int i = 0; i < 200; ++i) {
+    const std::string entry = std::to_string(i) + std::string(100, ',');
+    if (append(*entries, entry)) {
+      expected += entry;
+    } else {
+      ++refused;
+    }
+  }
+  EXPECT_GT(expected.size(), 9'000u);
+  EXPECT_EQ(bytesOf(*entries->snapshot()), expected);
+  EXPECT_EQ(storage.refusedEntries(), refused);
+  expectOneError("42: the session's list goes without some messages: " +
+                 directory_.path() + ": No space left on device");
+
+  faults.writeError = 0;
+  ASSERT_TRUE(append(*entries, "later"));
+  EXPECT_EQ(bytesOf(*entries->snapshot()), expected + "later");
+}
+
+TEST_F(FileEntryStorageTest, IsOfUseWithoutItsDirectory) {
+  FileEntryStorage storage(directory_ / "missing", {4096, 10'000, kNoPause},
+                           SpillCalls::system());
+  const auto entries = storage.makeEntries(kSession);
+  std::size_t taken = 0;
+  for (int i = 0; i < 200; ++i) taken += append(*entries, std::string(100, 'x')) ? 1 : 0;
+  EXPECT_GT(taken, 90u);
+  EXPECT_EQ(bytesOf(*entries->snapshot()).size(), 100 * taken);
+  EXPECT_EQ(storage.refusedEntries(), 200 - taken);
+}
+
+TEST_F(FileEntryStorageTest, LeavesAFullDiskAloneForAWhile) {
+  faults.writeError = ENOSPC;
+  FileEntryStorage storage(directory_.path(), {1, 1, std::chrono::hours(1)},
+                           faultyCalls());
+  const auto entries = storage.makeEntries(kSession);
+  for (int i = 0; i < 100; ++i) append(*entries, std::string(100, 'x'));
+  EXPECT_EQ(faults.writes, 1);
+}
+
+TEST_F(FileEntryStorageTest, SaysWhenItCannotReadBack) {
+  FileEntryStorage storage = storageOf(/*bytesOfList=*/1, /*bytesOfAll=*/1);
+  const auto entries = storage.makeEntries(kSession);
+  for (int i = 0; i < 100; ++i) append(*entries, std::string(100, 'x'));
+  faults.readError = EIO;
+  EXPECT_FALSE(entries->snapshot()->forEachRun([](StoredEntries::Bytes) {}));
+  expectOneError("42: cannot read the session's list back: " + directory_.path() +
+                 ": Input/output error");
+}
+
+// Lists that grow in turn, some of which end, with snapshots of any age, while the disk
+// is full now and then.
+TEST_F(FileEntryStorageTest, IsWhatWasAppendedWhateverTheSharesAndTheDisk) {
+  std::mt19937 random(5);
+  for (int run = 0; run < 12; ++run) {
+    const std::size_t share = random() % 20'000;
+    FileEntryStorage storage = storageOf(share, random() % 40'000);
+    struct List {
+      std::unique_ptr<StoredEntries> entries;
+      std::string expected;
+    };
+    std::vector<List> lists;
+    std::vector<std::pair<std::shared_ptr<const StoredEntries::Snapshot>, std::string>>
+        snapshots;
+    std::uint64_t refused = 0;
+    for (int step = 0; step < 500; ++step) {
+      if (random() % 20 == 0) faults.writeError = random() % 10 == 0 ? ENOSPC : 0;
+      if (lists.size() < 5) lists.push_back({storage.makeEntries(kSession), ""});
+      const std::size_t chosen = random() % lists.size();
+      List& list = lists[chosen];
+      const std::size_t sizes[] = {1, 30, 200, 1000, 3000, random() % 60'000};
+      const std::string entry(sizes[random() % 6] + 1,
+                              static_cast<char>('a' + step % 26));
+      if (append(*list.entries, entry)) {
+        list.expected += entry;
+      } else {
+        ++refused;
+      }
+      if (random() % 40 == 0) {
+        snapshots.emplace_back(list.entries->snapshot(), list.expected);
+      }
+      if (random() % 150 == 0) {
+        lists.erase(lists.begin() + static_cast<std::ptrdiff_t>(chosen));
+      }
+    }
+    for (const List& list : lists) {
+      ASSERT_TRUE(bytesOf(*list.entries->snapshot()) == list.expected) << run;
+    }
+    lists.clear();
+    for (const auto& [snapshot, expected] : snapshots) {
+      ASSERT_TRUE(bytesOf(*snapshot) == expected) << run;
+    }
+    EXPECT_EQ(storage.refusedEntries(), refused);
+    snapshots.clear();
+    EXPECT_EQ(storage.bytesInMemory(), 0u);
+    EXPECT_FALSE(storage.hasFile());
+  }
+}
+
+}  // namespace
+}  // namespace ostrel
