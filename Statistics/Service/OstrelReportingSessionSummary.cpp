@@ -21,7 +21,7 @@ bool holdsBlank(ValueView key) {
 // The summary of entries that need not be in memory: they are walked twice. The first
 // walk finds the groups and how long the text of each will be, the second writes the
 // values to their places. A session of a million messages has about as many groups, so
-// that what is kept for each is small: 100 bytes, the key included.
+// that what is kept for each is small: some 120 bytes, the key included.
 class Summary {
  public:
   /// A value of the first walk.
@@ -84,6 +84,10 @@ class Summary {
     std::uint8_t* text = nullptr;
     bool hasText = false;  // Of this walk.
   };
+  struct Slot {
+    std::size_t group = kNone;  // In `groups_`.
+    std::size_t hash = 0;
+  };
 
   std::string_view keyOf(const Group& group) const {
     const char* const key = keys_.data() + group.key;
@@ -112,34 +116,36 @@ class Summary {
   std::size_t groupOf(ValueView key) {
     if (2 * groups_.size() >= slots_.size()) growSlots();
     const std::string_view name = nameOf(key);
-    std::size_t& slot = slotOf(name);
-    if (slot == kNone) {
-      slot = groups_.size();
-      groups_.push_back({keys_.size()});
-      keys_ += name;
-    }
-    return slot;
-  }
-
-  // The slot of the key's group, or the free one where it belongs.
-  std::size_t& slotOf(std::string_view name) {
-    std::size_t at = std::hash<std::string_view>()(name);
+    const std::size_t hash = std::hash<std::string_view>()(name);
+    std::size_t at = hash;
     while (true) {
-      std::size_t& slot = slots_[at++ & (slots_.size() - 1)];
-      if (slot == kNone || keyOf(groups_[slot]) == name) return slot;
+      Slot& slot = slots_[at++ & (slots_.size() - 1)];
+      if (slot.group == kNone) {
+        slot = {groups_.size(), hash};
+        groups_.push_back({keys_.size()});
+        keys_ += name;
+        return slot.group;
+      }
+      if (slot.hash == hash && keyOf(groups_[slot.group]) == name) return slot.group;
     }
   }
 
   void growSlots() {
-    slots_.assign(std::max(kFewestSlots, 2 * slots_.size()), kNone);
-    for (std::size_t i = 0; i < groups_.size(); ++i) slotOf(keyOf(groups_[i])) = i;
+    std::vector<Slot> old(std::max(kFewestSlots, 2 * slots_.size()));
+    old.swap(slots_);
+    for (const Slot& slot : old) {
+      if (slot.group == kNone) continue;
+      std::size_t at = slot.hash;
+      while (slots_[at & (slots_.size() - 1)].group != kNone) ++at;
+      slots_[at & (slots_.size() - 1)] = slot;
+    }
   }
 
   std::vector<Group> groups_;  // In the order of their first values.
   std::vector<std::size_t> groupOfValue_;
   std::size_t writtenValues_ = 0;
-  std::string keys_;                // Encoded, one after the other.
-  std::vector<std::size_t> slots_;  // Of `groups_`, by the hash of the key.
+  std::string keys_;         // Encoded, one after the other.
+  std::vector<Slot> slots_;  // By the hash of the key.
   ValueBuffer event_;
   std::string text_;
   std::string head_;
