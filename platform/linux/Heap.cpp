@@ -2,6 +2,8 @@
 
 #include <malloc.h>
 
+#include <utility>
+
 namespace ostrel {
 namespace {
 
@@ -14,11 +16,22 @@ constexpr int kOwnPagesBytes = 256 * 1024;
 
 }  // namespace
 
-void keepHeapForBursts() {
+HeapKeeper::HeapKeeper(std::shared_ptr<TimerThread> timers) : timers_(std::move(timers)) {
   ::mallopt(M_TRIM_THRESHOLD, kKeptBytes);
   ::mallopt(M_MMAP_THRESHOLD, kOwnPagesBytes);
 }
 
-void giveBackHeap() { ::malloc_trim(0); }
+void HeapKeeper::watch() {
+  timers_->scheduleAfter(kQuiet, [weak = weak_from_this()] {
+    const auto self = weak.lock();
+    if (!self) return;
+    if (self->hasWorked_.exchange(false, std::memory_order_relaxed)) {
+      self->watch();
+      return;
+    }
+    self->isWatching_.store(false, std::memory_order_relaxed);
+    ::malloc_trim(0);
+  });
+}
 
 }  // namespace ostrel

@@ -103,7 +103,6 @@ struct LinuxPlatform::Bindings {
 };
 
 Outcome<std::unique_ptr<LinuxPlatform>> LinuxPlatform::open() {
-  keepHeapForBursts();
   const std::shared_ptr<JournalLog> log = JournalLog::open();
   setSystemLog(log);
   registerLogScope(processLogScope);
@@ -117,6 +116,7 @@ Outcome<std::unique_ptr<LinuxPlatform>> LinuxPlatform::open() {
   auto bindings = std::unique_ptr<Bindings>(
       new Bindings{log, peers, timers, notice, misuse, *std::move(listener.value)});
   notice->setStore(bindings->store);
+  bindings->listener->setHeapKeeper(std::make_shared<HeapKeeper>(timers));
   return {std::unique_ptr<LinuxPlatform>(new LinuxPlatform(std::move(bindings))),
           std::nullopt};
 }

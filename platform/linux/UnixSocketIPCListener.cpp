@@ -14,7 +14,6 @@
 #include <utility>
 
 #include "platform/Logging.h"
-#include "platform/linux/Heap.h"
 #include "platform/linux/ProcProcessInfo.h"
 #include "platform/linux/SystemdService.h"
 #include "platform/linux/ThreadPoolWorkQueues.h"
@@ -35,9 +34,6 @@ constexpr PeerConnection::ID kFirstConnection = 3;
 constexpr std::size_t kReadBytes = 64 * 1024;
 constexpr int kMostEvents = 64;
 
-// After so many rounds of work, and so much time without any, memory is given back.
-constexpr std::size_t kRoundsOfBurst = 64;
-constexpr std::chrono::milliseconds kQuietAfterBurst{500};
 constexpr int kMostAccepted = 64;
 
 bool watchDescriptor(int epoll, int descriptor, std::uint64_t id) {
@@ -116,19 +112,16 @@ void UnixSocketIPCListener::resume() {
   while (!isStopping_) {
     const bool mayWait = waker_->beginWait();
     const int count = ::epoll_wait(epoll_.get(), events.data(), kMostEvents,
-                                   mayWait ? millisecondsToWait(Clock::now()) : 0);
+                                   mayWait ? millisecondsToWait() : 0);
     waker_->endWait();
-    if (count > 0) {
-      lastWork_ = Clock::now();
-      ++roundsSinceTidying_;
-    }
+    if (heap_ && count > 0) heap_->noteWork();
     {
       const ThreadPoolWorkQueues::Batch requests;
       for (int i = 0; i < count; ++i) {
         const epoll_event& event = events[static_cast<std::size_t>(i)];
         handleEvent(event.data.u64, event.events);
       }
-      handleDeadlines(Clock::now());
+      if (hasDeadlines()) handleDeadlines(Clock::now());
     }
     // The requests have been served, and many replies are there.
     const ThreadPoolWorkQueues::Batch requests;
@@ -300,10 +293,6 @@ void UnixSocketIPCListener::handleDeadlines(Clock::time_point now) {
     isBackedOff_ = !watchDescriptor(epoll_.get(), socket_.descriptor(), kSocketEvent);
     acceptAgainAt_ = now + limits::kAcceptBackOff;
   }
-  if (roundsSinceTidying_ >= kRoundsOfBurst && now >= lastWork_ + kQuietAfterBurst) {
-    roundsSinceTidying_ = 0;
-    giveBackHeap();
-  }
   if (impatient_.empty()) return;
   std::vector<PeerConnection::ID> waiting;
   std::swap(waiting, impatient_);
@@ -317,19 +306,17 @@ void UnixSocketIPCListener::handleDeadlines(Clock::time_point now) {
 }
 
 // -1, without end, unless somebody's time runs.
-int UnixSocketIPCListener::millisecondsToWait(Clock::time_point now) const {
+int UnixSocketIPCListener::millisecondsToWait() const {
+  if (!hasDeadlines()) return -1;
   Clock::time_point first = Clock::time_point::max();
   if (isBackedOff_) first = acceptAgainAt_;
-  if (roundsSinceTidying_ >= kRoundsOfBurst) {
-    first = std::min(first, lastWork_ + kQuietAfterBurst);
-  }
   for (const PeerConnection::ID id : impatient_) {
     const auto found = connections_.find(id);
     if (found == connections_.end()) continue;
     first = std::min(first, found->second.connection->patienceEnds());
   }
   if (first == Clock::time_point::max()) return -1;
-  const auto left = std::chrono::ceil<std::chrono::milliseconds>(first - now);
+  const auto left = std::chrono::ceil<std::chrono::milliseconds>(first - Clock::now());
   return static_cast<int>(std::max<std::int64_t>(left.count(), 0));
 }
 

@@ -10,6 +10,7 @@
 #include "platform/IPCListener.h"
 #include "platform/Outcome.h"
 #include "platform/linux/FileDescriptor.h"
+#include "platform/linux/Heap.h"
 #include "platform/linux/LoopWaker.h"
 #include "platform/linux/PeerConnection.h"
 #include "platform/linux/PeerRegistry.h"
@@ -34,6 +35,9 @@ class UnixSocketIPCListener final : public IPCListener {
       const std::string& path, std::shared_ptr<PeerRegistry> peers,
       ListenerLimits limits = {}, std::shared_ptr<MisuseLog> misuse = nullptr);
   ~UnixSocketIPCListener() override;
+
+  /// Who is told of each round of requests; before `resume`.
+  void setHeapKeeper(std::shared_ptr<HeapKeeper> heap) { heap_ = std::move(heap); }
 
   void setDelegate(IPCListenerDelegate* delegate) override { delegate_ = delegate; }
 
@@ -61,7 +65,8 @@ class UnixSocketIPCListener final : public IPCListener {
   void handleEvent(std::uint64_t id, std::uint32_t events);
   void handleWork();
   void handleDeadlines(Clock::time_point now);
-  int millisecondsToWait(Clock::time_point now) const;
+  bool hasDeadlines() const { return isBackedOff_ || !impatient_.empty(); }
+  int millisecondsToWait() const;
 
   /// Brings the loop in line with what a connection wants now, or ends it.
   void settle(PeerConnection& connection);
@@ -76,6 +81,7 @@ class UnixSocketIPCListener final : public IPCListener {
   TerminationSignals signals_;
   const FileDescriptor epoll_;
   IPCListenerDelegate* delegate_ = nullptr;
+  std::shared_ptr<HeapKeeper> heap_;  // Or none.
 
   struct Watched {
     std::shared_ptr<PeerConnection> connection;
@@ -90,8 +96,6 @@ class UnixSocketIPCListener final : public IPCListener {
   LoopWaker::Work work_;
   std::vector<std::uint8_t> buffer_;
   Clock::time_point acceptAgainAt_{};  // Set while accepting is backed off.
-  Clock::time_point lastWork_{};
-  std::size_t roundsSinceTidying_ = 0;
   bool isBackedOff_ = false;
   bool isStopping_ = false;
 };
