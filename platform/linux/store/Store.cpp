@@ -210,7 +210,7 @@ bool Store::waitForWork() {
   std::unique_lock lock(mutex_);
   for (;;) {
     if (isStopping_) return false;
-    if (isUrgent_) return true;
+    if (isUrgent_ && (writer_.fault() || Clock::now() >= flushAt())) return true;
     std::optional<Clock::time_point> due;
     if (writer_.fault()) {
       due = retryAt_;
@@ -220,6 +220,9 @@ bool Store::waitForWork() {
       due = commitAt_;
     } else if (!queue_.empty()) {
       due = firstQueuedAt_ + options_.commitWindow;
+    }
+    if (due && !writer_.fault() && (isUrgent_ || isFlushWaiting_)) {
+      due = std::min(*due, flushAt());
     }
     if (!due) {
       writerIsIdle_ = true;
@@ -233,23 +236,22 @@ bool Store::waitForWork() {
   }
 }
 
-// Hands what is queued to the writer; true when it is wanted durable at once.
-bool Store::handOver() {
+// Hands what is queued to the writer.
+void Store::handOver() {
   std::vector<StoreBatch> batches;
-  bool isUrgent;
   {
     const std::lock_guard lock(mutex_);
     if (!writer_.hasUncommitted()) commitAt_ = firstQueuedAt_ + options_.commitWindow;
-    isUrgent = std::exchange(isUrgent_, false);
+    isFlushWaiting_ |= std::exchange(isUrgent_, false);
     queuedEvents_ = 0;
     batches = queue_.take();
   }
   writer_.add(std::move(batches));
-  return isUrgent;
 }
 
 void Store::work() {
-  bool isUrgent = handOver();
+  handOver();
+  bool isUrgent = isFlushWaiting_ && Clock::now() >= flushAt();
   // A fault that is new gets a second attempt at once: a file that was removed or
   // damaged is replaced by then.
   for (int attempt = 0; attempt < 2; ++attempt) {
@@ -275,11 +277,18 @@ void Store::work() {
   writer_.keepAtMost(limits::kStoreKeptThroughFault);
 }
 
+Store::Clock::time_point Store::flushAt() const {
+  return flushesPaidUntil_ - options_.flushBurst * options_.flushPause;
+}
+
 bool Store::isCommitDue() const {
   return writer_.uncommittedBytes() >= kCommitBytes || Clock::now() >= commitAt_;
 }
 
 void Store::commit() {
+  if (std::exchange(isFlushWaiting_, false)) {
+    flushesPaidUntil_ = std::max(flushesPaidUntil_, Clock::now()) + options_.flushPause;
+  }
   std::vector<StoreBatch> done = writer_.commit();
   const std::lock_guard lock(mutex_);
   for (StoreBatch& batch : done) queue_.recycle(std::move(batch));

@@ -27,6 +27,12 @@ struct StoreOptions {
   /// commits a second at most under a load that needs no more.
   std::chrono::milliseconds commitWindow{100};
 
+  /// A flush makes durable at once, so many times; then the next does so after this
+  /// pause each, and those between wait together, never past the commit window. Keeps
+  /// a client that stops sessions all the time from wearing out the flash.
+  int flushBurst = 20;
+  std::chrono::milliseconds flushPause{100};
+
   /// Memory of what waits for the writer, and analytics events that wait. More is
   /// refused or dropped.
   std::size_t queuedBytes = limits::kStoreQueuedBytes;
@@ -112,7 +118,8 @@ class Store {
   void runWriter();
   bool waitForWork();
   void work();
-  bool handOver();
+  void handOver();
+  Clock::time_point flushAt() const;
   bool isCommitDue() const;
   void commit();
   void publishState();
@@ -125,6 +132,8 @@ class Store {
   // The writer thread's.
   StoreWriter writer_;
   Clock::time_point commitAt_{};
+  bool isFlushWaiting_ = false;
+  Clock::time_point flushesPaidUntil_{};  // Ahead of now by a pause for each flush.
   Clock::time_point retryAt_{};
   std::chrono::milliseconds retryPause_;
 

@@ -18,7 +18,9 @@ namespace fs = std::filesystem;
 
 // Sends numbered messages for ever and writes the last durable number to `out`.
 [[noreturn]] void sendForEver(const std::string& path, std::int64_t first, int out) {
-  const auto store = Store::open(path);
+  StoreOptions options;
+  options.flushPause = std::chrono::milliseconds(0);
+  const auto store = Store::open(path, options);
   StoreTelemetryBackend backend(store);
   std::mt19937 random(static_cast<unsigned>(first));
   std::int64_t number = first;
@@ -34,6 +36,12 @@ namespace fs = std::filesystem;
     const std::int64_t last = number - 1;
     if (::write(out, &last, sizeof last) != sizeof last) ::_exit(3);
   }
+}
+
+// For longer runs, and to make one again.
+std::int64_t numberFrom(const char* variable, std::int64_t usual) {
+  const char* text = std::getenv(variable);
+  return text != nullptr ? std::atoll(text) : usual;
 }
 
 // Each number up to `last` once, and nothing else but what follows it.
@@ -100,6 +108,7 @@ std::vector<FileEvent> recordWork(const std::string& path) {
   vfs.startRecording();
   StoreOptions options;
   options.vfs = FaultVFS::kName;
+  options.flushPause = std::chrono::milliseconds(0);
   std::int64_t number = 0;
   for (int life = 0; life < 3; ++life) {
     const auto store = Store::open(path, options);
@@ -144,8 +153,10 @@ TEST(StoreCrash, KeepsWhatWasDurableThroughTwoThousandPowerCuts) {
   const auto events = recordWork(directory.path() + "/state/reports.db");
   const std::string image = directory.path() + "/image";
   const std::string path = image + "/reports.db";
-  constexpr std::size_t kCuts = 2000;
-  PowerCut power(/*seed=*/20260131);
+  const auto wanted = static_cast<std::size_t>(numberFrom("OSTREL_POWER_CUTS", 2000));
+  const auto seed = static_cast<std::uint64_t>(numberFrom("OSTREL_SEED", 20260131));
+  SCOPED_TRACE("OSTREL_SEED=" + std::to_string(seed));
+  PowerCut power(seed);
   StoreOptions options;
   options.vfs = FaultVFS::kName;
   FaultVFS::instance().setSkipsSync(true);
@@ -154,7 +165,7 @@ TEST(StoreCrash, KeepsWhatWasDurableThroughTwoThousandPowerCuts) {
   for (std::size_t i = 0; i < events.size(); ++i) {
     power.apply(events[i]);
     if (events[i].kind == FileEvent::Kind::kMark) durable = events[i].offset;
-    for (; cuts * events.size() < kCuts * (i + 1); ++cuts) {
+    for (; cuts * events.size() < wanted * (i + 1); ++cuts) {
       writeFiles(image, power.cut());
       // The next life of the store: nothing is set aside, unless there was nothing.
       {
@@ -172,7 +183,7 @@ TEST(StoreCrash, KeepsWhatWasDurableThroughTwoThousandPowerCuts) {
     }
   }
   FaultVFS::instance().setSkipsSync(false);
-  EXPECT_EQ(cuts, kCuts);
+  EXPECT_EQ(cuts, wanted);
   EXPECT_EQ(durable, 600);
 }
 

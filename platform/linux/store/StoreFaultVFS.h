@@ -25,6 +25,7 @@ struct FaultPlan {
   int code = SQLITE_IOERR;  // Of writes; others fail with their own kind of it.
   std::int64_t after = -1;  // Calls that succeed before; -1: none fails.
   bool isForEver = false;
+  std::int64_t second = 0;  // So many calls after the first one more fails; 0: none.
 };
 
 /// One change of a file on its way to the disk.
@@ -101,7 +102,9 @@ class FaultVFS {
     if (plan_.after < 0) return false;
     if (plan_.kind != FaultPlan::Kind::kAny && plan_.kind != kind) return false;
     const std::int64_t call = calls_++;
-    if (call < plan_.after || (call > plan_.after && !plan_.isForEver)) return false;
+    const bool isSecond = plan_.second > 0 && call == plan_.after + plan_.second;
+    if (call < plan_.after) return false;
+    if (call > plan_.after && !plan_.isForEver && !isSecond) return false;
     ++failed_;
     if (code != nullptr) *code = plan_.code;
     return true;
@@ -186,6 +189,7 @@ class FaultVFS {
     methods_.xSync = sync;
     methods_.xFileSize = fileSize;
     methods_.xLock = [](sqlite3_file* file, int level) {
+      if (instance().mustFail(FaultPlan::Kind::kAny, nullptr)) return SQLITE_IOERR_LOCK;
       return below(file)->xLock(of(file)->below, level);
     };
     methods_.xUnlock = [](sqlite3_file* file, int level) {
@@ -211,6 +215,10 @@ class FaultVFS {
       return below(file)->xShmMap(of(file)->below, page, size, extend, out);
     };
     methods_.xShmLock = [](sqlite3_file* file, int offset, int count, int flags) {
+      if ((flags & SQLITE_SHM_LOCK) != 0 &&
+          instance().mustFail(FaultPlan::Kind::kAny, nullptr)) {
+        return SQLITE_IOERR_SHMLOCK;
+      }
       return below(file)->xShmLock(of(file)->below, offset, count, flags);
     };
     methods_.xShmBarrier = [](sqlite3_file* file) {

@@ -120,6 +120,37 @@ class StoreFaults : public ::testing::Test {
     EXPECT_THAT(texts[0], ::testing::HasSubstr(std::string(reason)));
   }
 
+  // A run of the store under the plan writes each accepted message once, in order.
+  void runUnder(const FaultPlan& plan, std::int64_t& failed) {
+    StoreOptions options = quickOptions();
+    options.vfs = FaultVFS::kName;
+    options.firstRetry = milliseconds(1);
+    options.longestRetry = milliseconds(2);
+    fs::remove_all(stateDirectory());
+    FaultVFS& vfs = FaultVFS::instance();
+    vfs.setPlan(plan);
+    open(options);
+    makeSession();
+    std::vector<std::string> accepted;
+    for (int i = 0; i < 12; ++i) {
+      if (send(i).succeeded) accepted.push_back(std::to_string(i));
+      if (i % 4 == 3) flushed(*session_);
+    }
+    failed = vfs.failed();
+    vfs.clearPlan();
+    ASSERT_TRUE(sendUntilAccepted(99));
+    accepted.push_back("99");
+    ASSERT_TRUE(eventually([&] { return !flushed(*session_); }));
+    close();
+    ASSERT_EQ(numbers(), accepted);
+    OtherConnection reader(path());
+    ASSERT_EQ(reader.one("SELECT count(*) FROM telemetry_sessions WHERE ended_at NOT "
+                         "NULL AND flushed_at NOT NULL"),
+              "1");
+    ASSERT_EQ(reader.one("PRAGMA integrity_check"), "ok");
+    ASSERT_TRUE(setAside().empty());
+  }
+
   void overwrite(std::size_t offset, const std::string& bytes) {
     std::fstream file(path(), std::ios::in | std::ios::out | std::ios::binary);
     file.seekp(static_cast<std::streamoff>(offset));
@@ -376,51 +407,42 @@ TEST_F(StoreFaults, GivesUpTheOldestInALongFaultAndCountsThem) {
             "1|39999");
 }
 
-// What a run of the store wrote although the n-th call below it failed: each
-// accepted message once, in order.
+// The n-th call below the store fails.
 class StoreFailingCalls : public StoreFaults,
                           public ::testing::WithParamInterface<bool> {};
 
 TEST_P(StoreFailingCalls, LoseNothingThatWasAccepted) {
-  const bool isForEver = GetParam();
-  StoreOptions options = quickOptions();
-  options.vfs = FaultVFS::kName;
-  options.firstRetry = milliseconds(1);
-  options.longestRetry = milliseconds(2);
-  FaultVFS& vfs = FaultVFS::instance();
-  std::int64_t last = 0;
-  for (std::int64_t call = 0; call < 400; ++call) {
-    fs::remove_all(stateDirectory());
-    vfs.setPlan({FaultPlan::Kind::kAny, call % 2 == 0 ? SQLITE_FULL : SQLITE_IOERR_WRITE,
-                 call, isForEver});
-    open(options);
-    makeSession();
-    std::vector<std::string> accepted;
-    for (int i = 0; i < 12; ++i) {
-      if (send(i).succeeded) accepted.push_back(std::to_string(i));
-      if (i % 4 == 3) flushed(*session_);
-    }
-    last = vfs.failed();
-    vfs.clearPlan();
-    ASSERT_TRUE(sendUntilAccepted(99)) << call;
-    accepted.push_back("99");
-    ASSERT_TRUE(eventually([&] { return !flushed(*session_); })) << call;
-    close();
-    ASSERT_EQ(numbers(), accepted) << call;
-    OtherConnection reader(path());
-    ASSERT_EQ(reader.one("SELECT count(*) FROM telemetry_sessions WHERE ended_at NOT "
-                         "NULL AND flushed_at NOT NULL"),
-              "1")
-        << call;
-    ASSERT_EQ(reader.one("PRAGMA integrity_check"), "ok") << call;
-    ASSERT_TRUE(setAside().empty()) << call;
-    if (last == 0) break;  // The run has fewer calls.
+  FaultPlan plan;
+  plan.isForEver = GetParam();
+  std::int64_t failed = 1;
+  for (plan.after = 0; plan.after < 1000 && failed != 0; ++plan.after) {
+    SCOPED_TRACE(plan.after);
+    plan.code = plan.after % 2 == 0 ? SQLITE_FULL : SQLITE_IOERR_WRITE;
+    runUnder(plan, failed);
+    ASSERT_FALSE(HasFailure());
   }
-  EXPECT_EQ(last, 0) << "the run has more calls than were tried";
+  EXPECT_EQ(failed, 0) << "the run has more calls than were tried";
 }
 
 INSTANTIATE_TEST_SUITE_P(Once, StoreFailingCalls, ::testing::Values(false));
 INSTANTIATE_TEST_SUITE_P(ForEver, StoreFailingCalls, ::testing::Values(true));
+
+// The second fault may hit the recovery from the first.
+TEST_F(StoreFaults, LosesNothingToTwoFailingCalls) {
+  const char* text = std::getenv("OSTREL_FAULT_PAIRS");
+  const int pairs = text != nullptr ? std::atoi(text) : 60;
+  std::mt19937 random(20260131);
+  for (int pair = 0; pair < pairs; ++pair) {
+    SCOPED_TRACE(pair);
+    FaultPlan plan;
+    plan.after = random() % 120;
+    plan.second = 1 + random() % (random() % 2 == 0 ? 8 : 80);
+    plan.code = pair % 2 == 0 ? SQLITE_FULL : SQLITE_IOERR_WRITE;
+    std::int64_t failed = 0;
+    runUnder(plan, failed);
+    ASSERT_FALSE(HasFailure());
+  }
+}
 
 // In a mount namespace of its own, on a file system of 1 MiB. Exit status 0 when all
 // was as expected, 77 when such a file system cannot be had.

@@ -121,7 +121,9 @@ class StoreQueue {
 
   void addBatch() {
     if (spare_.empty()) {
-      batches_.emplace_back().reserve(kBatch);
+      StoreBatch batch;
+      batch.reserve(kBatch);
+      batches_.push_back(std::move(batch));
     } else {
       batches_.push_back(std::move(spare_.back()));
       spare_.pop_back();
