@@ -55,6 +55,11 @@ inline constexpr std::size_t kQueuedBytes = 4 * 1024 * 1024;
 /// PeerChannelBudget.IsThatOfAllConnectionsOfTheUserToo]
 inline constexpr std::size_t kQueuedBytesOfUser = 32 * 1024 * 1024;
 
+/// What a connection may have of that when the user's other connections have it all: a
+/// client with a request or two is served however much the others sent.
+/// [UnixSocketListener.ServesAClientWithLittleUnderWayHoweverMuchItsUserHas]
+inline constexpr std::size_t kReservedQueuedBytes = 8 * 1024;
+
 /// Sessions in all, and of one user. Room for the 16,384 that are promised and for
 /// load tests of 100,000 by one user; an idle session costs some 500 bytes.
 /// [UserAccount.TakesSessionsUpToTheUsersShareAndTheServices,
@@ -76,7 +81,7 @@ inline constexpr std::size_t kRequestBytes = 256;
 
 /// What each delivery of a message costs beyond the first: its step on the queue of the
 /// session, and its place in the store's. A message to all is taken to go to every
-/// session that there is.
+/// session that there is, `kReporterIDs` at most.
 /// [UnixSocketListener.ChargesEachDeliveryOfAMessage]
 inline constexpr std::size_t kDeliveryBytes = 512;
 
@@ -96,6 +101,21 @@ inline constexpr std::size_t kUnreadReplyBytes = 1024 * 1024;
 /// slow stays below `kUnreadReplyBytes` by it.
 /// [UnixSocketListener.SendsALargeReplyToAClientThatReadsSlowly]
 inline constexpr std::size_t kUnreadReplyBytesToPause = kUnreadReplyBytes / 4;
+
+/// The same of all connections of one user: enough for the largest reply on some of
+/// them. Beyond it each may have `kUnreadReplyBytesInNeed`, so that many connections
+/// do not make many times the memory.
+/// [UnreadReplies.OfOthersLeaveAClientItsRoomUpToTheLimitOfTheirUser]
+inline constexpr std::size_t kUnreadReplyBytesOfUser = 16 * 1024 * 1024;
+
+/// Of one connection, then: a thousand short replies.
+/// [UnreadReplies.BeyondItAreFewForEachClient]
+inline constexpr std::size_t kUnreadReplyBytesInNeed = 16 * 1024;
+
+/// Bytes of frames that are not whole yet, of all connections of one user: fifty of the
+/// largest. Beyond it the connection that is in one longest is cut off.
+/// [UnixSocketListener.CutsOffWhoIsLongestInAFrameWhereAUserHasTooManyHalves]
+inline constexpr std::size_t kHalfFrameBytesOfUser = 16 * 1024 * 1024;
 
 /// How long such a client may read nothing at all before it is cut off.
 /// [UnixSocketListener.CutsOffAClientThatNeverReadsItsReplies]

@@ -24,10 +24,12 @@ PeerChannel::PeerChannel(LoopWaker::ConnectionID id, std::shared_ptr<LoopWaker> 
       waker_(std::move(waker)),
       user_(std::move(user)),
       unreadReplyBytes_(limits.unreadReplyBytes),
+      reservedQueuedBytes_(limits.reservedQueuedBytes),
       own_(limits.queuedBytes),
       idsReplyBytes_(kAssumedIDsReplyBytes) {}
 
 PeerChannel::~PeerChannel() {
+  user_->changeUnread(unread_, /*now=*/0);
   // Whatever could tell that a request ran is gone.
   if (user_->queued().give(own_.used())) waker_->budgetEased();
 }
@@ -40,11 +42,11 @@ void PeerChannel::reply(wire::RequestNumber number, const wire::ReplyValue& valu
   wire::appendReply(out_, number, value);
   const std::size_t added = out_.size() - before;
   if (std::holds_alternative<ReporterIDs>(value)) idsReplyBytes_ = added;
-  if (unread != 0 && unread + added > unreadReplyBytes_) {
+  if (unread != 0 && unread + added > mostUnreadBytes()) {
     out_.resize(before);
     hasTooManyUnread_ = true;
   }
-  unread_ = out_.size() - written_;
+  updateUnread();
   if (!std::exchange(isAnnounced_, true)) waker_->needsAttention(id_);
 }
 
@@ -58,7 +60,9 @@ void PeerChannel::relieve(std::size_t bytes) noexcept { give(bytes); }
 void PeerChannel::give(std::size_t bytes) noexcept {
   const bool hasOwnEased = own_.give(bytes);
   const bool hasUserEased = user_->queued().give(bytes);
-  if (hasOwnEased || hasUserEased) waker_->budgetEased();
+  const bool hasReserve =
+      awaitsReserve_.load() && !isBeyondReserve() && awaitsReserve_.exchange(false);
+  if (hasOwnEased || hasUserEased || hasReserve) waker_->budgetEased();
 }
 
 std::uint64_t PeerChannel::chargeRequest(std::size_t bytes) {
@@ -76,13 +80,21 @@ void PeerChannel::requestsRan(std::uint64_t mark) noexcept {
 
 bool PeerChannel::awaitBudget() {
   const bool isOwnFull = own_.isExceeded() && own_.await();
-  const bool isUserFull = user_->queued().isExceeded() && user_->queued().await();
+  if (!isBeyondReserve() || !user_->queued().isExceeded()) return isOwnFull;
+  awaitsReserve_ = true;
+  // Whoever gives after this sees it; whoever gave before is seen here.
+  const bool isUserFull = user_->queued().await() && isBeyondReserve();
   return isOwnFull || isUserFull;
 }
 
 bool PeerChannel::hasTooManyUnread() const {
   const std::lock_guard lock(mutex_);
   return hasTooManyUnread_;
+}
+
+void PeerChannel::updateUnread() {
+  const std::size_t now = out_.size() - written_;
+  user_->changeUnread(unread_.exchange(now), now);
 }
 
 bool PeerChannel::flush(int socket) {
@@ -106,14 +118,14 @@ bool PeerChannel::flush(int socket) {
     out_.erase(0, written_);
     written_ = 0;
   }
-  unread_ = out_.size() - written_;
+  updateUnread();
   return true;
 }
 
 void PeerChannel::close(std::string_view reason) {
   const std::lock_guard lock(mutex_);
   if (!std::exchange(isClosed_, true)) wire::appendClosing(out_, reason);
-  unread_ = out_.size() - written_;
+  updateUnread();
 }
 
 void PeerChannel::close() {
@@ -121,7 +133,7 @@ void PeerChannel::close() {
   isClosed_ = true;
   written_ = 0;
   std::string().swap(out_);
-  unread_ = 0;
+  updateUnread();
 }
 
 }  // namespace ostrel

@@ -1,5 +1,6 @@
 #pragma once
 
+#include <algorithm>
 #include <atomic>
 #include <cstdint>
 #include <memory>
@@ -7,6 +8,7 @@
 #include <string>
 
 #include "platform/Value.h"
+#include "platform/linux/Limits.h"
 #include "platform/linux/LoopWaker.h"
 #include "platform/linux/RequestBudget.h"
 #include "platform/linux/UserAccount.h"
@@ -23,6 +25,8 @@ class PeerChannel final : public PayloadAccount {
   struct Limits {
     std::size_t queuedBytes;
     std::size_t unreadReplyBytes;
+    /// What the connection may have under way whatever its user has.
+    std::size_t reservedQueuedBytes = 0;
   };
 
   PeerChannel(LoopWaker::ConnectionID id, std::shared_ptr<LoopWaker> waker,
@@ -52,9 +56,17 @@ class PeerChannel final : public PayloadAccount {
   void requestsRan(std::uint64_t mark) noexcept;
 
   // The loop's.
-  bool isOverBudget() const { return own_.isExceeded() || user_->queued().isExceeded(); }
+  bool isOverBudget() const {
+    return own_.isExceeded() || (isBeyondReserve() && user_->queued().isExceeded());
+  }
   /// Asks for `LoopWaker::budgetEased` once there is room; false: there is already.
   bool awaitBudget();
+  /// How much may wait now: less while much waits for the user's other clients.
+  std::size_t mostUnreadBytes() const {
+    return user_->hasManyUnread()
+               ? std::min(limits::kUnreadReplyBytesInNeed, unreadReplyBytes_)
+               : unreadReplyBytes_;
+  }
   /// What is waiting for its reader.
   std::size_t unreadBytes() const { return unread_.load(std::memory_order_relaxed); }
   /// Whether more waits than the client may leave unread.
@@ -71,13 +83,17 @@ class PeerChannel final : public PayloadAccount {
 
  private:
   void give(std::size_t bytes) noexcept;
+  bool isBeyondReserve() const { return own_.used() > reservedQueuedBytes_; }
+  void updateUnread();
 
   const LoopWaker::ConnectionID id_;
   const std::shared_ptr<LoopWaker> waker_;
   const std::shared_ptr<UserAccount> user_;
   const std::size_t unreadReplyBytes_;
+  const std::size_t reservedQueuedBytes_;
 
   RequestBudget own_;
+  std::atomic<bool> awaitsReserve_{false};
   std::uint64_t chargedMark_ = 0;  // The loop's.
   std::atomic<std::uint64_t> ranMark_{0};
   std::atomic<std::size_t> idsReplyBytes_;

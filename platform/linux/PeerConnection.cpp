@@ -89,6 +89,8 @@ void PeerConnection::setInvalidationHandler(std::function<void()> handler) {
 // next, so that a burst costs one call to the system; to more the rest is read
 // directly, so that a frame costs one copy however small its pieces are.
 void PeerConnection::read(std::span<std::uint8_t> buffer) {
+  // What cannot be carried out now stays in the socket.
+  if (holdBackIfFull()) return;
   if (pending_.size() > kMostJoined) {
     const std::size_t before = pending_.size();
     const std::size_t wanted = std::min(missingBytes(), kMostGrowth);
@@ -105,6 +107,7 @@ void PeerConnection::read(std::span<std::uint8_t> buffer) {
   const auto bytes = buffer.first(pending_.size() + static_cast<std::size_t>(count));
   const std::size_t done = process(bytes);
   if (ending_ != Ending::kNone) return;
+  if (done != 0 || pending_.empty()) pendingSince_ = Clock::now();
   pending_.assign(reinterpret_cast<const char*>(bytes.data()) + done,
                   bytes.size() - done);
 }
@@ -195,6 +198,7 @@ void PeerConnection::processPending() {
   const auto* bytes = reinterpret_cast<const std::uint8_t*>(pending_.data());
   const std::size_t done = process({bytes, pending_.size()});
   pending_.erase(0, done);
+  if (done != 0) pendingSince_ = Clock::now();
   if (pending_.empty()) pending_.shrink_to_fit();
 }
 
@@ -224,8 +228,10 @@ std::size_t PeerConnection::carryOut(ValueBuffer& input,
     input.charge(used + limits::kRequestBytes);
   }
   if (request.operation == wire::Operation::kSendMessage) {
+    // To all that are started, which are few of many at most times.
     const std::size_t deliveries =
-        request.reporterIDs ? request.reporterIDs->size() : channel_->sessionsOfAll();
+        request.reporterIDs ? request.reporterIDs->size()
+                            : std::min(channel_->sessionsOfAll(), limits_.reporterIDs);
     if (deliveries > 1) input.charge((deliveries - 1) * limits::kDeliveryBytes);
   }
   if (keepsReply(request.operation)) {
@@ -237,8 +243,12 @@ std::size_t PeerConnection::carryOut(ValueBuffer& input,
   return used;
 }
 
+std::size_t PeerConnection::unreadBytesToPause() const {
+  return std::min(limits_.unreadReplyBytesToPause, channel_->mostUnreadBytes() / 4);
+}
+
 bool PeerConnection::holdBackIfFull() {
-  const bool hasManyUnread = channel_->unreadBytes() > limits_.unreadReplyBytesToPause;
+  const bool hasManyUnread = channel_->unreadBytes() > unreadBytesToPause();
   if (!hasManyUnread && !channel_->isOverBudget()) return false;
   if (channel_->isOverBudget() && std::exchange(needsProbe_, false)) {
     dispatchProbe(*object_, channel_);

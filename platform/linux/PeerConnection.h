@@ -27,7 +27,9 @@ struct ListenerLimits {
   std::size_t frameBytes = limits::kFrameBytes;
   std::size_t reporterIDs = limits::kReporterIDs;
   wire::PayloadLimits payload{limits::kNesting, limits::kNodes, limits::kKeyBytes};
+  std::size_t halfFrameBytesOfUser = limits::kHalfFrameBytesOfUser;
   std::size_t queuedBytes = limits::kQueuedBytes;
+  std::size_t reservedQueuedBytes = limits::kReservedQueuedBytes;
   UserAccount::Limits ofUser{limits::kQueuedBytesOfUser, limits::kSessionsOfUser,
                              limits::kKeptBytesOfUser};
   std::size_t sessions = limits::kSessions;
@@ -91,6 +93,10 @@ class PeerConnection final : public IPCConnection {
   bool wantsToRead() const { return ending_ == Ending::kNone && !isHeldBack_; }
   bool wantsToWrite() const { return hasUnread_ && !isDeaf_; }
   bool isHeldBack() const { return isHeldBack_; }
+  /// What was read and not carried out: a frame that is not whole, or requests of a
+  /// client that is held back; and since when the first of them waits.
+  std::size_t pendingBytes() const { return pending_.size(); }
+  Clock::time_point pendingSince() const { return pendingSince_; }
   /// When `checkPatience` has something to say; none while the client reads.
   bool isImpatient() const { return hasUnread_; }
   Clock::time_point patienceEnds() const { return lastRead_ + limits_.unreadPatience; }
@@ -110,6 +116,7 @@ class PeerConnection final : public IPCConnection {
   std::size_t carryOut(ValueBuffer& input, std::span<const std::uint8_t> item);
   bool countSession(const wire::Request& request);
   void checkNextFrame(std::span<const std::uint8_t> bytes);
+  std::size_t unreadBytesToPause() const;
   bool holdBackIfFull();
   std::size_t missingBytes() const;
 
@@ -125,7 +132,8 @@ class PeerConnection final : public IPCConnection {
   std::function<void()> interrupted_;
   std::function<void()> invalidated_;
 
-  std::string pending_;           // Read and not yet carried out; begins with a frame.
+  std::string pending_;  // Read and not yet carried out; begins with a frame.
+  Clock::time_point pendingSince_{};
   Clock::time_point lastRead_{};  // When the client last read a reply.
   std::string reason_;
   Ending ending_ = Ending::kNone;

@@ -184,10 +184,10 @@ void UnixSocketIPCListener::settle(PeerConnection& connection) {
   if (connection.isHeldBack()) connection.continueReading();
   if (connection.ending() != PeerConnection::Ending::kNone) {
     if (connection.ending() == PeerConnection::Ending::kBrokenRules) {
-      misuse_->note(connection.peer().user, MisuseLog::Kind::kCutOff,
-                    connection.endingReason(), Clock::now());
+      cutOff(connection);
+    } else {
+      end(connection);
     }
-    end(connection);
     return;
   }
   const auto addOnce = [&](std::vector<PeerConnection::ID>& list) {
@@ -198,6 +198,36 @@ void UnixSocketIPCListener::settle(PeerConnection& connection) {
   if (connection.isHeldBack()) addOnce(heldBack_);
   if (connection.isImpatient()) addOnce(impatient_);
   watch(connection);
+  countPending(connection);
+}
+
+void UnixSocketIPCListener::cutOff(PeerConnection& connection) {
+  misuse_->note(connection.peer().user, MisuseLog::Kind::kCutOff,
+                connection.endingReason(), Clock::now());
+  end(connection);
+}
+
+// A client that begins frames and does not end them takes memory for as long as it likes:
+// where a user has too many such, those that began first go.
+void UnixSocketIPCListener::countPending(PeerConnection& connection) {
+  const auto watched = connections_.find(connection.id());
+  if (watched == connections_.end()) return;
+  User& user = users_[connection.peer().user];
+  user.pendingBytes += connection.pendingBytes() - watched->second.pendingBytes;
+  watched->second.pendingBytes = connection.pendingBytes();
+  if (user.pendingBytes <= limits_.halfFrameBytesOfUser) return;
+  std::shared_ptr<PeerConnection> oldest;
+  for (const auto& [id, each] : connections_) {
+    const PeerConnection& candidate = *each.connection;
+    if (each.pendingBytes == 0 || candidate.isHeldBack()) continue;
+    if (candidate.peer().user != connection.peer().user) continue;
+    if (!oldest || candidate.pendingSince() < oldest->pendingSince()) {
+      oldest = each.connection;
+    }
+  }
+  if (!oldest) return;
+  oldest->breakOff(PeerConnection::Ending::kBrokenRules, "too many frames are not whole");
+  cutOff(*oldest);
 }
 
 void UnixSocketIPCListener::watch(PeerConnection& connection) {
@@ -223,10 +253,14 @@ void UnixSocketIPCListener::end(PeerConnection& connection) {
   const auto found = connections_.find(connection.id());
   if (found == connections_.end()) return;
   const std::shared_ptr<PeerConnection> ended = std::move(found->second.connection);
+  const std::size_t pendingBytes = found->second.pendingBytes;
   connections_.erase(found);
   peers_->peerDisconnected(ended->peer().pid, ended->id());
   const auto user = users_.find(ended->peer().user);
-  if (user != users_.end()) --user->second.connections;
+  if (user != users_.end()) {
+    --user->second.connections;
+    user->second.pendingBytes -= pendingBytes;
+  }
   ended->invalidate();
 }
 
@@ -261,7 +295,8 @@ void UnixSocketIPCListener::accept(FileDescriptor socket) {
   peers_->peerConnected(peer.pid, id, processOf(socket.get(), peer.pid));
   auto channel = std::make_shared<PeerChannel>(
       id, waker_, user.account,
-      PeerChannel::Limits{limits_.queuedBytes, limits_.unreadReplyBytes});
+      PeerChannel::Limits{limits_.queuedBytes, limits_.unreadReplyBytes,
+                          limits_.reservedQueuedBytes});
   auto connection = std::make_shared<PeerConnection>(
       id, std::move(socket), peer, std::move(channel), limits_, *misuse_);
   connections_[id] = {connection};

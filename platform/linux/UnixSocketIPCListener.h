@@ -53,6 +53,7 @@ class UnixSocketIPCListener final : public IPCListener {
   struct User {
     std::size_t connections = 0;
     std::shared_ptr<UserAccount> account;
+    std::size_t pendingBytes = 0;  // Of its connections.
   };
 
   UnixSocketIPCListener(ServiceSocket socket, std::shared_ptr<PeerRegistry> peers,
@@ -72,6 +73,8 @@ class UnixSocketIPCListener final : public IPCListener {
   void settle(PeerConnection& connection);
   void watch(PeerConnection& connection);
   void end(PeerConnection& connection);
+  void cutOff(PeerConnection& connection);
+  void countPending(PeerConnection& connection);
 
   const ListenerLimits limits_;
   const ServiceSocket socket_;
@@ -85,7 +88,8 @@ class UnixSocketIPCListener final : public IPCListener {
 
   struct Watched {
     std::shared_ptr<PeerConnection> connection;
-    std::uint32_t events = 0;  // As epoll knows them; 0: not in it.
+    std::size_t pendingBytes = 0;  // As its user's count has it.
+    std::uint32_t events = 0;      // As epoll knows them; 0: not in it.
   };
   std::unordered_map<PeerConnection::ID, Watched> connections_;
   const std::shared_ptr<ServiceAccount> service_;

@@ -2,7 +2,9 @@
 
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
+#include <linux/sockios.h>
 #include <poll.h>
+#include <sys/ioctl.h>
 #include <sys/resource.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
@@ -653,6 +655,76 @@ TEST_F(UnixSocketListener, CutsOffAClientThatNeverReadsItsReplies) {
   }
 
   EXPECT_THAT(eventsAfter(3), ElementsAre(accepted(), "interrupted", "invalidated"));
+}
+
+TEST_F(UnixSocketListener, CutsOffWhoIsLongestInAFrameWhereAUserHasTooManyHalves) {
+  ListenerLimits limits;
+  limits.halfFrameBytesOfUser = 90 * 1024;
+  serve(limits);
+  const std::string half =
+      std::string("\x00\x00\x01\x00", 4) + std::string(30 * 1024 - 4, '\x81');
+  std::vector<std::unique_ptr<RawClient>> clients;
+  const auto begin = [&] {
+    clients.push_back(std::make_unique<RawClient>(path));
+    clients.back()->send(half);
+    // Whoever is served later began later.
+    RawClient other(path);
+    other.send(createRequest(1, 7));
+    EXPECT_TRUE(other.receive());
+  };
+
+  for (int i = 0; i < 3; ++i) begin();
+  clients.push_back(std::make_unique<RawClient>(path));
+  clients.back()->send(createRequest(1, 7));
+  EXPECT_TRUE(clients.back()->receive()) << "at the limit";
+  EXPECT_EQ(misuse->counts()[static_cast<std::size_t>(MisuseLog::Kind::kCutOff)], 0u);
+  begin();
+
+  EXPECT_EQ(clients.front()->receiveClosing(), "too many frames are not whole");
+  EXPECT_EQ(misuse->counts()[static_cast<std::size_t>(MisuseLog::Kind::kCutOff)], 1u);
+}
+
+TEST_F(UnixSocketListener, ServesAClientWithLittleUnderWayHoweverMuchItsUserHas) {
+  ListenerLimits limits;
+  limits.ofUser.queuedBytes = 1024;
+  limits.reservedQueuedBytes = 2 * limits::kRequestBytes;
+  serve(limits);
+  service->holdReplies();
+  RawClient greedy(path);
+  greedy.send(messageRequest(1, std::string(4096, 'x')));
+  ASSERT_TRUE(service->waitForCalls(1));
+
+  RawClient modest(path);
+  for (int i = 0; i < 10; ++i) modest.send(createRequest(0, 7));
+  ASSERT_TRUE(service->waitForCalls(3)) << "up to the reserve, and once at it";
+  std::this_thread::sleep_for(50ms);
+  EXPECT_LE(service->calls().size(), 1 + 3u);
+  service->releaseReplies();
+
+  EXPECT_TRUE(service->waitForCalls(11));
+}
+
+TEST_F(UnixSocketListener, LeavesWhatItCannotCarryOutInTheSocket) {
+  ListenerLimits limits;
+  limits.ofUser.queuedBytes = 1024;
+  limits.reservedQueuedBytes = 0;
+  serve(limits);
+  service->holdReplies();
+  RawClient first(path);
+  first.send(messageRequest(1, std::string(4096, 'x')));
+  ASSERT_TRUE(service->waitForCalls(1));
+
+  RawClient second(path);
+  second.send(createRequest(0, 7));
+  ASSERT_TRUE(service->waitForCalls(2));
+  second.send(messageRequest(1, std::string(4096, 'x')));
+  std::this_thread::sleep_for(50ms);
+  int inSocket = 0;
+  ::ioctl(second.socket(), SIOCOUTQ, &inSocket);
+  EXPECT_GT(inSocket, 4096);
+  service->releaseReplies();
+
+  EXPECT_TRUE(second.receive());
 }
 
 TEST_F(UnixSocketListener, SendsALargeReplyToAClientThatReadsSlowly) {

@@ -1,10 +1,12 @@
 #pragma once
 
+#include <atomic>
 #include <cstddef>
 #include <cstdint>
 #include <memory>
 #include <utility>
 
+#include "platform/linux/Limits.h"
 #include "platform/linux/RequestBudget.h"
 #include "platform/linux/Share.h"
 
@@ -24,6 +26,7 @@ class UserAccount {
     std::size_t queuedBytes;
     std::size_t sessions;
     std::size_t keptBytes;
+    std::size_t unreadBytes = limits::kUnreadReplyBytesOfUser;
   };
 
   UserAccount(std::uint32_t user, const Limits& limits,
@@ -32,6 +35,7 @@ class UserAccount {
         queued_(limits.queuedBytes),
         sessions_(limits.sessions),
         keptBytes_(limits.keptBytes),
+        mostUnreadBytes_(limits.unreadBytes),
         service_(std::move(service)) {}
 
   std::uint32_t user() const { return user_; }
@@ -53,6 +57,12 @@ class UserAccount {
     giveBoth(keptBytes_, service_->keptBytes, bytes);
   }
 
+  /// Reply bytes wait for their readers that did not, or the other way round.
+  void changeUnread(std::size_t before, std::size_t now) noexcept {
+    unreadBytes_ += now - before;
+  }
+  bool hasManyUnread() const { return unreadBytes_ > mostUnreadBytes_; }
+
   std::size_t sessions() const { return sessions_.used(); }
   std::size_t sessionsOfAll() const { return service_->sessions.used(); }
   std::size_t keptBytes() const { return keptBytes_.used(); }
@@ -73,6 +83,8 @@ class UserAccount {
   RequestBudget queued_;
   Share sessions_;
   Share keptBytes_;
+  const std::size_t mostUnreadBytes_;
+  std::atomic<std::size_t> unreadBytes_{0};
   const std::shared_ptr<ServiceAccount> service_;
 };
 
