@@ -20,7 +20,8 @@ TEST(ReporterIDSet, BeginsEmpty) {
 }
 
 TEST(ReporterIDSet, TakesEveryIDOnceTheExtremesAndZeroToo) {
-  constexpr std::int64_t kExtremes[] = {0, 1, -1, std::numeric_limits<std::int64_t>::min(),
+  constexpr std::int64_t kExtremes[] = {0, 1, -1,
+                                        std::numeric_limits<std::int64_t>::min(),
                                         std::numeric_limits<std::int64_t>::max()};
   ReporterIDSet set;
   for (const std::int64_t id : kExtremes) {
