@@ -121,6 +121,7 @@ class FaultyService : public ::testing::TestWithParam<FailingCall> {
     const std::int64_t most = timesFrom("OSTREL_FAULTS_OF_CALL", /*usual=*/2);
     std::mt19937_64 random(seedFrom(/*usual=*/20260131));
     std::int64_t runs = 0;
+    endsWithASentence_ = endsBySignal_ = 0;
     for (const bool isForEver : {false, true}) {
       if (isForEver && !GetParam().canLast) break;
       std::int64_t n = 0;
@@ -133,7 +134,13 @@ class FaultyService : public ::testing::TestWithParam<FailingCall> {
         n += most == 0 ? 1 : 1 + static_cast<std::int64_t>(random() % 12);
       }
     }
-    RecordProperty("faults", static_cast<int>(runs));
+    std::printf(
+        "%lld faults: it went on after %lld, said why it did not start after %lld, "
+        "was ended by %lld\n",
+        static_cast<long long>(runs),
+        static_cast<long long>(runs - endsWithASentence_ - endsBySignal_),
+        static_cast<long long>(endsWithASentence_),
+        static_cast<long long>(endsBySignal_));
   }
 
  private:
@@ -257,6 +264,7 @@ class FaultyService : public ::testing::TestWithParam<FailingCall> {
     EXPECT_LT(since(begin), 2s) << service_->read("log.txt");
     endFaults();
     const int status = service_->process().wait();
+    if (status == -1) ++endsBySignal_;
     if (!GetParam().mayEndIt) {
       EXPECT_EQ(status, 0) << service_->read("log.txt");
     }
@@ -267,6 +275,7 @@ class FaultyService : public ::testing::TestWithParam<FailingCall> {
   void expectToBeServed() {
     if (!isAnswered(5s) && hasEnded()) {
       const int status = service_->process().wait();
+      ++(status == -1 ? endsBySignal_ : endsWithASentence_);
       if (!GetParam().mayEndIt || status != -1) {
         EXPECT_EQ(status, 1);
         EXPECT_THAT(service_->read("log.txt"),
@@ -319,6 +328,8 @@ class FaultyService : public ::testing::TestWithParam<FailingCall> {
   static ServiceUnderTest* killed_;
   std::unique_ptr<ServiceUnderTest> service_;
   SharedFaults* faults_ = nullptr;
+  std::int64_t endsWithASentence_ = 0;
+  std::int64_t endsBySignal_ = 0;
   int stored_ = 0;  // Messages that are durable.
   int sent_ = 0;
 };
