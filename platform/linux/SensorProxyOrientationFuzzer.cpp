@@ -121,7 +121,8 @@ class ScriptedBus {
     expect(sd_bus_set_fd(bus_, descriptor, descriptor) >= 0);
     expect(sd_bus_set_server(bus_, /*b=*/1, sd_id128_t{}) >= 0);
     expect(sd_bus_set_anonymous(bus_, /*b=*/1) >= 0);
-    expect(sd_bus_start(bus_) >= 0);
+    // Fails when the other end has given up already.
+    sd_bus_start(bus_);
   }
   ~ScriptedBus() { sd_bus_flush_close_unref(bus_); }
   ScriptedBus(const ScriptedBus&) = delete;

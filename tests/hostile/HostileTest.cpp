@@ -32,6 +32,13 @@ constexpr bool kMemoryIsBounded = true;
 #endif
 constexpr std::size_t kMostResidentKiB = 96 * 1024;
 
+// Those of the pools are made when they are first needed and stay.
+#if defined(__SANITIZE_THREAD__)
+constexpr std::size_t kMostThreads = 17;  // One is the sanitizer's.
+#else
+constexpr std::size_t kMostThreads = 16;
+#endif
+
 // Of a reply to a client that behaves, on a machine that is busy with other tests too.
 // `scripts/longrun hostile` prints what it is on one that is not.
 constexpr auto kLongestReply = 10s;
@@ -159,8 +166,12 @@ std::ostream& operator<<(std::ostream& out, const GoodClient::Result& result) {
 /// A service that writes session logs, and what became of it.
 class AttackedService : public ServiceUnderTest {
  public:
-  AttackedService() {
-    write("machine-info", "CHASSIS=handset\nDEPLOYMENT=development\n");
+  enum class Build { kInternal, kReleased };
+
+  explicit AttackedService(Build build = Build::kInternal) {
+    if (build == Build::kInternal) {
+      write("machine-info", "CHASSIS=handset\nDEPLOYMENT=development\n");
+    }
     write("logs/victim", "");
     std::filesystem::create_directories(*this / "logs/Audio/Reporting");
     write("logs/Audio/victim", "untouched");
@@ -187,22 +198,26 @@ class AttackedService : public ServiceUnderTest {
   }
 
   ChildProcess attack(const std::string& name, double seconds) {
+    // The processor is nothing that the service can share out.
     return ChildProcess(
-        {programBeside("hostile_client"), name, "--socket", socketPath(), "--logs",
-         *this / "logs/Audio/Reporting", "--seconds", std::to_string(seconds)},
+        {"nice", "-n", "19", programBeside("hostile_client"), name, "--socket",
+         socketPath(), "--logs", *this / "logs/Audio/Reporting", "--seconds",
+         std::to_string(seconds)},
         *this / "attack.txt");
   }
 
   bool isAlive() { return ::kill(process().pid(), /*sig=*/0) == 0 && !hasEnded(); }
 
+  /// Alive, with the descriptors that it had and the threads that it may have.
   void expectItIsAsItWas() {
     ASSERT_TRUE(isAlive()) << read("log.txt").substr(0, 20'000);
-    EXPECT_TRUE(eventually([&] { return usage().descriptors <= atFirst_.descriptors; }))
-        << usage().descriptors << " descriptors, before " << atFirst_.descriptors;
-    // A session that its client left while it was starting still watches the orientation,
-    // on the one thread that there is for it.
-    EXPECT_TRUE(eventually([&] { return usage().threads <= atFirst_.threads + 1; }))
-        << usage().threads << " threads, before " << atFirst_.threads;
+    // A client that has alarms waiting is let go when they are gone, after a minute.
+    const auto end = steady_clock::now() + 2min;
+    while (usage().descriptors > atFirst_.descriptors && steady_clock::now() < end) {
+      std::this_thread::sleep_for(5ms);
+    }
+    EXPECT_LE(usage().descriptors, atFirst_.descriptors);
+    EXPECT_LE(usage().threads, kMostThreads);
   }
 
   /// No sanitizer's word, and no line that only a client can have written.
@@ -285,7 +300,7 @@ INSTANTIATE_TEST_SUITE_P(Each, HostileBehaviour,
                          testing::ValuesIn(thoseThatDoNotEndTheService()), nameOf);
 
 TEST(HostileBehaviours, AllAtOnceHarmNobody) {
-  AttackedService service;
+  AttackedService service(AttackedService::Build::kReleased);
   GoodClient good(service.socketPath());
   const int status = service.attack("all", secondsAtOnce()).wait();
   const GoodClient::Result result = good.finish();
