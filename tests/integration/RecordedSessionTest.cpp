@@ -9,6 +9,7 @@
 #include <regex>
 #include <stdexcept>
 
+#include "platform/linux/TestSupport.h"
 #include "tests/integration/ServiceUnderTest.h"
 
 namespace ostrel {
