@@ -399,6 +399,8 @@ void OstrelReportingSession::sendSingleMessage(
                                  : 0;
   OSTREL_LOG_DEBUG(logScope, "sending single message after delta %lli for service %i",
                    delay, serviceType);
+  // What waits for up to a minute keeps no more in memory than itself.
+  if (delay != 0) message = message.compact();
   platform.workQueues->backgroundQueue().asyncAfter(
       std::chrono::seconds(delay), [&platform, message = std::move(message), category,
                                     type, serviceType, reply = std::move(reply)] {

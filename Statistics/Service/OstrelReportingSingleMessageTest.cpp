@@ -53,6 +53,44 @@ TEST_F(OstrelReportingSingleMessage, SendsOnTheBackgroundQueueNeverInline) {
   EXPECT_EQ(replies, Replies{std::nullopt});
 }
 
+// Bears what one read of a connection brought.
+class InputAccount final : public PayloadAccount {
+ public:
+  void charge(std::size_t bytes) noexcept override { bytes_ += bytes; }
+  void relieve(std::size_t bytes) noexcept override { bytes_ -= bytes; }
+  bool keep(std::size_t) noexcept override { return true; }
+  void discard(std::size_t) noexcept override {}
+  std::size_t bytes() const { return bytes_; }
+
+ private:
+  std::size_t bytes_ = 0;
+};
+
+TEST_F(OstrelReportingSingleMessage, KeepsOnlyItselfInMemoryWhileItWaits) {
+  constexpr std::size_t kInputBytes = 64 * 1024;
+  const auto account = std::make_shared<InputAccount>();
+  const Dictionary plain{{"a", 1}};
+  const auto send = [&] {
+    std::string input(kInputBytes, '\0');
+    const auto own = plain.value().bytes();
+    std::copy(own.begin(), own.end(), input.begin());
+    const ValueBuffer buffer = ValueBuffer::copyOf(
+        {reinterpret_cast<const std::uint8_t*>(input.data()), input.size()}, account);
+    sendSingle(Dictionary(buffer, buffer.data()), 1, 2, kAlarms);
+  };
+  fakes.random->script({30, 0});
+
+  send();
+  EXPECT_LT(account->bytes(), 1000u);
+  EXPECT_GT(account->bytes(), 0u);
+  send();
+  EXPECT_GT(account->bytes(), kInputBytes) << "what does not wait is not copied";
+  fakes.advance(seconds(60));
+
+  ASSERT_EQ(sent().size(), 2u);
+  EXPECT_EQ(sent()[1].payload, plain);
+}
+
 TEST_F(OstrelReportingSingleMessage, GivesTheBackendThreeEntriesOfSessionInfo) {
   sendSingle({{"a", 1}}, 1, 2, kStandalone);
   fakes.runUntilIdle();
