@@ -160,7 +160,8 @@ class ScriptedBus {
         return;  // Never.
       case 2: {
         sd_bus_message* reply = nullptr;
-        expect(sd_bus_message_new_method_return(call, &reply) >= 0);
+        // Fails when the other end has gone meanwhile.
+        if (sd_bus_message_new_method_return(call, &reply) < 0) return;
         sd_bus_message_set_sender(reply, kName);
         appendAnything(reply, input_, /*depth=*/0);
         sd_bus_send(bus_, reply, nullptr);
@@ -181,13 +182,17 @@ class ScriptedBus {
     sd_bus_message* signal = nullptr;
     const bool isOwner = input_.byte() % 4 == 0;
     if (isOwner) {
-      expect(sd_bus_message_new_signal(bus_, &signal, "/org/freedesktop/DBus",
-                                       "org.freedesktop.DBus", "NameOwnerChanged") >= 0);
+      if (sd_bus_message_new_signal(bus_, &signal, "/org/freedesktop/DBus",
+                                    "org.freedesktop.DBus", "NameOwnerChanged") < 0) {
+        return;
+      }
       sd_bus_message_set_sender(signal, "org.freedesktop.DBus");
       sd_bus_message_append(signal, "s", kName);
     } else {
-      expect(sd_bus_message_new_signal(bus_, &signal, kPath, kProperties,
-                                       "PropertiesChanged") >= 0);
+      if (sd_bus_message_new_signal(bus_, &signal, kPath, kProperties,
+                                    "PropertiesChanged") < 0) {
+        return;
+      }
       sd_bus_message_set_sender(signal, kName);
       sd_bus_message_append(signal, "s", kName);
     }
