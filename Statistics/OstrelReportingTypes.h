@@ -5,16 +5,12 @@
 #include <cstdint>
 #include <functional>
 #include <optional>
-#include <vector>
 
+#include "Statistics/ReporterIDs.h"
 #include "platform/ErrorObject.h"
 #include "platform/Value.h"
 
 namespace ostrel {
-
-/// Names a session; chosen by the client. 0 is never a session.
-enum class ReporterID : std::int64_t {};
-inline constexpr ReporterID kNoReporter{0};
 
 /// Upper half: domain, lower half: kind.
 enum class MessageCategory : std::uint32_t {};
@@ -28,8 +24,6 @@ inline constexpr ServiceType kServiceTypeStandalone{5};
 inline constexpr ServiceType kServiceTypeLongFormAudio{7};
 inline constexpr ServiceType kServiceTypeTest{11};
 inline constexpr ServiceType kServiceTypeUnknown{0xFFFF};
-
-using ReporterIDs = std::vector<ReporterID>;
 
 // Replies. An empty one is never called.
 using BoolReply = std::function<void(bool)>;

@@ -66,7 +66,7 @@ class InputAccount final : public PayloadAccount {
   std::size_t bytes_ = 0;
 };
 
-TEST_F(OstrelReportingSingleMessage, KeepsOnlyItselfInMemoryWhileItWaits) {
+TEST_F(OstrelReportingSingleMessage, HoldsOnlyItselfInMemoryWhileItWaits) {
   constexpr std::size_t kInputBytes = 64 * 1024;
   const auto account = std::make_shared<InputAccount>();
   const Dictionary plain{{"a", 1}};

@@ -4,6 +4,7 @@
 
 #include <algorithm>
 #include <cmath>
+#include <mutex>
 
 namespace ostrel {
 
@@ -26,6 +27,9 @@ std::string SystemClock::fileNameDate(Date date) const {
                              : std::clamp(date.secondsSince1970, kFirst, kLast);
   const auto time = static_cast<time_t>(std::floor(seconds));
   tm calendar{};
+  // The C library guards the zone by itself, unseen by the thread sanitizer.
+  static std::mutex zone;
+  const std::lock_guard lock(zone);
   tzset();
   localtime_r(&time, &calendar);
   char text[64];

@@ -295,8 +295,9 @@ TEST_F(StoreTest, RefusesMessagesBeyondTheBound) {
     success = session->sendMessage(1, 1, payload);
     if (!success.succeeded) break;
   }
+  // The writer may take over once what waits, while the messages come.
   EXPECT_GT(accepted, 2);
-  EXPECT_LT(accepted, 5);
+  EXPECT_LT(accepted, 9);
   ASSERT_TRUE(success.error);
   EXPECT_EQ(success.error->domain, kOstrelErrorDomain);
   EXPECT_EQ(success.error->description, "too much waits to be stored");
