@@ -59,6 +59,8 @@ class PeerChannel final : public PayloadAccount {
   bool isOverBudget() const {
     return own_.isExceeded() || (isBeyondReserve() && user_->queued().isExceeded());
   }
+  /// Whether the user's clients have all under way that they may.
+  bool isUserOverBudget() const { return user_->queued().isExceeded(); }
   /// Asks for `LoopWaker::budgetEased` once there is room; false: there is already.
   bool awaitBudget();
   /// How much may wait now: less while much waits for the user's other clients.

@@ -93,9 +93,9 @@ class PeerConnection final : public IPCConnection {
   bool wantsToRead() const { return ending_ == Ending::kNone && !isHeldBack_; }
   bool wantsToWrite() const { return hasUnread_ && !isDeaf_; }
   bool isHeldBack() const { return isHeldBack_; }
-  /// What was read and not carried out: a frame that is not whole, or requests of a
-  /// client that is held back; and since when the first of them waits.
-  std::size_t pendingBytes() const { return pending_.size(); }
+  /// What of a frame is there that is not whole, and since when it waits. What is held
+  /// back waits for the service, not for the client, and does not count.
+  std::size_t halfFrameBytes() const { return isHeldBack_ ? 0 : pending_.size(); }
   Clock::time_point pendingSince() const { return pendingSince_; }
   /// When `checkPatience` has something to say; none while the client reads.
   bool isImpatient() const { return hasUnread_; }

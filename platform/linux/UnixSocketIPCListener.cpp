@@ -198,7 +198,7 @@ void UnixSocketIPCListener::settle(PeerConnection& connection) {
   if (connection.isHeldBack()) addOnce(heldBack_);
   if (connection.isImpatient()) addOnce(impatient_);
   watch(connection);
-  countPending(connection);
+  countHalfFrame(connection);
 }
 
 void UnixSocketIPCListener::cutOff(PeerConnection& connection) {
@@ -209,17 +209,17 @@ void UnixSocketIPCListener::cutOff(PeerConnection& connection) {
 
 // A client that begins frames and does not end them takes memory for as long as it likes:
 // where a user has too many such, those that began first go.
-void UnixSocketIPCListener::countPending(PeerConnection& connection) {
+void UnixSocketIPCListener::countHalfFrame(PeerConnection& connection) {
   const auto watched = connections_.find(connection.id());
   if (watched == connections_.end()) return;
   User& user = users_[connection.peer().user];
-  user.pendingBytes += connection.pendingBytes() - watched->second.pendingBytes;
-  watched->second.pendingBytes = connection.pendingBytes();
-  if (user.pendingBytes <= limits_.halfFrameBytesOfUser) return;
+  user.halfFrameBytes += connection.halfFrameBytes() - watched->second.halfFrameBytes;
+  watched->second.halfFrameBytes = connection.halfFrameBytes();
+  if (user.halfFrameBytes <= limits_.halfFrameBytesOfUser) return;
   std::shared_ptr<PeerConnection> oldest;
   for (const auto& [id, each] : connections_) {
     const PeerConnection& candidate = *each.connection;
-    if (each.pendingBytes == 0 || candidate.isHeldBack()) continue;
+    if (candidate.halfFrameBytes() == 0) continue;
     if (candidate.peer().user != connection.peer().user) continue;
     if (!oldest || candidate.pendingSince() < oldest->pendingSince()) {
       oldest = each.connection;
@@ -253,13 +253,13 @@ void UnixSocketIPCListener::end(PeerConnection& connection) {
   const auto found = connections_.find(connection.id());
   if (found == connections_.end()) return;
   const std::shared_ptr<PeerConnection> ended = std::move(found->second.connection);
-  const std::size_t pendingBytes = found->second.pendingBytes;
+  const std::size_t halfFrameBytes = found->second.halfFrameBytes;
   connections_.erase(found);
   peers_->peerDisconnected(ended->peer().pid, ended->id());
   const auto user = users_.find(ended->peer().user);
   if (user != users_.end()) {
     --user->second.connections;
-    user->second.pendingBytes -= pendingBytes;
+    user->second.halfFrameBytes -= halfFrameBytes;
   }
   ended->invalidate();
 }

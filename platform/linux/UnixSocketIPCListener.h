@@ -53,7 +53,7 @@ class UnixSocketIPCListener final : public IPCListener {
   struct User {
     std::size_t connections = 0;
     std::shared_ptr<UserAccount> account;
-    std::size_t pendingBytes = 0;  // Of its connections.
+    std::size_t halfFrameBytes = 0;  // Of its connections.
   };
 
   UnixSocketIPCListener(ServiceSocket socket, std::shared_ptr<PeerRegistry> peers,
@@ -74,7 +74,7 @@ class UnixSocketIPCListener final : public IPCListener {
   void watch(PeerConnection& connection);
   void end(PeerConnection& connection);
   void cutOff(PeerConnection& connection);
-  void countPending(PeerConnection& connection);
+  void countHalfFrame(PeerConnection& connection);
 
   const ListenerLimits limits_;
   const ServiceSocket socket_;
@@ -88,8 +88,8 @@ class UnixSocketIPCListener final : public IPCListener {
 
   struct Watched {
     std::shared_ptr<PeerConnection> connection;
-    std::size_t pendingBytes = 0;  // As its user's count has it.
-    std::uint32_t events = 0;      // As epoll knows them; 0: not in it.
+    std::size_t halfFrameBytes = 0;  // As its user's count has it.
+    std::uint32_t events = 0;        // As epoll knows them; 0: not in it.
   };
   std::unordered_map<PeerConnection::ID, Watched> connections_;
   const std::shared_ptr<ServiceAccount> service_;

@@ -596,6 +596,38 @@ TEST_F(UnixSocketListener, HoldsBackAClientThatFloodsRequestsWithoutPayload) {
   EXPECT_LE(whileHeld, 64u * 1024 / limits::kRequestBytes + 1);
 }
 
+TEST_F(UnixSocketListener, CutsNobodyOffWhoIsMerelyHeldBack) {
+  ListenerLimits limits;
+  limits.ofUser.queuedBytes = 64 * 1024;
+  limits.halfFrameBytesOfUser = 64 * 1024;
+  serve(limits);
+  service->holdReplies();
+  constexpr std::size_t kClients = 8;
+  constexpr std::size_t kMessages = 300;
+  std::string burst;
+  for (std::size_t i = 0; i < kMessages; ++i) {
+    wire::appendRequest(burst, messageRequest(0, std::string(200, 'x')));
+  }
+  std::vector<std::unique_ptr<RawClient>> clients;
+  std::vector<std::thread> senders;
+  for (std::size_t i = 0; i < kClients; ++i) {
+    clients.push_back(std::make_unique<RawClient>(path));
+    senders.emplace_back([&burst, client = clients.back().get()] {
+      // In pieces that end within frames.
+      for (std::size_t at = 0; at < burst.size(); at += 5000) {
+        client->send(std::string_view(burst).substr(at, 5000));
+      }
+    });
+  }
+  ASSERT_TRUE(service->waitForCalls(10));
+  std::this_thread::sleep_for(100ms);
+  service->releaseReplies();
+  for (std::thread& sender : senders) sender.join();
+
+  EXPECT_TRUE(service->waitForCalls(kClients * kMessages));
+  EXPECT_EQ(misuse->counts(), MisuseLog::Counts());
+}
+
 TEST_F(UnixSocketListener, ChargesEachDeliveryOfAMessage) {
   ListenerLimits limits;
   limits.queuedBytes = 64 * 1024;
