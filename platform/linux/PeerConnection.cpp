@@ -18,9 +18,9 @@ namespace {
 // A frame that is not whole grows by as much as comes, not by what it claims.
 constexpr std::size_t kMostGrowth = 64 * 1024;
 
-// Read at a time while the user's clients have all under way that they may: what a
-// connection has for itself then, and little that has to wait in memory.
-constexpr std::size_t kReadInNeed = limits::kReservedQueuedBytes;
+// Read at a time while the user's clients have all under way that they may: some more
+// than a connection has for itself then, and little that has to wait in memory.
+constexpr std::size_t kReadInNeed = 2 * limits::kReservedQueuedBytes;
 
 // What of a frame is copied once more. A client that writes byte by byte makes the
 // service copy half of this for each.
@@ -108,7 +108,9 @@ void PeerConnection::read(std::span<std::uint8_t> buffer) {
   std::copy(pending_.begin(), pending_.end(), buffer.begin());
   std::span<std::uint8_t> room = buffer.subspan(pending_.size());
   // What is read now will mostly be held back: it stays in the socket.
-  if (channel_->isUserOverBudget()) room = room.first(kReadInNeed);
+  if (channel_->isUserOverBudget()) {
+    room = room.first(std::min(room.size(), kReadInNeed));
+  }
   const ssize_t count = receive(room);
   if (count <= 0) return;
   const auto bytes = buffer.first(pending_.size() + static_cast<std::size_t>(count));
