@@ -328,7 +328,11 @@ bool ThreadPoolWorkQueues::Strand::runSteps() {
         stepsLeft = kStepsOfTurn - 1;
       }
       steps.runFirst();
-      if (std::exchange(suspendWasCalled_, false)) break;
+      // Read only: who queues steps meanwhile uses what lies beside it.
+      if (suspendWasCalled_) {
+        suspendWasCalled_ = false;
+        break;
+      }
     }
   }
 }
