@@ -52,7 +52,7 @@ class WaitingSessions : public testing::Test {
   }
 
   std::shared_ptr<OstrelReportingServerInstance> connect(ProcessID pid) {
-    const auto connection = fakes.listener->accept(pid);
+    connection = fakes.listener->accept(pid);
     return std::static_pointer_cast<OstrelReportingServerInstance>(
         connection->exportedObject());
   }
@@ -74,6 +74,7 @@ class WaitingSessions : public testing::Test {
   }
 
   FakePlatform fakes;
+  std::shared_ptr<FakeIPCConnection> connection;
   std::shared_ptr<ThreadPoolWorkQueues> queues;
   OstrelReportingPlatform platform;
   std::shared_ptr<OstrelReportingServiceDelegate> root;
@@ -118,6 +119,8 @@ TEST_F(WaitingSessions, AreAllDetachedAfterNineSecondsAndHoldNoThread) {
     ASSERT_TRUE(session->started());
     ASSERT_EQ(session->reportingSession(), nullptr);
   }
+  // A client that is there keeps the service, and the service its clients.
+  connection->invalidate();
   EXPECT_TRUE(queues->drain(steady_clock::now() + std::chrono::seconds(30)));
   fakes.listener->setDelegate(nullptr);
 }
