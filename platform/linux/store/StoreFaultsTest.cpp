@@ -148,7 +148,8 @@ class StoreFaults : public ::testing::Test {
                          "NULL AND flushed_at NOT NULL"),
               "1");
     ASSERT_EQ(reader.one("PRAGMA integrity_check"), "ok");
-    ASSERT_TRUE(setAside().empty());
+    ASSERT_TRUE(setAside().empty())
+        << ::testing::PrintToString(log_->texts(LogLevel::kError));
   }
 
   void overwrite(std::size_t offset, const std::string& bytes) {
