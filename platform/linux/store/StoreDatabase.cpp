@@ -16,6 +16,7 @@
 #include <algorithm>
 #include <cerrno>
 #include <cstdio>
+#include <cstdlib>
 #include <cstring>
 #include <ctime>
 #include <limits>
@@ -80,6 +81,17 @@ StoreDatabase::Result makeDirectories(const std::string& path) {
 
 StoreFault damaged(std::string description) {
   return {StoreFault::Kind::kDamaged, SQLITE_CORRUPT, std::move(description)};
+}
+
+// The check reports a page that could not be read as one of its findings, with SQLite's
+// code or without. None: the finding is about what was read.
+std::optional<int> readErrorIn(const std::string& finding) {
+  constexpr std::string_view kWithCode = "unable to get the page. error code=";
+  if (const auto place = finding.find(kWithCode); place != std::string::npos) {
+    return std::atoi(finding.c_str() + place + kWithCode.size());
+  }
+  if (finding.find("failed to get page") != std::string::npos) return SQLITE_IOERR_READ;
+  return std::nullopt;
 }
 
 StoreFault newer(std::int64_t version) {
@@ -316,8 +328,10 @@ StoreDatabase::Result StoreDatabase::checkContent() {
   if (status.st_size > kCheckedAtOpenBytes) return std::nullopt;
   std::string finding;
   if (auto failed = readText("PRAGMA quick_check(1)", finding)) return failed;
-  if (finding != "ok") return damaged(finding);
-  return std::nullopt;
+  if (finding == "ok") return std::nullopt;
+  const std::optional<int> error = readErrorIn(finding);
+  const StoreFault found = error ? fault(*error, "check") : damaged(finding);
+  return found.kind == StoreFault::Kind::kTransient ? found : damaged(finding);
 }
 
 StoreDatabase::Result StoreDatabase::prepareStatements() {

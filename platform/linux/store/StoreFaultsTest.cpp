@@ -15,6 +15,7 @@
 #include "platform/Logging.h"
 #include "platform/fake/RecordingLog.h"
 #include "platform/linux/store/StoreAnalyticsSink.h"
+#include "platform/linux/store/StoreDatabase.h"
 #include "platform/linux/store/StoreFaultVFS.h"
 #include "platform/linux/store/StoreTelemetryBackend.h"
 #include "platform/linux/store/StoreTesting.h"
@@ -427,6 +428,35 @@ TEST_P(StoreFailingCalls, LoseNothingThatWasAccepted) {
 
 INSTANTIATE_TEST_SUITE_P(Once, StoreFailingCalls, ::testing::Values(false));
 INSTANTIATE_TEST_SUITE_P(ForEver, StoreFailingCalls, ::testing::Values(true));
+
+// Of more pages than SQLite reads to open it, so that the check of the content reads too.
+TEST_F(StoreFaults, DoesNotTakeAPageThatCannotBeReadForDamage) {
+  open();
+  makeSession();
+  const Dictionary payload{{"text", Value(std::string(100'000, 'x'))}};
+  for (int i = 0; i < 10; ++i)
+    ASSERT_TRUE(session_->sendMessage(1, 1, payload).succeeded);
+  close();
+  FaultVFS& vfs = FaultVFS::instance();
+  int failures = 0;
+  int failuresOfTheCheck = 0;
+  FaultPlan plan;
+  for (plan.after = 0; plan.after < 1000; ++plan.after) {
+    SCOPED_TRACE(plan.after);
+    vfs.setPlan(plan);
+    StoreDatabase database(path(), FaultVFS::kName);
+    const StoreDatabase::Result result = database.open();
+    if (vfs.failed() == 0) break;
+    if (!result) continue;
+    ++failures;
+    EXPECT_EQ(result->kind, StoreFault::Kind::kTransient) << result->description;
+    const bool isOfTheCheck = result->description.starts_with("cannot check in");
+    if (isOfTheCheck) ++failuresOfTheCheck;
+  }
+  EXPECT_LT(plan.after, 1000) << "opening has more calls than were tried";
+  EXPECT_GT(failures, failuresOfTheCheck);
+  EXPECT_GE(failuresOfTheCheck, 1);
+}
 
 // The second fault may hit the recovery from the first.
 TEST_F(StoreFaults, LosesNothingToTwoFailingCalls) {
