@@ -1,8 +1,9 @@
 #include "platform/linux/ReporterIDSet.h"
 
 #include <algorithm>
-#include <cstdint>
 #include <utility>
+
+#include "platform/SpreadHash.h"
 
 namespace ostrel {
 namespace {
@@ -13,7 +14,7 @@ constexpr ReporterID kFree{0};
 }  // namespace
 
 bool ReporterIDSet::contains(ReporterID id) const {
-  if (id == kFree) return hasNone_;
+  if (id == kFree) return hasZero_;
   return !slots_.empty() && slots_[find(id)] == id;
 }
 
@@ -21,7 +22,7 @@ bool ReporterIDSet::insert(ReporterID id) {
   if (contains(id)) return false;
   ++size_;
   if (id == kFree) {
-    hasNone_ = true;
+    hasZero_ = true;
     return true;
   }
   if (4 * size_ > 3 * slots_.size()) grow();
@@ -33,7 +34,7 @@ bool ReporterIDSet::erase(ReporterID id) {
   if (!contains(id)) return false;
   --size_;
   if (id == kFree) {
-    hasNone_ = false;
+    hasZero_ = false;
     return true;
   }
   // Those behind the gap move up, as far as that brings none before its home.
@@ -49,11 +50,8 @@ bool ReporterIDSet::erase(ReporterID id) {
   return true;
 }
 
-// IDs are often numbered; the multiplication spreads them.
 std::size_t ReporterIDSet::home(ReporterID id) const {
-  const std::uint64_t spread =
-      static_cast<std::uint64_t>(id) * std::uint64_t{0x9E3779B97F4A7C15};
-  return static_cast<std::size_t>(spread >> 20) & (slots_.size() - 1);
+  return SpreadHash()(id) & (slots_.size() - 1);
 }
 
 std::size_t ReporterIDSet::find(ReporterID id) const {

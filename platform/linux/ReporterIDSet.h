@@ -7,7 +7,8 @@
 
 namespace ostrel {
 
-/// IDs of sessions, in 11 to 21 bytes each: a connection may have 100,000.
+/// IDs of sessions, in 11 to 21 bytes for each of the most that there were: a connection
+/// may have 100,000.
 class ReporterIDSet {
  public:
   std::size_t size() const { return size_; }
@@ -28,7 +29,7 @@ class ReporterIDSet {
   // without a gap. The ID of a free slot is 0; whether 0 is in the set stands apart.
   std::vector<ReporterID> slots_;
   std::size_t size_ = 0;
-  bool hasNone_ = false;
+  bool hasZero_ = false;
 };
 
 }  // namespace ostrel
