@@ -115,6 +115,32 @@ class StoreDatabase::Statement {
                               &statement_, /*pzTail=*/nullptr);
   }
 
+  // SQLITE_ROW, or SQLITE_OK at the end.
+  int step() {
+    const int code = sqlite3_step(statement_);
+    return code == SQLITE_DONE ? SQLITE_OK : code;
+  }
+  void reset() { sqlite3_reset(statement_); }
+
+  // With `values` for its parameters, in their order.
+  template <typename... Values>
+  int run(const Values&... values) {
+    int index = 0;
+    (bind(++index, values), ...);
+    const int code = step();
+    reset();
+    return code;
+  }
+
+  std::int64_t integer(int column) { return sqlite3_column_int64(statement_, column); }
+  std::string text(int column) {
+    const unsigned char* text = sqlite3_column_text(statement_, column);
+    if (text == nullptr) return {};
+    return {reinterpret_cast<const char*>(text),
+            static_cast<std::size_t>(sqlite3_column_bytes(statement_, column))};
+  }
+
+ private:
   void bind(int index, std::int64_t value) {
     sqlite3_bind_int64(statement_, index, value);
   }
@@ -131,28 +157,6 @@ class StoreDatabase::Statement {
     }
   }
 
-  // SQLITE_ROW, or SQLITE_OK at the end.
-  int step() {
-    const int code = sqlite3_step(statement_);
-    return code == SQLITE_DONE ? SQLITE_OK : code;
-  }
-  void reset() { sqlite3_reset(statement_); }
-
-  int run() {
-    const int code = step();
-    reset();
-    return code;
-  }
-
-  std::int64_t integer(int column) { return sqlite3_column_int64(statement_, column); }
-  std::string text(int column) {
-    const unsigned char* text = sqlite3_column_text(statement_, column);
-    if (text == nullptr) return {};
-    return {reinterpret_cast<const char*>(text),
-            static_cast<std::size_t>(sqlite3_column_bytes(statement_, column))};
-  }
-
- private:
   sqlite3_stmt* statement_ = nullptr;
 };
 
@@ -175,6 +179,66 @@ struct StoreDatabase::Statements {
   Statement removePower;
   Statement removeSessions;
   Statement addToStatus;
+
+  struct Source {
+    Statement Statements::*statement;
+    const char* sql;
+  };
+  static const Source kSources[];
+};
+
+const StoreDatabase::Statements::Source StoreDatabase::Statements::kSources[] = {
+    {&Statements::begin, "BEGIN IMMEDIATE"},
+    {&Statements::commit, "COMMIT"},
+    {&Statements::insertSession,
+     "INSERT INTO telemetry_sessions (reporter_id, hierarchy_token, session_info, "
+     "user_info, started_at) VALUES (?, ?, ?, ?, ?)"},
+    {&Statements::setFlushedAt,
+     "UPDATE telemetry_sessions SET flushed_at = ?2 WHERE id = ?1"},
+    {&Statements::setEndedAt,
+     "UPDATE telemetry_sessions SET ended_at = ?2 WHERE id = ?1"},
+    {&Statements::insertMessages,
+     "INSERT INTO telemetry_messages (telemetry_session_id, session_info, user_info, "
+     "category, type, payload, created_at) SELECT * FROM batch_messages"},
+    {&Statements::insertAnalytics,
+     "INSERT INTO analytics_events (name, payload, created_at) "
+     "SELECT * FROM batch_analytics"},
+    {&Statements::insertPowerEvent,
+     "INSERT INTO power_events (client_id, name, event, attachment, created_at) "
+     "VALUES (?, ?, ?, ?, ?)"},
+    {&Statements::setStatus,
+     "INSERT INTO service_status (key, value) VALUES (?, ?) "
+     "ON CONFLICT (key) DO UPDATE SET value = excluded.value"},
+    {&Statements::dataVersion, "PRAGMA data_version"},
+    {&Statements::interest, "SELECT pattern FROM analytics_interest"},
+    {&Statements::fingerprint,
+     "SELECT ifnull((SELECT max(id) FROM telemetry_sessions), 0) + "
+     "ifnull((SELECT max(id) FROM telemetry_messages), 0) + "
+     "ifnull((SELECT max(id) FROM analytics_events), 0) + "
+     "ifnull((SELECT max(id) FROM power_events), 0)"},
+    {&Statements::usedBytes,
+     "SELECT (page_count - freelist_count) * page_size FROM pragma_page_count, "
+     "pragma_freelist_count, pragma_page_size"},
+    {&Statements::removeMessages,
+     "DELETE FROM telemetry_messages WHERE "
+     "id < (SELECT min(id) FROM telemetry_messages) + ?1 AND "
+     "id < (SELECT max(id) FROM telemetry_messages) AND created_at < ?2"},
+    {&Statements::removeAnalytics,
+     "DELETE FROM analytics_events WHERE "
+     "id < (SELECT min(id) FROM analytics_events) + ?1 AND "
+     "id < (SELECT max(id) FROM analytics_events) AND created_at < ?2"},
+    {&Statements::removePower,
+     "DELETE FROM power_events WHERE "
+     "id < (SELECT min(id) FROM power_events) + ?1 AND "
+     "id < (SELECT max(id) FROM power_events) AND created_at < ?2"},
+    {&Statements::removeSessions,
+     "DELETE FROM telemetry_sessions WHERE "
+     "id < (SELECT min(id) FROM telemetry_sessions) + ?1 AND "
+     "id < (SELECT max(id) FROM telemetry_sessions) AND ended_at < ?2 AND "
+     "ended_at < (SELECT created_at FROM telemetry_messages ORDER BY id LIMIT 1)"},
+    {&Statements::addToStatus,
+     "INSERT INTO service_status (key, value) VALUES (?, ?) "
+     "ON CONFLICT (key) DO UPDATE SET value = value + excluded.value"},
 };
 
 StoreDatabase::StoreDatabase(std::string path, const char* vfs)
@@ -336,64 +400,8 @@ StoreDatabase::Result StoreDatabase::checkContent() {
 
 StoreDatabase::Result StoreDatabase::prepareStatements() {
   auto statements = std::make_unique<Statements>();
-  const struct {
-    Statement& statement;
-    const char* sql;
-  } table[] = {
-      {statements->begin, "BEGIN IMMEDIATE"},
-      {statements->commit, "COMMIT"},
-      {statements->insertSession,
-       "INSERT INTO telemetry_sessions (reporter_id, hierarchy_token, session_info, "
-       "user_info, started_at) VALUES (?, ?, ?, ?, ?)"},
-      {statements->setFlushedAt,
-       "UPDATE telemetry_sessions SET flushed_at = ?2 WHERE id = ?1"},
-      {statements->setEndedAt,
-       "UPDATE telemetry_sessions SET ended_at = ?2 WHERE id = ?1"},
-      {statements->insertMessages,
-       "INSERT INTO telemetry_messages (telemetry_session_id, session_info, user_info, "
-       "category, type, payload, created_at) SELECT * FROM batch_messages"},
-      {statements->insertAnalytics,
-       "INSERT INTO analytics_events (name, payload, created_at) "
-       "SELECT * FROM batch_analytics"},
-      {statements->insertPowerEvent,
-       "INSERT INTO power_events (client_id, name, event, attachment, created_at) "
-       "VALUES (?, ?, ?, ?, ?)"},
-      {statements->setStatus,
-       "INSERT INTO service_status (key, value) VALUES (?, ?) "
-       "ON CONFLICT (key) DO UPDATE SET value = excluded.value"},
-      {statements->dataVersion, "PRAGMA data_version"},
-      {statements->interest, "SELECT pattern FROM analytics_interest"},
-      {statements->fingerprint,
-       "SELECT ifnull((SELECT max(id) FROM telemetry_sessions), 0) + "
-       "ifnull((SELECT max(id) FROM telemetry_messages), 0) + "
-       "ifnull((SELECT max(id) FROM analytics_events), 0) + "
-       "ifnull((SELECT max(id) FROM power_events), 0)"},
-      {statements->usedBytes,
-       "SELECT (page_count - freelist_count) * page_size FROM pragma_page_count, "
-       "pragma_freelist_count, pragma_page_size"},
-      {statements->removeMessages,
-       "DELETE FROM telemetry_messages WHERE "
-       "id < (SELECT min(id) FROM telemetry_messages) + ?1 AND "
-       "id < (SELECT max(id) FROM telemetry_messages) AND created_at < ?2"},
-      {statements->removeAnalytics,
-       "DELETE FROM analytics_events WHERE "
-       "id < (SELECT min(id) FROM analytics_events) + ?1 AND "
-       "id < (SELECT max(id) FROM analytics_events) AND created_at < ?2"},
-      {statements->removePower,
-       "DELETE FROM power_events WHERE "
-       "id < (SELECT min(id) FROM power_events) + ?1 AND "
-       "id < (SELECT max(id) FROM power_events) AND created_at < ?2"},
-      {statements->removeSessions,
-       "DELETE FROM telemetry_sessions WHERE "
-       "id < (SELECT min(id) FROM telemetry_sessions) + ?1 AND "
-       "id < (SELECT max(id) FROM telemetry_sessions) AND ended_at < ?2 AND "
-       "ended_at < (SELECT created_at FROM telemetry_messages ORDER BY id LIMIT 1)"},
-      {statements->addToStatus,
-       "INSERT INTO service_status (key, value) VALUES (?, ?) "
-       "ON CONFLICT (key) DO UPDATE SET value = value + excluded.value"},
-  };
-  for (const auto& [statement, sql] : table) {
-    const int code = statement.prepare(connection_, sql);
+  for (const auto& [statement, sql] : Statements::kSources) {
+    const int code = ((*statements).*statement).prepare(connection_, sql);
     if (code == SQLITE_ERROR) {
       return damaged(std::string("its tables are others: ") +
                      sqlite3_errmsg(connection_));
@@ -461,13 +469,11 @@ void StoreDatabase::removeOldestSetAside() {
 }
 
 StoreDatabase::Result StoreDatabase::begin() {
-  const int code = statements_->begin.run();
-  return code == SQLITE_OK ? Result() : fault(code, "begin to write");
+  return resultOf(statements_->begin.run(), "begin to write");
 }
 
 StoreDatabase::Result StoreDatabase::commit() {
-  const int code = statements_->commit.run();
-  return code == SQLITE_OK ? Result() : fault(code, "commit");
+  return resultOf(statements_->commit.run(), "commit");
 }
 
 void StoreDatabase::rollback() {
@@ -478,42 +484,25 @@ void StoreDatabase::rollback() {
 
 StoreDatabase::Result StoreDatabase::insertSession(const SessionRow& row,
                                                    std::int64_t& id) {
-  Statement& statement = statements_->insertSession;
-  statement.bind(1, row.reporterID);
-  statement.bind(2, row.hierarchyToken);
-  statement.bind(3, row.sessionInfo);
-  statement.bind(4, row.userInfo);
-  statement.bind(5, row.startedAt);
-  const int code = statement.run();
-  if (code != SQLITE_OK) return fault(code, "insert a session");
-  id = sqlite3_last_insert_rowid(connection_);
-  return std::nullopt;
+  const int code = statements_->insertSession.run(
+      row.reporterID, row.hierarchyToken, row.sessionInfo, row.userInfo, row.startedAt);
+  if (code == SQLITE_OK) id = sqlite3_last_insert_rowid(connection_);
+  return resultOf(code, "insert a session");
 }
 
 StoreDatabase::Result StoreDatabase::setFlushedAt(std::int64_t session,
                                                   std::int64_t time) {
-  statements_->setFlushedAt.bind(1, session);
-  statements_->setFlushedAt.bind(2, time);
-  const int code = statements_->setFlushedAt.run();
-  return code == SQLITE_OK ? Result() : fault(code, "update a session");
+  return resultOf(statements_->setFlushedAt.run(session, time), "update a session");
 }
 
 StoreDatabase::Result StoreDatabase::setEndedAt(std::int64_t session, std::int64_t time) {
-  statements_->setEndedAt.bind(1, session);
-  statements_->setEndedAt.bind(2, time);
-  const int code = statements_->setEndedAt.run();
-  return code == SQLITE_OK ? Result() : fault(code, "update a session");
+  return resultOf(statements_->setEndedAt.run(session, time), "update a session");
 }
 
 StoreDatabase::Result StoreDatabase::insertPowerEvent(const PowerRow& row) {
-  Statement& statement = statements_->insertPowerEvent;
-  statement.bind(1, std::int64_t{row.clientID});
-  statement.bind(2, row.name);
-  statement.bind(3, row.event);
-  statement.bind(4, row.attachment);
-  statement.bind(5, row.createdAt);
-  const int code = statement.run();
-  return code == SQLITE_OK ? Result() : fault(code, "insert a power event");
+  return resultOf(statements_->insertPowerEvent.run(row.clientID, row.name, row.event,
+                                                    row.attachment, row.createdAt),
+                  "insert a power event");
 }
 
 StoreDatabase::Result StoreDatabase::insertRows(const RowBatch& rows) {
@@ -524,48 +513,11 @@ StoreDatabase::Result StoreDatabase::insertRows(const RowBatch& rows) {
     code = statements_->insertAnalytics.run();
   }
   rows_ = nullptr;
-  return code == SQLITE_OK ? Result() : fault(code, "insert rows");
-}
-
-StoreDatabase::Result StoreDatabase::setStatus(std::string_view key, std::int64_t value) {
-  statements_->setStatus.bind(1, key);
-  statements_->setStatus.bind(2, value);
-  const int code = statements_->setStatus.run();
-  return code == SQLITE_OK ? Result() : fault(code, "update the status");
-}
-
-StoreDatabase::Result StoreDatabase::readInterestIfChanged(
-    std::optional<std::vector<std::string>>& patterns) {
-  Statement& dataVersion = statements_->dataVersion;
-  int code = dataVersion.step();
-  const std::int64_t version = code == SQLITE_ROW ? dataVersion.integer(0) : 0;
-  dataVersion.reset();
-  if (code != SQLITE_ROW) return fault(code, "read the version of the data");
-  if (version == dataVersion_) return std::nullopt;
-  std::vector<std::string> read;
-  Statement& interest = statements_->interest;
-  while ((code = interest.step()) == SQLITE_ROW) read.push_back(interest.text(0));
-  interest.reset();
-  if (code != SQLITE_OK) return fault(code, "read the wanted events");
-  dataVersion_ = version;
-  patterns = std::move(read);
-  return std::nullopt;
-}
-
-StoreDatabase::Result StoreDatabase::readFingerprint(std::int64_t& fingerprint) {
-  Statement& statement = statements_->fingerprint;
-  const int code = statement.step();
-  if (code == SQLITE_ROW) fingerprint = statement.integer(0);
-  statement.reset();
-  return code == SQLITE_ROW ? Result() : fault(code, "read the last rows");
+  return resultOf(code, "insert rows");
 }
 
 StoreDatabase::Result StoreDatabase::readUsedBytes(std::int64_t& bytes) {
-  Statement& statement = statements_->usedBytes;
-  const int code = statement.step();
-  if (code == SQLITE_ROW) bytes = statement.integer(0);
-  statement.reset();
-  return code == SQLITE_ROW ? Result() : fault(code, "read the size");
+  return readInteger(statements_->usedBytes, "read the size", bytes);
 }
 
 StoreDatabase::Result StoreDatabase::removeOldest(std::int64_t rows,
@@ -574,21 +526,44 @@ StoreDatabase::Result StoreDatabase::removeOldest(std::int64_t rows,
   for (Statement* statement :
        {&statements_->removeMessages, &statements_->removeAnalytics,
         &statements_->removePower, &statements_->removeSessions}) {
-    statement->bind(1, rows);
-    statement->bind(2, before.value_or(std::numeric_limits<std::int64_t>::max()));
-    const int code = statement->run();
+    const int code =
+        statement->run(rows, before.value_or(std::numeric_limits<std::int64_t>::max()));
     if (code != SQLITE_OK) return fault(code, "remove old rows");
     removed += sqlite3_changes64(connection_);
   }
   return std::nullopt;
 }
 
+StoreDatabase::Result StoreDatabase::setStatus(std::string_view key, std::int64_t value) {
+  return resultOf(statements_->setStatus.run(key, value), "update the status");
+}
+
 StoreDatabase::Result StoreDatabase::addToStatus(std::string_view key,
                                                  std::int64_t value) {
-  statements_->addToStatus.bind(1, key);
-  statements_->addToStatus.bind(2, value);
-  const int code = statements_->addToStatus.run();
-  return code == SQLITE_OK ? Result() : fault(code, "update the status");
+  return resultOf(statements_->addToStatus.run(key, value), "update the status");
+}
+
+StoreDatabase::Result StoreDatabase::readFingerprint(std::int64_t& fingerprint) {
+  return readInteger(statements_->fingerprint, "read the last rows", fingerprint);
+}
+
+StoreDatabase::Result StoreDatabase::readInterestIfChanged(
+    std::optional<std::vector<std::string>>& patterns) {
+  std::int64_t version = 0;
+  if (auto failed = readInteger(statements_->dataVersion, "read the version of the data",
+                                version)) {
+    return failed;
+  }
+  if (version == dataVersion_) return std::nullopt;
+  std::vector<std::string> read;
+  Statement& interest = statements_->interest;
+  int code;
+  while ((code = interest.step()) == SQLITE_ROW) read.push_back(interest.text(0));
+  interest.reset();
+  if (code != SQLITE_OK) return fault(code, "read the wanted events");
+  dataVersion_ = version;
+  patterns = std::move(read);
+  return std::nullopt;
 }
 
 bool StoreDatabase::matches(const std::string& pattern, const std::string& text) {
@@ -596,17 +571,22 @@ bool StoreDatabase::matches(const std::string& pattern, const std::string& text)
 }
 
 StoreDatabase::Result StoreDatabase::run(const char* sql) {
-  const int code = sqlite3_exec(connection_, sql, nullptr, nullptr, nullptr);
-  return code == SQLITE_OK ? Result() : fault(code, "set up");
+  return resultOf(sqlite3_exec(connection_, sql, nullptr, nullptr, nullptr), "set up");
 }
 
 StoreDatabase::Result StoreDatabase::readInteger(const char* sql, std::int64_t& value) {
   Statement statement;
-  int code = statement.prepare(connection_, sql);
-  if (code == SQLITE_OK) code = statement.step();
-  if (code != SQLITE_ROW) return fault(code, "read");
-  value = statement.integer(0);
-  return std::nullopt;
+  const int code = statement.prepare(connection_, sql);
+  return code == SQLITE_OK ? readInteger(statement, "read", value) : fault(code, "read");
+}
+
+StoreDatabase::Result StoreDatabase::readInteger(Statement& statement,
+                                                 std::string_view action,
+                                                 std::int64_t& value) {
+  const int code = statement.step();
+  if (code == SQLITE_ROW) value = statement.integer(0);
+  statement.reset();
+  return code == SQLITE_ROW ? Result() : fault(code, action);
 }
 
 StoreDatabase::Result StoreDatabase::readText(const char* sql, std::string& value) {
@@ -616,6 +596,10 @@ StoreDatabase::Result StoreDatabase::readText(const char* sql, std::string& valu
   if (code != SQLITE_ROW) return fault(code, "read");
   value = statement.text(0);
   return std::nullopt;
+}
+
+StoreDatabase::Result StoreDatabase::resultOf(int code, std::string_view action) const {
+  return code == SQLITE_OK ? Result() : fault(code, action);
 }
 
 StoreFault StoreDatabase::fault(int code, std::string_view action) const {

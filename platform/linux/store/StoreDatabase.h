@@ -91,13 +91,13 @@ class StoreDatabase {
   /// The newest of each kind stays, so that no id is given twice. `removed` grows.
   Result removeOldest(std::int64_t rows, std::optional<std::int64_t> before,
                       std::int64_t& removed);
+
+  Result setStatus(std::string_view key, std::int64_t value);
   /// Adds to a value of the status that outlives the process.
   Result addToStatus(std::string_view key, std::int64_t value);
 
   /// A number that differs before and after any insertion.
   Result readFingerprint(std::int64_t& fingerprint);
-
-  Result setStatus(std::string_view key, std::int64_t value);
 
   /// The patterns of the analytics events that are wanted, when they may have
   /// changed since the last call. Inside a transaction.
@@ -124,7 +124,9 @@ class StoreDatabase {
 
   Result run(const char* sql);
   Result readInteger(const char* sql, std::int64_t& value);
+  Result readInteger(Statement& statement, std::string_view action, std::int64_t& value);
   Result readText(const char* sql, std::string& value);
+  Result resultOf(int code, std::string_view action) const;
   StoreFault fault(int code, std::string_view action) const;
 
   const std::string path_;
