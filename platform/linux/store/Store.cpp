@@ -1,13 +1,10 @@
 #include "platform/linux/store/Store.h"
 
-#include <pthread.h>
-#include <signal.h>
-
 #include <algorithm>
-#include <new>
 
 #include "platform/Logging.h"
 #include "platform/linux/Limits.h"
+#include "platform/linux/Threads.h"
 
 namespace ostrel {
 namespace {
@@ -53,15 +50,8 @@ Store::Store(std::string path, StoreOptions options)
     : options_(std::move(options)),
       writer_(std::move(path), options_.vfs, options_.retention, counters_,
               options_.otherCounts),
-      retryPause_(options_.firstRetry) {
-  // Signals are for the main thread.
-  sigset_t all;
-  sigset_t before;
-  ::sigfillset(&all);
-  ::pthread_sigmask(SIG_SETMASK, &all, &before);
-  thread_ = std::thread([this] { runWriter(); });
-  ::pthread_sigmask(SIG_SETMASK, &before, /*oldmask=*/nullptr);
-}
+      retryPause_(options_.firstRetry),
+      thread_(startThread("ostrel-store", /*niceness=*/0, [this] { runWriter(); })) {}
 
 Store::~Store() {
   shutdown(Clock::time_point::max());
@@ -87,20 +77,11 @@ bool Store::shutdown(Clock::time_point deadline) {
 std::optional<ErrorObject> Store::addMessage(StoreSession* session,
                                              std::uint16_t category, std::uint16_t type,
                                              const Dictionary& payload) {
-  if (auto refused = refusal()) return refused;
-  const std::int64_t now = options_.now();
-  if (push({now, SessionMessage{session, category, type, payload}})) {
-    return std::nullopt;
-  }
-  counters_.refused.fetch_add(1, std::memory_order_relaxed);
-  return makeError(kQueueIsFull, "too much waits to be stored");
+  return pushMessage({options_.now(), SessionMessage{session, category, type, payload}});
 }
 
 std::optional<ErrorObject> Store::addLoneMessage(LoneMessage message) {
-  if (auto refused = refusal()) return refused;
-  if (push({options_.now(), std::move(message)})) return std::nullopt;
-  counters_.refused.fetch_add(1, std::memory_order_relaxed);
-  return makeError(kQueueIsFull, "too much waits to be stored");
+  return pushMessage({options_.now(), std::move(message)});
 }
 
 StoreSession* Store::beginSession(const Dictionary& sessionInfo,
@@ -132,22 +113,13 @@ void Store::flush(StoreSession* session, TelemetrySession::FlushCallback complet
 }
 
 void Store::addAnalyticsEvent(std::string name, AnalyticsSink::PayloadProvider provider) {
-  const State state = state_.load(std::memory_order_relaxed);
-  if ((state == State::kUsable || state == State::kOpening) &&
-      push({options_.now(),
-            AnalyticsEvent{std::move(name), std::move(provider), std::nullopt}})) {
-    return;
-  }
-  counters_.droppedAnalytics.fetch_add(1, std::memory_order_relaxed);
+  pushEvent({options_.now(),
+             AnalyticsEvent{std::move(name), std::move(provider), std::nullopt}},
+            counters_.droppedAnalytics);
 }
 
 void Store::addPowerEvent(PowerEvent event) {
-  const State state = state_.load(std::memory_order_relaxed);
-  if ((state == State::kUsable || state == State::kOpening) &&
-      push({options_.now(), std::move(event)})) {
-    return;
-  }
-  counters_.droppedPower.fetch_add(1, std::memory_order_relaxed);
+  pushEvent({options_.now(), std::move(event)}, counters_.droppedPower);
 }
 
 void Store::noteStatusChange() { push({options_.now(), StatusChange{}}); }
@@ -165,12 +137,25 @@ void Store::whenKnown(Answer answer) {
   answer(isUsable);
 }
 
-std::optional<ErrorObject> Store::refusal() {
+bool Store::takesReports() const {
   const State state = state_.load(std::memory_order_relaxed);
-  if (state == State::kUsable || state == State::kOpening) return std::nullopt;
+  return state == State::kUsable || state == State::kOpening;
+}
+
+std::optional<ErrorObject> Store::pushMessage(StoreOperation operation) {
+  if (takesReports()) {
+    if (push(std::move(operation))) return std::nullopt;
+    counters_.refused.fetch_add(1, std::memory_order_relaxed);
+    return makeError(kQueueIsFull, "too much waits to be stored");
+  }
   counters_.refused.fetch_add(1, std::memory_order_relaxed);
   const std::lock_guard lock(mutex_);
   return faultError_;
+}
+
+void Store::pushEvent(StoreOperation operation, std::atomic<std::uint64_t>& dropped) {
+  if (takesReports() && push(std::move(operation))) return;
+  dropped.fetch_add(1, std::memory_order_relaxed);
 }
 
 // False when there is no room; the store's own steps always find room: what is queued
@@ -199,7 +184,6 @@ bool Store::push(StoreOperation operation) {
 }
 
 void Store::runWriter() {
-  ::pthread_setname_np(::pthread_self(), "ostrel-store");
   work();
   while (waitForWork()) work();
   finish();

@@ -111,7 +111,9 @@ class Store {
 
   Store(std::string path, StoreOptions options);
 
-  std::optional<ErrorObject> refusal();
+  bool takesReports() const;
+  std::optional<ErrorObject> pushMessage(StoreOperation operation);
+  void pushEvent(StoreOperation operation, std::atomic<std::uint64_t>& dropped);
   bool push(StoreOperation operation);
   void wakeWriter() { workIsThere_.notify_one(); }
 

@@ -40,6 +40,12 @@ bool isRow(const StoreOperation& operation) {
          std::holds_alternative<PowerEvent>(operation.what);
 }
 
+std::size_t payloadBytesOf(const StoreBatch& batch) {
+  std::size_t bytes = 0;
+  for (const StoreOperation& operation : batch) bytes += operation.payloadBytes();
+  return bytes;
+}
+
 void appendLenientJSON(std::string& out, const Dictionary& value) {
   appendJSON(out, value.value(), JSONLayout::kCompact, JSONStrictness::kLenient,
              /*indent=*/0);
@@ -77,14 +83,19 @@ StoreWriter::Result StoreWriter::openOrReplace() {
   if (database_.isOpen() && database_.isInPlace()) return std::nullopt;
   Result failed = database_.open();
   if (failed && failed->kind == StoreFault::Kind::kDamaged) {
-    if (Result stuck = database_.setAside(failed->description)) return stuck;
-    counters_.setAside.fetch_add(1, std::memory_order_relaxed);
+    if (Result stuck = setAside(*failed)) return stuck;
     failed = database_.open();
   }
   if (!failed && database_.isAnother()) {
     ++file_;
     doubt_.reset();
   }
+  return failed;
+}
+
+StoreWriter::Result StoreWriter::setAside(const StoreFault& fault) {
+  const Result failed = database_.setAside(fault.description);
+  if (!failed) counters_.setAside.fetch_add(1, std::memory_order_relaxed);
   return failed;
 }
 
@@ -107,8 +118,7 @@ StoreWriter::Result StoreWriter::resolveDoubt() {
 
 void StoreWriter::add(std::vector<StoreBatch> batches) {
   for (StoreBatch& batch : batches) {
-    for (const StoreOperation& operation : batch)
-      uncommittedBytes_ += operation.payloadBytes();
+    uncommittedBytes_ += payloadBytesOf(batch);
     pending_.push_back(std::move(batch));
   }
   if (fault_) return;
@@ -385,9 +395,7 @@ void StoreWriter::fail(const StoreFault& fault) {
     loggedFault_ = fault.description;
   }
   if (fault.kind == StoreFault::Kind::kDamaged) {
-    if (!database_.setAside(fault.description)) {
-      counters_.setAside.fetch_add(1, std::memory_order_relaxed);
-    }
+    setAside(fault);
     return;
   }
   switch (fault.code & 0xFF) {
@@ -441,10 +449,7 @@ void StoreWriter::keepAtMost(std::size_t count) {
   pending_.erase(pending_.begin(),
                  pending_.begin() + static_cast<std::ptrdiff_t>(batches));
   uncommittedBytes_ = 0;
-  for (const StoreBatch& batch : pending_) {
-    for (const StoreOperation& operation : batch)
-      uncommittedBytes_ += operation.payloadBytes();
-  }
+  for (const StoreBatch& batch : pending_) uncommittedBytes_ += payloadBytesOf(batch);
 }
 
 ErrorObject StoreWriter::errorOf(const StoreFault& fault) {

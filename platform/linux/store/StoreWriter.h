@@ -77,6 +77,7 @@ class StoreWriter {
   };
 
   Result openOrReplace();
+  Result setAside(const StoreFault& fault);
   Result resolveDoubt();
   std::vector<StoreBatch> takeDone(std::size_t batches);
   Result writePending();
