@@ -76,11 +76,12 @@ FileDescriptor openRoot(const std::string& root) {
 
 // Opens the directory `name` in `parent` if it is one, and trustworthy; else sets
 // errno.
-FileDescriptor openDirectory(int parent, const std::string& name) {
+FileDescriptor openDirectory(const FileCalls& calls, int parent,
+                             const std::string& name) {
   FileDescriptor directory(
       ::openat(parent, name.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
   struct stat status;
-  if (!directory || ::fstat(directory.get(), &status) != 0) return FileDescriptor();
+  if (!directory || calls.fstat(directory.get(), &status) != 0) return FileDescriptor();
   if (status.st_uid != ::geteuid() && status.st_uid != 0) {
     errno = EPERM;
     return FileDescriptor();
@@ -178,7 +179,9 @@ class FileWriter {
 
 }  // namespace
 
-FileCalls FileCalls::system() { return {::write, ::fchmod, ::fsync, ::renameat}; }
+FileCalls FileCalls::system() {
+  return {::write, ::fstat, ::fchmod, ::fsync, ::renameat};
+}
 
 DirectoryFileSystem::DirectoryFileSystem(std::string root)
     : DirectoryFileSystem(std::move(root), FileCalls::system()) {}
@@ -201,7 +204,7 @@ Success DirectoryFileSystem::createDirectory(const std::string& path,
     if (const int error = errorOfName(name)) return failure(error, kAction, path);
     const bool isNew = ::mkdirat(directory.get(), name.c_str(), 0700) == 0;
     if (!isNew && errno != EEXIST) return failure(errno, kAction, path);
-    directory = openDirectory(directory.get(), name);
+    directory = openDirectory(calls_, directory.get(), name);
     if (!directory) return failure(errno, kAction, path);
     if (isNew && calls_.fchmod(directory.get(), permissions & 07777) != 0) {
       return failure(errno, kAction, path);
@@ -223,7 +226,7 @@ Success DirectoryFileSystem::writeFileAtomically(const std::string& directory,
   for (const std::string& step : *names) {
     if (!parent) break;
     if (const int error = errorOfName(step)) return failure(error, kAction, path);
-    parent = openDirectory(parent.get(), step);
+    parent = openDirectory(calls_, parent.get(), step);
   }
   if (!parent) return failure(errno, kAction, path);
 

@@ -1,5 +1,6 @@
 #pragma once
 
+#include <sys/stat.h>
 #include <sys/types.h>
 
 #include <string>
@@ -10,9 +11,10 @@ namespace ostrel {
 
 class FileDescriptor;
 
-/// The system calls whose failures tests bring about.
+/// The system calls whose failures and answers tests bring about.
 struct FileCalls {
   ssize_t (*write)(int file, const void* bytes, std::size_t size);
+  int (*fstat)(int file, struct stat* status);
   int (*fchmod)(int file, mode_t mode);
   int (*fsync)(int file);
   int (*renameat)(int fromDirectory, const char* from, int toDirectory, const char* to);

@@ -117,13 +117,26 @@ TEST_F(DirectoryFileSystemTest, FailsOnAFileInPlaceOfADirectory) {
 
 TEST_F(DirectoryFileSystemTest, RefusesADirectoryOfAnotherUser) {
   makeLogs();
-  if (::geteuid() != 0) {
-    GTEST_SKIP() << "only root can give a directory away";
+  static uid_t owner;
+  FileCalls calls = FileCalls::system();
+  calls.fstat = [](int file, struct stat* status) {
+    const int result = ::fstat(file, status);
+    status->st_uid = owner;
+    return result;
+  };
+  DirectoryFileSystem files(root(), calls);
+  for (const uid_t trusted : {::geteuid(), uid_t{0}}) {
+    owner = trusted;
+    EXPECT_TRUE(files.writeFileAtomically(logs(), "a", textOf("x")).succeeded);
   }
-  ASSERT_EQ(::chown(logs().c_str(), 65534, 65534), 0);
-  const Success result = files_.writeFileAtomically(logs(), "a", textOf("x"));
-  EXPECT_FALSE(result.succeeded);
-  EXPECT_EQ(result.error->code, EPERM);
+  owner = ::geteuid() + 1;
+  for (const Success& result : {files.writeFileAtomically(logs(), "b", textOf("x")),
+                                files.createDirectory(logs(), 0777)}) {
+    EXPECT_FALSE(result.succeeded);
+    ASSERT_TRUE(result.error);
+    EXPECT_EQ(result.error->code, EPERM);
+  }
+  EXPECT_EQ(names(), std::vector<std::string>{"a"});
 }
 
 TEST_F(DirectoryFileSystemTest, WritesAFileReadableByItsGroupOnly) {
