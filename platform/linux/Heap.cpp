@@ -16,13 +16,20 @@ constexpr int kOwnPagesBytes = 256 * 1024;
 
 }  // namespace
 
-HeapKeeper::HeapKeeper(std::shared_ptr<TimerThread> timers) : timers_(std::move(timers)) {
+HeapKeeper::HeapKeeper(std::shared_ptr<TimerThread> timers)
+    : HeapKeeper(
+          {[timers = std::move(timers)](std::chrono::milliseconds delay, Task action) {
+             timers->scheduleAfter(delay, std::move(action));
+           },
+           [] { ::malloc_trim(0); }}) {
   ::mallopt(M_TRIM_THRESHOLD, kKeptBytes);
   ::mallopt(M_MMAP_THRESHOLD, kOwnPagesBytes);
 }
 
+HeapKeeper::HeapKeeper(Calls calls) : calls_(std::move(calls)) {}
+
 void HeapKeeper::watch() {
-  timers_->scheduleAfter(kQuiet, [weak = weak_from_this()] {
+  calls_.scheduleAfter(kQuiet, [weak = weak_from_this()] {
     const auto self = weak.lock();
     if (!self) return;
     if (self->hasWorked_.exchange(false, std::memory_order_relaxed)) {
@@ -30,7 +37,7 @@ void HeapKeeper::watch() {
       return;
     }
     self->isWatching_.store(false, std::memory_order_relaxed);
-    ::malloc_trim(0);
+    self->calls_.giveBack();
   });
 }
 

@@ -1,55 +1,82 @@
 #include "platform/linux/Heap.h"
 
 #include <gtest/gtest.h>
-#include <unistd.h>
 
-#include <chrono>
-#include <cstddef>
-#include <cstring>
-#include <fstream>
+#include <deque>
 #include <memory>
-#include <thread>
-#include <vector>
+#include <utility>
 
 namespace ostrel {
 namespace {
 
-std::size_t residentBytes() {
-  std::size_t all = 0;
-  std::size_t resident = 0;
-  std::ifstream("/proc/self/statm") >> all >> resident;
-  return resident * static_cast<std::size_t>(::sysconf(_SC_PAGESIZE));
+/// When free memory is given back, told by a count in place of a heap.
+class HeapKeeping : public testing::Test {
+ protected:
+  void work(std::size_t rounds) {
+    for (std::size_t i = 0; i < rounds; ++i) keeper_->noteWork();
+  }
+  /// The quiet time after which the keeper looks again passes.
+  void look() {
+    ASSERT_FALSE(looks_.empty());
+    Task look = std::move(looks_.front());
+    looks_.pop_front();
+    look();
+  }
+
+  std::deque<Task> looks_;
+  int timesGivenBack_ = 0;
+  std::shared_ptr<HeapKeeper> keeper_ = std::make_shared<HeapKeeper>(
+      HeapKeeper::Calls{[this](std::chrono::milliseconds delay, Task action) {
+                          EXPECT_EQ(delay, HeapKeeper::kQuiet);
+                          looks_.push_back(std::move(action));
+                        },
+                        [this] { ++timesGivenBack_; }});
+};
+
+TEST_F(HeapKeeping, BeginsWithABurstAndLooksOnceForIt) {
+  work(HeapKeeper::kRoundsOfBurst - 1);
+  EXPECT_EQ(looks_.size(), 0u);
+  work(1);
+  EXPECT_EQ(looks_.size(), 1u);
+  work(2 * HeapKeeper::kRoundsOfBurst);
+  EXPECT_EQ(looks_.size(), 1u);
 }
 
-TEST(Heap, GivesBackWhatABurstTook) {
-#if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__)
-  GTEST_SKIP() << "the sanitizers bring a heap of their own";
-#endif
-  constexpr std::size_t kPieces = 40'000;
-  constexpr std::size_t kPieceBytes = 1000;
-  const auto timers = std::make_shared<TimerThread>();
-  const auto keeper = std::make_shared<HeapKeeper>(timers);
-  std::vector<std::unique_ptr<char[]>> pieces(kPieces);
-  const std::size_t before = residentBytes();
-  for (auto& piece : pieces) {
-    piece.reset(new char[kPieceBytes]);
-    std::memset(piece.get(), 1, kPieceBytes);
+TEST_F(HeapKeeping, GoesOnWhileThereIsWork) {
+  work(HeapKeeper::kRoundsOfBurst);
+  for (int i = 0; i < 5; ++i) {
+    look();
+    EXPECT_EQ(looks_.size(), 1u);
+    work(1);
   }
-  const std::unique_ptr<char[]> last(new char[kPieceBytes]);  // The heap cannot shrink.
-  const std::size_t during = residentBytes();
-  for (auto& piece : pieces) piece.reset();
-  EXPECT_GT(during, before + kPieces * kPieceBytes / 2);
+  EXPECT_EQ(timesGivenBack_, 0);
+}
 
-  for (std::size_t i = 0; i < HeapKeeper::kRoundsOfBurst; ++i) keeper->noteWork();
-  const auto isGivenBack = [&] {
-    return residentBytes() < before + kPieces * kPieceBytes / 4;
-  };
-  EXPECT_FALSE(isGivenBack());
-  const auto patience = std::chrono::steady_clock::now() + std::chrono::seconds(30);
-  while (!isGivenBack() && std::chrono::steady_clock::now() < patience) {
-    std::this_thread::sleep_for(std::chrono::milliseconds(20));
+TEST_F(HeapKeeping, EndsOnceAllHasBeenQuiet) {
+  work(HeapKeeper::kRoundsOfBurst);
+  look();
+  EXPECT_EQ(timesGivenBack_, 0) << "there was work";
+  look();
+  EXPECT_EQ(timesGivenBack_, 1);
+  EXPECT_TRUE(looks_.empty());
+}
+
+TEST_F(HeapKeeping, BeginsAgainWithTheNextBurst) {
+  for (int burst = 1; burst <= 3; ++burst) {
+    work(HeapKeeper::kRoundsOfBurst);
+    look();
+    look();
+    EXPECT_EQ(timesGivenBack_, burst);
   }
-  EXPECT_TRUE(isGivenBack());
+}
+
+TEST_F(HeapKeeping, EndsWithTheKeeper) {
+  work(HeapKeeper::kRoundsOfBurst);
+  look();
+  keeper_.reset();
+  look();
+  EXPECT_EQ(timesGivenBack_, 0);
+  EXPECT_TRUE(looks_.empty());
 }
 
 }  // namespace

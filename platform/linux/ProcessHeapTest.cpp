@@ -1,0 +1,54 @@
+// What the keeper of the heap does to the process's own.
+#include "platform/linux/Heap.h"
+
+#include <gtest/gtest.h>
+#include <unistd.h>
+
+#include <chrono>
+#include <cstddef>
+#include <cstring>
+#include <fstream>
+#include <memory>
+#include <thread>
+#include <vector>
+
+namespace ostrel {
+namespace {
+
+std::size_t residentBytes() {
+  std::size_t all = 0;
+  std::size_t resident = 0;
+  std::ifstream("/proc/self/statm") >> all >> resident;
+  return resident * static_cast<std::size_t>(::sysconf(_SC_PAGESIZE));
+}
+
+TEST(ProcessHeap, GivesBackWhatABurstTook) {
+  constexpr std::size_t kPieces = 40'000;
+  constexpr std::size_t kPieceBytes = 1000;
+  const auto timers = std::make_shared<TimerThread>();
+  const auto keeper = std::make_shared<HeapKeeper>(timers);
+  std::vector<std::unique_ptr<char[]>> pieces(kPieces);
+  const std::size_t before = residentBytes();
+  for (auto& piece : pieces) {
+    piece.reset(new char[kPieceBytes]);
+    std::memset(piece.get(), 1, kPieceBytes);
+  }
+  const std::unique_ptr<char[]> last(new char[kPieceBytes]);  // The heap cannot shrink.
+  const std::size_t during = residentBytes();
+  for (auto& piece : pieces) piece.reset();
+  EXPECT_GT(during, before + kPieces * kPieceBytes / 2);
+
+  for (std::size_t i = 0; i < HeapKeeper::kRoundsOfBurst; ++i) keeper->noteWork();
+  const auto isGivenBack = [&] {
+    return residentBytes() < before + kPieces * kPieceBytes / 4;
+  };
+  EXPECT_FALSE(isGivenBack());
+  const auto patience = std::chrono::steady_clock::now() + std::chrono::seconds(30);
+  while (!isGivenBack() && std::chrono::steady_clock::now() < patience) {
+    std::this_thread::sleep_for(std::chrono::milliseconds(20));
+  }
+  EXPECT_TRUE(isGivenBack());
+}
+
+}  // namespace
+}  // namespace ostrel
