@@ -68,9 +68,8 @@ class WaylandInterfaceOrientationDisplay : public testing::Test {
 class WaylandInterfaceOrientationSway : public WaylandInterfaceOrientationDisplay {
  protected:
   void SetUp() override {
-    if (ChildProcess({"sway", "--version"}).wait() != 0) {
-      GTEST_SKIP() << "sway is not installed: a real compositor was NOT tested";
-    }
+    ASSERT_EQ(ChildProcess({"sway", "--version"}).wait(), 0)
+        << "sway is missing: scripts/install-packages test installs it";
     directory_.write("config", "");
     // It refuses to run as root.
     if (::geteuid() == 0) {
