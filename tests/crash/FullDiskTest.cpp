@@ -1,17 +1,17 @@
 // The service on a file system of 2 MiB that fills up.
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
-#include <sched.h>
-#include <sys/mount.h>
-#include <sys/wait.h>
-#include <unistd.h>
 
+#include <cstdio>
+#include <filesystem>
+#include <string>
+
+#include "platform/linux/SmallFileSystem.h"
 #include "tests/crash/LoadedService.h"
 
 namespace ostrel::crash {
 namespace {
 
-constexpr int kNoNamespace = 77;
 constexpr ReporterID kReporter{7};
 
 void sendOne(RecordingClient& client, const std::string& text, int number) {
@@ -31,11 +31,7 @@ int fillAndEmpty() {
   ServiceUnderTest service;
   const std::string state = service / "state";
   std::filesystem::create_directories(state);
-  if (::unshare(CLONE_NEWNS) != 0 ||
-      ::mount("none", "/", nullptr, MS_REC | MS_PRIVATE, nullptr) != 0 ||
-      ::mount("none", state.c_str(), "tmpfs", 0, "size=2m") != 0) {
-    return kNoNamespace;
-  }
+  testing_support::SmallFileSystem disk(state, "2m");
   service.start();
   RecordingClient client(service.socketPath());
   client->createReportingSession(kReporter, nullptr);
@@ -55,7 +51,7 @@ int fillAndEmpty() {
   // It serves on, and refuses once its queue is full of what cannot be written.
   for (int i = 0; i < 200; ++i) sendOne(client, text, ++number);
   if (!client.takeReplies().empty()) return 2;
-  if (::mount("none", state.c_str(), "tmpfs", MS_REMOUNT, "size=64m") != 0) return 3;
+  if (!disk.resize("64m")) return 3;
   if (!eventually([&] {
         sendOne(client, "", ++number);
         client.takeReplies();
@@ -87,15 +83,7 @@ int fillAndEmpty() {
 }
 
 TEST(FullDisk, IsBorneAndWhatItCostIsTold) {
-  const pid_t child = ::fork();
-  if (child == 0) ::_exit(fillAndEmpty());
-  int status = 0;
-  ASSERT_EQ(::waitpid(child, &status, /*options=*/0), child);
-  ASSERT_TRUE(WIFEXITED(status));
-  if (WEXITSTATUS(status) == kNoNamespace) {
-    GTEST_SKIP() << "no mount namespace to be had: needs root";
-  }
-  EXPECT_EQ(WEXITSTATUS(status), 0) << "the step that failed";
+  testing_support::expectInChildWithSmallFileSystem(fillAndEmpty);
 }
 
 }  // namespace

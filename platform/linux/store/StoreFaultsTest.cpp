@@ -1,7 +1,5 @@
 // Faults of the file and of the file system below it.
 #include <fcntl.h>
-#include <sched.h>
-#include <sys/mount.h>
 #include <sys/resource.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
@@ -14,6 +12,7 @@
 
 #include "platform/Logging.h"
 #include "platform/fake/RecordingLog.h"
+#include "platform/linux/SmallFileSystem.h"
 #include "platform/linux/store/StoreAnalyticsSink.h"
 #include "platform/linux/store/StoreDatabase.h"
 #include "platform/linux/store/StoreFaultVFS.h"
@@ -475,34 +474,11 @@ TEST_F(StoreFaults, LosesNothingToTwoFailingCalls) {
   }
 }
 
-// In a mount namespace of its own, on a file system of 1 MiB. Exit status 0 when all
-// was as expected, 77 when such a file system cannot be had.
-constexpr int kNoNamespace = 77;
-
-int runOnASmallFileSystem(const std::string& place,
-                          int (*body)(const std::string& place)) {
-  if (::unshare(CLONE_NEWNS) != 0 ||
-      ::mount("none", "/", nullptr, MS_REC | MS_PRIVATE, nullptr) != 0 ||
-      ::mount("none", place.c_str(), "tmpfs", 0, "size=1m") != 0) {
-    return kNoNamespace;
-  }
-  return body(place);
-}
-
-void expectOnASmallFileSystem(int (*body)(const std::string& place)) {
-  TemporaryDirectory place;
-  const pid_t child = ::fork();
-  if (child == 0) ::_exit(runOnASmallFileSystem(place.path(), body));
-  int status = 0;
-  ASSERT_EQ(::waitpid(child, &status, /*options=*/0), child);
-  ASSERT_TRUE(WIFEXITED(status));
-  if (WEXITSTATUS(status) == kNoNamespace) {
-    GTEST_SKIP() << "no mount namespace to be had: needs root";
-  }
-  EXPECT_EQ(WEXITSTATUS(status), 0) << "the step that failed";
-}
+// The steps of these tests return 0, or the number of the one that failed.
+using testing_support::SmallFileSystem;
 
 int fillTheDisk(const std::string& place) {
+  SmallFileSystem disk(place, "1m");
   const auto store = Store::open(place + "/reports.db", quickOptions());
   StoreTelemetryBackend backend(store);
   const auto session = backend.createSession(sessionInfo(7), userInfo(), {});
@@ -515,7 +491,7 @@ int fillTheDisk(const std::string& place) {
   }
   if (success.succeeded) return 1;
   if (success.error->description.find("full") == std::string::npos) return 2;
-  if (::mount("none", place.c_str(), "tmpfs", MS_REMOUNT, "size=64m") != 0) return 3;
+  if (!disk.resize("64m")) return 3;
   if (!eventually([&] { return session->sendMessage(1, 1, payload).succeeded; })) {
     return 4;
   }
@@ -526,22 +502,23 @@ int fillTheDisk(const std::string& place) {
 }
 
 TEST(StoreOnASmallFileSystem, RefusesWhenTheDiskIsFullAndGoesOnWhenItIsNot) {
-  expectOnASmallFileSystem(fillTheDisk);
+  TemporaryDirectory place;
+  testing_support::expectInChildWithSmallFileSystem(
+      [&] { return fillTheDisk(place.path()); });
 }
 
 int makeItReadOnly(const std::string& place) {
+  SmallFileSystem disk(place, "1m");
   const std::string path = place + "/reports.db";
   { const auto store = Store::open(path, quickOptions()); }
-  if (::mount("none", place.c_str(), "tmpfs", MS_REMOUNT | MS_RDONLY, "size=1m") != 0) {
-    return 1;
-  }
+  if (!disk.makeReadOnly("1m")) return 1;
   const auto store = Store::open(path, quickOptions());
   StoreTelemetryBackend backend(store);
   const auto session = backend.createSession(sessionInfo(7), userInfo(), {});
   if (!eventually([&] { return !session->sendMessage(1, 1, {}).succeeded; })) return 2;
   const Success refused = session->sendMessage(1, 1, {});
   if (refused.error->description.find("Read-only") == std::string::npos) return 3;
-  if (::mount("none", place.c_str(), "tmpfs", MS_REMOUNT, "size=1m") != 0) return 4;
+  if (!disk.resize("1m")) return 4;
   if (!eventually([&] { return session->sendMessage(1, 2, {}).succeeded; })) return 5;
   if (flushed(*session)) return 6;
   return OtherConnection(path).one(
@@ -551,7 +528,9 @@ int makeItReadOnly(const std::string& place) {
 }
 
 TEST(StoreOnASmallFileSystem, RefusesWhileItIsReadOnlyAndGoesOnAfterwards) {
-  expectOnASmallFileSystem(makeItReadOnly);
+  TemporaryDirectory place;
+  testing_support::expectInChildWithSmallFileSystem(
+      [&] { return makeItReadOnly(place.path()); });
 }
 
 }  // namespace
