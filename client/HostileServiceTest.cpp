@@ -3,7 +3,6 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <sys/socket.h>
-#include <sys/un.h>
 
 #include <algorithm>
 #include <chrono>
@@ -15,6 +14,7 @@
 #include "client/ClientSocket.h"
 #include "ostrel/OstrelReportingClient.h"
 #include "platform/linux/Limits.h"
+#include "platform/linux/TestSockets.h"
 #include "platform/linux/TestSupport.h"
 #include "platform/linux/wire/Frame.h"
 
@@ -41,22 +41,13 @@ std::string frameOf(std::string_view item) {
 /// A service that says what it is told to.
 class ScriptedService {
  public:
-  ScriptedService() {
-    listener_ = OwnedDescriptor(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
-    sockaddr_un address{};
-    address.sun_family = AF_UNIX;
-    std::strncpy(address.sun_path, path().c_str(), sizeof address.sun_path - 1);
-    EXPECT_EQ(::bind(listener_.get(), reinterpret_cast<const sockaddr*>(&address),
-                     sizeof address),
-              0);
-    EXPECT_EQ(::listen(listener_.get(), /*n=*/8), 0);
-  }
+  ScriptedService() { EXPECT_TRUE(listener_); }
 
   std::string path() const { return directory_ / "socket"; }
 
   /// Takes the next connection.
   void accept() {
-    client_ = OwnedDescriptor(::accept4(listener_.get(), nullptr, nullptr, SOCK_CLOEXEC));
+    client_ = FileDescriptor(::accept4(listener_.get(), nullptr, nullptr, SOCK_CLOEXEC));
     EXPECT_TRUE(client_);
   }
   /// Reads until as many frames are there, as whole as they come.
@@ -78,9 +69,9 @@ class ScriptedService {
   void hangUp() { client_.reset(); }
 
  private:
-  const ostrel::testing_support::TemporaryDirectory directory_;
-  OwnedDescriptor listener_;
-  OwnedDescriptor client_;
+  const testing_support::TemporaryDirectory directory_;
+  const FileDescriptor listener_ = testing_support::listeningSocket(path());
+  FileDescriptor client_;
 };
 
 /// How requests ended.

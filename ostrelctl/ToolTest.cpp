@@ -10,8 +10,8 @@
 
 #include "ostrelctl/FakeServiceConnection.h"
 #include "ostrelctl/ManualToolClock.h"
-#include "ostrelctl/TemporaryDirectory.h"
 #include "ostrelctl/TestStore.h"
+#include "platform/linux/TestSupport.h"
 
 namespace ostrel {
 namespace {
@@ -39,7 +39,7 @@ class ToolTest : public ::testing::Test {
     return text.str();
   }
 
-  TemporaryDirectory directory_;
+  const testing_support::TemporaryDirectory directory_;
   std::istringstream in_;
   std::ostringstream out_;
   std::ostringstream err_;

@@ -1,6 +1,4 @@
 #include <sys/socket.h>
-#include <sys/un.h>
-#include <unistd.h>
 
 #include <atomic>
 #include <cerrno>
@@ -12,6 +10,7 @@
 #include "platform/contract/Time.h"
 #include "platform/fake/EventLog.h"
 #include "platform/fake/FakeIPCListener.h"
+#include "platform/linux/TestSockets.h"
 #include "platform/linux/TestSupport.h"
 #include "platform/linux/UnixSocketIPCListener.h"
 
@@ -130,14 +129,8 @@ class ListenerOnASocket {
   ListenerOnASocket& operator=(const ListenerOnASocket&) = delete;
 
   void connect() {
-    client_.reset(socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
-    sockaddr_un address{};
-    address.sun_family = AF_UNIX;
-    path_.copy(address.sun_path, sizeof address.sun_path - 1);
-    ASSERT_EQ(::connect(client_.get(), reinterpret_cast<const sockaddr*>(&address),
-                        sizeof address),
-              0)
-        << std::strerror(errno);
+    client_ = testing_support::connectedSocket(path_);
+    ASSERT_TRUE(client_) << std::strerror(errno);
   }
   void request() { write({0x82, 0x0A, 0x00}); }  // [10, 0]
   void endWell() {

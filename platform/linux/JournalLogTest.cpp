@@ -4,7 +4,6 @@
 #include <gtest/gtest.h>
 #include <poll.h>
 #include <sys/socket.h>
-#include <sys/un.h>
 
 #include <array>
 #include <csignal>
@@ -16,6 +15,8 @@
 #include <vector>
 
 #include "platform/Logging.h"
+#include "platform/linux/TestSockets.h"
+#include "platform/linux/TestSupport.h"
 
 namespace ostrel {
 namespace {
@@ -275,25 +276,14 @@ TEST_F(JournalLogLines, OfManyThreadsStayWholeAndInEachThreadsOrder) {
 
 class JournalLogJournal : public testing::Test {
  protected:
-  void SetUp() override {
-    char path[] = "/tmp/ostrel-journal-XXXXXX";
-    ASSERT_NE(::mkdtemp(path), nullptr);
-    directory_ = path;
-    listen();
-  }
-  void TearDown() override { std::filesystem::remove_all(directory_); }
+  void SetUp() override { listen(); }
 
-  std::string socketPath() const { return directory_ + "/socket"; }
+  std::string socketPath() const { return directory_ / "socket"; }
 
   void listen() {
     std::filesystem::remove(socketPath());
-    journal_.reset(::socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC, 0));
-    sockaddr_un address{};
-    address.sun_family = AF_UNIX;
-    std::strncpy(address.sun_path, socketPath().c_str(), sizeof address.sun_path - 1);
-    ASSERT_EQ(::bind(journal_.get(), reinterpret_cast<const sockaddr*>(&address),
-                     sizeof address),
-              0);
+    journal_ = testing_support::boundSocket(SOCK_DGRAM, socketPath());
+    ASSERT_TRUE(journal_);
   }
 
   /// The next record; waits for it.
@@ -304,7 +294,7 @@ class JournalLogJournal : public testing::Test {
     return record;
   }
 
-  std::string directory_;
+  const testing_support::TemporaryDirectory directory_;
   FileDescriptor journal_;
 };
 
@@ -329,7 +319,7 @@ TEST_F(JournalLogJournal, GetsATextWithAnEndOfLineByItsLength) {
 TEST_F(JournalLogJournal, IsNoneWhereNobodyListens) {
   journal_.reset();
   EXPECT_EQ(connectJournalSink(socketPath()), nullptr);
-  EXPECT_EQ(connectJournalSink(directory_ + "/missing"), nullptr);
+  EXPECT_EQ(connectJournalSink(directory_ / "missing"), nullptr);
   EXPECT_EQ(connectJournalSink(std::string(200, 'x')), nullptr);
 }
 

@@ -3,7 +3,6 @@
 
 #include <poll.h>
 #include <sys/socket.h>
-#include <sys/un.h>
 
 #include <chrono>
 #include <cstdint>
@@ -14,6 +13,7 @@
 
 #include "platform/Value.h"
 #include "platform/linux/FileDescriptor.h"
+#include "platform/linux/TestSockets.h"
 #include "platform/linux/wire/Frame.h"
 
 namespace ostrel::testing_support {
@@ -24,16 +24,8 @@ inline constexpr std::chrono::seconds kSoon{5};
 /// A client that says what it is told to, byte by byte if need be.
 class RawClient {
  public:
-  explicit RawClient(const std::string& path) {
-    socket_ = FileDescriptor(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
-    sockaddr_un address{};
-    address.sun_family = AF_UNIX;
-    path.copy(address.sun_path, sizeof address.sun_path - 1);
-    isConnected_ = ::connect(socket_.get(), reinterpret_cast<const sockaddr*>(&address),
-                             sizeof address) == 0;
-  }
+  explicit RawClient(const std::string& path) : socket_(connectedSocket(path)) {}
 
-  bool isConnected() const { return isConnected_; }
   int socket() const { return socket_.get(); }
   void hangUp() { socket_.reset(); }
 
@@ -102,7 +94,6 @@ class RawClient {
   }
 
   FileDescriptor socket_;
-  bool isConnected_ = false;
   bool hasEnded_ = false;
 };
 

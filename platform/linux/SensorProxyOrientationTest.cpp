@@ -2,11 +2,9 @@
 
 #include <gtest/gtest.h>
 #include <sys/socket.h>
-#include <sys/un.h>
 #include <systemd/sd-bus.h>
 
 #include <atomic>
-#include <cstring>
 #include <fstream>
 #include <functional>
 #include <thread>
@@ -14,6 +12,7 @@
 
 #include "platform/linux/ChildProcess.h"
 #include "platform/linux/LinuxOrientationService.h"
+#include "platform/linux/TestSockets.h"
 #include "platform/linux/TestSupport.h"
 
 namespace ostrel {
@@ -22,19 +21,10 @@ namespace {
 using std::chrono::milliseconds;
 using std::chrono::steady_clock;
 using testing_support::ChildProcess;
+using testing_support::eventually;
 using testing_support::TemporaryDirectory;
 
 constexpr milliseconds kFirstBackOff{10};
-
-/// Waits for what happens elsewhere; false when it takes a minute.
-bool eventually(const std::function<bool()>& condition) {
-  const auto end = steady_clock::now() + std::chrono::minutes(1);
-  while (!condition()) {
-    if (steady_clock::now() > end) return false;
-    std::this_thread::sleep_for(milliseconds(1));
-  }
-  return true;
-}
 
 /// A bus of its own, where the system bus of this process is said to be.
 class PrivateBus {
@@ -353,15 +343,8 @@ TEST_F(SensorProxyOrientationBus, StaysUsableUnderAFlood) {
 class SensorProxyOrientationNoBus : public SensorProxyOrientationBus {
  protected:
   void SetUp() override {
-    listener_.reset(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
-    sockaddr_un address{};
-    address.sun_family = AF_UNIX;
-    std::strncpy(address.sun_path, bus_.socketPath().c_str(),
-                 sizeof address.sun_path - 1);
-    ASSERT_EQ(::bind(listener_.get(), reinterpret_cast<const sockaddr*>(&address),
-                     sizeof address),
-              0);
-    ASSERT_EQ(::listen(listener_.get(), 8), 0);
+    listener_ = testing_support::listeningSocket(bus_.socketPath());
+    ASSERT_TRUE(listener_);
   }
   FileDescriptor accept() {
     return FileDescriptor(::accept4(listener_.get(), nullptr, nullptr, SOCK_CLOEXEC));

@@ -3,7 +3,6 @@
 #include <fcntl.h>
 #include <gtest/gtest.h>
 #include <sys/socket.h>
-#include <sys/un.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -15,28 +14,14 @@
 #include <string>
 
 #include "platform/linux/FileDescriptor.h"
+#include "platform/linux/TestSockets.h"
 #include "platform/linux/TestSupport.h"
 
 namespace ostrel {
 namespace {
 
+using testing_support::boundSocket;
 using testing_support::TemporaryDirectory;
-
-sockaddr_un addressOf(const std::string& path) {
-  sockaddr_un address{};
-  address.sun_family = AF_UNIX;
-  path.copy(address.sun_path, sizeof address.sun_path);
-  if (path.front() == '@') address.sun_path[0] = '\0';
-  return address;
-}
-
-FileDescriptor boundSocket(int type, const std::string& path) {
-  FileDescriptor made(::socket(AF_UNIX, type | SOCK_CLOEXEC, 0));
-  const sockaddr_un address = addressOf(path);
-  const auto size = static_cast<socklen_t>(offsetof(sockaddr_un, sun_path) + path.size());
-  EXPECT_EQ(::bind(made.get(), reinterpret_cast<const sockaddr*>(&address), size), 0);
-  return made;
-}
 
 /// What `takePassedSockets` gives in a process with this environment, whose
 /// descriptor 3 is open and 4 is not. `pid` is "self" for its own.

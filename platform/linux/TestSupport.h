@@ -1,31 +1,28 @@
 // For the tests of the Linux bindings.
 #pragma once
 
-#include <sys/socket.h>
-#include <sys/un.h>
-
+#include <chrono>
 #include <cstdlib>
-#include <cstring>
 #include <filesystem>
 #include <fstream>
 #include <memory>
 #include <mutex>
 #include <string>
 #include <string_view>
+#include <thread>
 #include <vector>
 
 #include "platform/Logging.h"
-#include "platform/linux/FileDescriptor.h"
 
 namespace ostrel::testing_support {
 
 /// A directory of its own, gone at the end of the test.
 class TemporaryDirectory {
  public:
-  TemporaryDirectory() {
-    std::string pattern = "/tmp/ostrel-test-XXXXXX";
-    if (::mkdtemp(pattern.data()) == nullptr) std::abort();
-    path_ = pattern;
+  TemporaryDirectory() : TemporaryDirectory(std::filesystem::temp_directory_path()) {}
+  explicit TemporaryDirectory(const std::filesystem::path& parent)
+      : path_(parent / "ostrel-test-XXXXXX") {
+    if (::mkdtemp(path_.data()) == nullptr) std::abort();
   }
   TemporaryDirectory(const TemporaryDirectory&) = delete;
   TemporaryDirectory& operator=(const TemporaryDirectory&) = delete;
@@ -45,19 +42,26 @@ class TemporaryDirectory {
     return path;
   }
 
+  /// A place in memory where there is one: for tests that write much.
+  static std::filesystem::path inMemory() {
+    const std::filesystem::path memory = "/dev/shm";
+    return std::filesystem::exists(memory) ? memory
+                                           : std::filesystem::temp_directory_path();
+  }
+
  private:
   std::string path_;
 };
 
-/// Whether a connection to the Unix socket at `path` is taken. The file is there a moment
-/// before anybody listens.
-inline bool isListenedTo(const std::string& path) {
-  const FileDescriptor socket(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
-  sockaddr_un address{};
-  address.sun_family = AF_UNIX;
-  std::strncpy(address.sun_path, path.c_str(), sizeof address.sun_path - 1);
-  return ::connect(socket.get(), reinterpret_cast<const sockaddr*>(&address),
-                   sizeof address) == 0;
+/// Waits for what happens elsewhere; false when it takes far too long.
+template <typename Condition>
+bool eventually(const Condition& condition) {
+  const auto end = std::chrono::steady_clock::now() + std::chrono::minutes(2);
+  while (!condition()) {
+    if (std::chrono::steady_clock::now() > end) return false;
+    std::this_thread::sleep_for(std::chrono::milliseconds(2));
+  }
+  return true;
 }
 
 /// The process's log while it lives: keeps every line's text.

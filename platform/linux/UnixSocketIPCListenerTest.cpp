@@ -5,7 +5,6 @@
 #include <poll.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
-#include <sys/un.h>
 
 #include <chrono>
 #include <cstring>
@@ -298,13 +297,8 @@ TEST_F(UnixSocketListener, LeavesNoSocketBehind) {
 
 TEST_F(UnixSocketListener, SaysToTheServiceManagerThatItIsReady) {
   const std::string notify = directory / "notify";
-  FileDescriptor manager(::socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC, 0));
-  sockaddr_un address{};
-  address.sun_family = AF_UNIX;
-  notify.copy(address.sun_path, sizeof address.sun_path - 1);
-  ASSERT_EQ(
-      ::bind(manager.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address),
-      0);
+  const FileDescriptor manager = boundSocket(SOCK_DGRAM, notify);
+  ASSERT_TRUE(manager);
   ::setenv("NOTIFY_SOCKET", notify.c_str(), /*replace=*/1);
 
   serve();

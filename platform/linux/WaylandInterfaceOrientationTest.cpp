@@ -3,15 +3,13 @@
 #include <gtest/gtest.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
-#include <sys/un.h>
 
 #include <cstring>
-#include <functional>
-#include <thread>
 #include <vector>
 
 #include "platform/linux/ChildProcess.h"
 #include "platform/linux/LinuxOrientationService.h"
+#include "platform/linux/TestSockets.h"
 #include "platform/linux/TestSupport.h"
 
 namespace ostrel {
@@ -20,19 +18,11 @@ namespace {
 using std::chrono::milliseconds;
 using std::chrono::steady_clock;
 using testing_support::ChildProcess;
+using testing_support::eventually;
 using testing_support::TemporaryDirectory;
 using Names = std::vector<std::string>;
 
 constexpr uid_t kNobody = 65534;
-
-bool eventually(const std::function<bool()>& condition) {
-  const auto end = steady_clock::now() + std::chrono::minutes(1);
-  while (!condition()) {
-    if (steady_clock::now() > end) return false;
-    std::this_thread::sleep_for(milliseconds(5));
-  }
-  return true;
-}
 
 class WaylandInterfaceOrientationDisplay : public testing::Test {
  protected:
@@ -159,14 +149,8 @@ TEST_F(WaylandInterfaceOrientationDisplay, MayBeMissing) {
 }
 
 TEST_F(WaylandInterfaceOrientationDisplay, ThatHangsOrTalksNonsenseCostsNothing) {
-  const FileDescriptor listener(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
-  sockaddr_un address{};
-  address.sun_family = AF_UNIX;
-  std::strncpy(address.sun_path, socketPath().c_str(), sizeof address.sun_path - 1);
-  ASSERT_EQ(
-      ::bind(listener.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address),
-      0);
-  ASSERT_EQ(::listen(listener.get(), 8), 0);
+  const FileDescriptor listener = testing_support::listeningSocket(socketPath());
+  ASSERT_TRUE(listener);
   observe();
   // An event of an object that never was, one too long, and random bytes.
   const std::string junk[] = {std::string("\x63\0\0\0\0\0\x0c\0\0\0\0\0", 12),

@@ -2,13 +2,10 @@
 #include <gtest/gtest.h>
 #include <signal.h>
 
-#include <chrono>
 #include <filesystem>
 #include <fstream>
-#include <functional>
 #include <sstream>
 #include <string>
-#include <thread>
 #include <vector>
 
 #include "platform/linux/ChildProcess.h"
@@ -18,20 +15,12 @@ namespace ostrel {
 namespace {
 
 using testing_support::ChildProcess;
+using testing_support::eventually;
 using testing_support::TemporaryDirectory;
 
 /// A program of this build: they stand side by side.
 std::string program(const std::string& name) {
   return std::filesystem::read_symlink("/proc/self/exe").parent_path() / name;
-}
-
-bool eventually(const std::function<bool()>& condition) {
-  const auto end = std::chrono::steady_clock::now() + std::chrono::minutes(2);
-  while (!condition()) {
-    if (std::chrono::steady_clock::now() > end) return false;
-    std::this_thread::sleep_for(std::chrono::milliseconds(10));
-  }
-  return true;
 }
 
 std::vector<std::string> linesOf(const std::string& path) {

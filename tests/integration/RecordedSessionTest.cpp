@@ -9,7 +9,7 @@
 #include <regex>
 #include <stdexcept>
 
-#include "platform/linux/TestSupport.h"
+#include "platform/linux/TestSockets.h"
 #include "tests/integration/ServiceUnderTest.h"
 
 namespace ostrel {

@@ -6,45 +6,19 @@
 
 #include <chrono>
 #include <condition_variable>
-#include <filesystem>
-#include <memory>
 #include <mutex>
 #include <optional>
 #include <string>
 #include <utility>
 #include <vector>
 
+#include "platform/linux/TestSupport.h"
 #include "platform/linux/store/Store.h"
 
 namespace ostrel {
 
-/// A directory of its own, removed at the end.
-class TemporaryDirectory {
- public:
-  TemporaryDirectory() : TemporaryDirectory(std::filesystem::temp_directory_path()) {}
-  explicit TemporaryDirectory(const std::filesystem::path& parent) {
-    std::string pattern = parent / "ostrel-XXXXXX";
-    path_ = ::mkdtemp(pattern.data());
-  }
-  ~TemporaryDirectory() {
-    std::error_code ignored;
-    std::filesystem::remove_all(path_, ignored);
-  }
-  TemporaryDirectory(const TemporaryDirectory&) = delete;
-  TemporaryDirectory& operator=(const TemporaryDirectory&) = delete;
-
-  const std::string& path() const { return path_; }
-
-  /// A place in memory where there is one: for tests that write much.
-  static std::filesystem::path inMemory() {
-    const std::filesystem::path memory = "/dev/shm";
-    return std::filesystem::exists(memory) ? memory
-                                           : std::filesystem::temp_directory_path();
-  }
-
- private:
-  std::string path_;
-};
+using testing_support::eventually;
+using testing_support::TemporaryDirectory;
 
 /// A second connection to a store, as a reader or a meddler has one.
 class OtherConnection {
@@ -119,17 +93,6 @@ class Awaited {
   std::optional<T> value_;
   int times_ = 0;
 };
-
-/// Waits until `condition` holds; false when it takes far too long.
-template <typename Condition>
-bool eventually(Condition condition) {
-  const auto end = std::chrono::steady_clock::now() + std::chrono::seconds(30);
-  while (!condition()) {
-    if (std::chrono::steady_clock::now() > end) return false;
-    std::this_thread::sleep_for(std::chrono::milliseconds(2));
-  }
-  return true;
-}
 
 /// The result of a flush, waited for.
 inline std::optional<ErrorObject> flushed(TelemetrySession& session) {
