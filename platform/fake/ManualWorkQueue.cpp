@@ -1,6 +1,7 @@
 #include "platform/fake/ManualWorkQueue.h"
 
 #include <algorithm>
+#include <map>
 #include <utility>
 
 #include "platform/fake/FakeUse.h"
@@ -144,34 +145,33 @@ void ManualWorkQueueFactory::asyncAfter(std::chrono::nanoseconds delay, Task ste
 }
 
 bool ManualWorkQueueFactory::runOne() {
-  std::shared_ptr<ManualWorkQueue> queue;
-  Task step;
-  {
-    const std::lock_guard lock(shared_->mutex);
-    checkFakeUse(!shared_->isRunning, "steps are not run from inside a step");
-    if (shared_->ready.empty()) return false;
-    queue = shared_->ready.begin()->second;
-    step = std::move(queue->steps_.front().task);
-    queue->steps_.pop_front();
-    queue->isRunning_ = true;
-    queue->updateReady();
-    shared_->isRunning = true;
-  }
-  runStepOf(queue, std::move(step));
+  std::unique_lock lock(shared_->mutex);
+  checkFakeUse(!shared_->isRunning, "steps are not run from inside a step");
+  if (shared_->ready.empty()) return false;
+  runStepOf(shared_->ready.begin()->second, /*position=*/0, std::move(lock));
   return true;
 }
 
-void ManualWorkQueueFactory::runStepOf(const std::shared_ptr<ManualWorkQueue>& queue,
-                                       Task step) {
+void ManualWorkQueueFactory::runStepOf(std::shared_ptr<ManualWorkQueue> queue,
+                                       std::size_t position,
+                                       std::unique_lock<std::mutex> lock) {
+  const auto at = queue->steps_.begin() + static_cast<std::ptrdiff_t>(position);
+  Task step = std::move(at->task);
+  queue->steps_.erase(at);
+  queue->isRunning_ = true;
+  queue->updateReady();
+  shared_->isRunning = true;
+  lock.unlock();
   {
     const CurrentQueueScope scope(queue.get());
     step();
     step = Task();
   }
-  const std::lock_guard lock(shared_->mutex);
+  lock.lock();
   shared_->isRunning = false;
   queue->isRunning_ = false;
   queue->updateReady();
+  lock.unlock();  // Before the last reference to the queue may go.
 }
 
 std::vector<std::size_t> ManualWorkQueueFactory::readyQueues() const {
@@ -183,25 +183,15 @@ std::vector<std::size_t> ManualWorkQueueFactory::readyQueues() const {
 }
 
 void ManualWorkQueueFactory::runOneOf(std::size_t number, std::size_t position) {
-  std::shared_ptr<ManualWorkQueue> queue;
-  Task step;
-  {
-    const std::lock_guard lock(shared_->mutex);
-    checkFakeUse(!shared_->isRunning, "steps are not run from inside a step");
-    for (const auto& [order, ready] : shared_->ready) {
-      if (ready->number_ == number) queue = ready;
-    }
-    checkFakeUse(queue != nullptr, "the queue is ready");
-    checkFakeUse(position == 0 || (number == 0 && position < queue->steps_.size()),
-                 "only steps of the background queue have no order");
-    const auto at = queue->steps_.begin() + static_cast<std::ptrdiff_t>(position);
-    step = std::move(at->task);
-    queue->steps_.erase(at);
-    queue->isRunning_ = true;
-    queue->updateReady();
-    shared_->isRunning = true;
-  }
-  runStepOf(queue, std::move(step));
+  std::unique_lock lock(shared_->mutex);
+  checkFakeUse(!shared_->isRunning, "steps are not run from inside a step");
+  const auto ready =
+      std::find_if(shared_->ready.begin(), shared_->ready.end(),
+                   [&](const auto& entry) { return entry.second->number_ == number; });
+  checkFakeUse(ready != shared_->ready.end(), "the queue is ready");
+  checkFakeUse(position == 0 || (number == 0 && position < ready->second->steps_.size()),
+               "only steps of the background queue have no order");
+  runStepOf(ready->second, position, std::move(lock));
 }
 
 std::size_t ManualWorkQueueFactory::runUntilIdle() {

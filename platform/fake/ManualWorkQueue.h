@@ -4,7 +4,6 @@
 #include <cstdint>
 #include <deque>
 #include <functional>
-#include <map>
 #include <memory>
 #include <mutex>
 #include <string>
@@ -27,8 +26,6 @@ class ManualWorkQueue final : public WorkQueue,
   bool isCurrent() const override;
   const std::string& label() const override { return label_; }
 
-  /// Counts from 1 in the order of making; the background queue is 0.
-  std::size_t number() const { return number_; }
   QualityOfService qualityOfService() const { return qualityOfService_; }
   int relativePriority() const { return relativePriority_; }
   bool isSuspended() const;
@@ -87,7 +84,8 @@ class ManualWorkQueueFactory final : public WorkQueueFactory, private Concurrent
   std::size_t runUntilIdle();
 
   /// For tests that choose which queue goes on: the numbers of those that can run a
-  /// step, ascending.
+  /// step, ascending. Queues count from 1 in the order of making; the background queue
+  /// is 0.
   std::vector<std::size_t> readyQueues() const;
   /// How many steps of the background queue wait, delayed ones apart.
   std::size_t backgroundCount() const { return background_->waitingCount(); }
@@ -108,7 +106,9 @@ class ManualWorkQueueFactory final : public WorkQueueFactory, private Concurrent
 
  private:
   void asyncAfter(std::chrono::nanoseconds delay, Task step) override;
-  void runStepOf(const std::shared_ptr<ManualWorkQueue>& queue, Task step);
+  /// With the lock held; the step runs without.
+  void runStepOf(std::shared_ptr<ManualWorkQueue> queue, std::size_t position,
+                 std::unique_lock<std::mutex> lock);
 
   const std::shared_ptr<ManualClock> clock_;
   const std::shared_ptr<ManualWorkQueue::Shared> shared_;
