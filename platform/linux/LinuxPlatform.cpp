@@ -37,17 +37,15 @@ namespace {
 
 constexpr std::chrono::milliseconds kLogFarewell{200};
 
+// How soon the status shows what clients were cut short of.
+constexpr std::chrono::seconds kStatusDelay{1};
+
 // Once the store is known, no session waits for it any more.
 void awaitStore(Store& store, std::chrono::steady_clock::time_point deadline) {
   const auto known = std::make_shared<std::promise<void>>();
   store.whenKnown([known](bool) { known->set_value(); });
   known->get_future().wait_until(deadline);
 }
-
-}  // namespace
-
-// How soon the status shows what clients were cut short of.
-constexpr std::chrono::seconds kStatusDelay{1};
 
 /// Says to the store that counts have changed, however many do, once in a while.
 class StatusNotice : public std::enable_shared_from_this<StatusNotice> {
@@ -71,6 +69,8 @@ class StatusNotice : public std::enable_shared_from_this<StatusNotice> {
   std::weak_ptr<Store> store_;
   std::atomic<bool> isGiven_{false};
 };
+
+}  // namespace
 
 // In the order of making; what is below may use what is above. The socket comes
 // first: a second service must not touch the store of the first.

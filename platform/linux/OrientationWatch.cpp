@@ -60,11 +60,9 @@ std::shared_ptr<const OrientationWatch::Callback> OrientationWatch::takeOldest()
   const auto now = std::chrono::steady_clock::now();
   if (now - crowdLoggedAt_ >= kShortestLogInterval) {
     crowdLoggedAt_ = now;
-    OSTREL_LOG_ERROR(
-        processLogScope,
-        "more than %lu sessions watch the orientation: the oldest do not any "
-        "more",
-        mostObservers_);
+    OSTREL_LOG_ERROR(processLogScope,
+                     "more than %lu sessions watch the orientation: the oldest stop",
+                     mostObservers_);
   }
   return callback;
 }
