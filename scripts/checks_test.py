@@ -133,7 +133,7 @@ class CheckKept(CheckTest):
 class Limits(CheckTest):
     script = "limits"
 
-    HEADER = "// Says what\n// it is.\n\n\n\n\n// Requests\n\n"
+    HEADER = "// Says what\n// it is.\n\n// Requests\n\n"
     LIMIT = ("/// Of one frame.\n/// [Frame.IsLimited]\n"
              "inline constexpr std::size_t kFrameBytes = 2 * 1024;\n")
 
@@ -147,8 +147,8 @@ class Limits(CheckTest):
                           "kFrameBytes / 2;\n")
         self.assert_fine()
         text = (self.root / "docs/limits.md").read_text(encoding="utf-8")
-        self.assertIn("- **kFrameBytes: 2 KiB.** Of one frame. (`Frame.IsLimited`)", text)
-        self.assertIn("- **kHalf: 1,024.** Of one frame.", text)
+        self.assertIn("\n## Requests\n\n- **kFrameBytes: 2 KiB; kHalf: 1,024.** Of one frame. "
+                      "(`Frame.IsLimited`)\n", text)
         self.assert_fine("--check")
 
     def test_refuses_a_page_that_is_not_up_to_date(self):
@@ -160,6 +160,22 @@ class Limits(CheckTest):
         self.assert_fault("kFrameBytes names no test")
         self.write_limits(self.LIMIT, tests="")
         self.assert_fault("kFrameBytes: there is no test Frame.IsLimited")
+
+    def test_reads_values_with_units_over_several_lines(self):
+        self.write_limits(self.LIMIT.replace("kFrameBytes = 2 * 1024",
+                                             "kListBytes =\n    std::size_t{3} * 1024"))
+        self.assert_fine()
+        self.assertIn("kListBytes: 3 KiB.",
+                      (self.root / "docs/limits.md").read_text(encoding="utf-8"))
+        self.write_limits(self.LIMIT.replace("std::size_t kFrameBytes = 2 * 1024",
+                                             "std::chrono::milliseconds kPause{1000}"))
+        self.assert_fine()
+        self.assertIn("kPause: 1,000 ms.",
+                      (self.root / "docs/limits.md").read_text(encoding="utf-8"))
+
+    def test_refuses_a_limit_that_cannot_be_read(self):
+        self.write_limits(self.LIMIT.replace("std::size_t kFrameBytes", "std::size_t frames"))
+        self.assert_fault("not limits that can be read")
 
     def test_refuses_a_limit_without_a_reason(self):
         self.write_limits("inline constexpr std::size_t kFrameBytes = 2;\n")
