@@ -38,19 +38,20 @@ using Bytes = StoredEntries::Bytes;
 // Outlives the storage as long as a list or a snapshot is left.
 struct FileEntryStorage::State {
   State(std::string directory, const Limits& given, const SpillCalls& calls)
-      : limits(given), file(std::move(directory), given.pauseOfFile, calls) {}
+      : limits(given),
+        bytesOfLists(given.bytesInMemory - given.bytesOfFile),
+        file(std::move(directory), given.pauseOfFile, given.bytesOfFile, calls) {}
 
   bool takeMemory(std::size_t bytes) {
     std::size_t used = bytesInMemory.load(std::memory_order_relaxed);
     do {
-      if (bytes > limits.bytesInMemory || used > limits.bytesInMemory - bytes) {
-        return false;
-      }
+      if (bytes > bytesOfLists || used > bytesOfLists - bytes) return false;
     } while (!bytesInMemory.compare_exchange_weak(used, used + bytes));
     return true;
   }
 
   const Limits limits;
+  const std::size_t bytesOfLists;
   SpillFile file;
   std::atomic<std::size_t> bytesInMemory{0};
   std::atomic<std::uint64_t> refused{0};
@@ -290,7 +291,7 @@ class FileEntryStorage::Entries final : public StoredEntries {
 
 FileEntryStorage::Limits FileEntryStorage::Limits::ofService() {
   return {limits::kListBytesInMemory, limits::kListsBytesInMemory,
-          limits::kPauseOfListsFile};
+          limits::kPauseOfListsFile, limits::kListsBytesBehind};
 }
 
 FileEntryStorage::FileEntryStorage(std::string directory)
@@ -306,7 +307,9 @@ std::unique_ptr<StoredEntries> FileEntryStorage::makeEntries(ReporterID session)
 
 std::uint64_t FileEntryStorage::refusedEntries() const { return state_->refused; }
 
-std::size_t FileEntryStorage::bytesInMemory() const { return state_->bytesInMemory; }
+std::size_t FileEntryStorage::bytesInMemory() const {
+  return state_->bytesInMemory + state_->file.bytesInMemory();
+}
 
 bool FileEntryStorage::hasFile() const { return state_->file.isOpen(); }
 

@@ -22,6 +22,8 @@ class FileEntryStorage final : public EntryStorage {
     std::size_t bytesInMemory;
     /// How long the file is left alone after an error.
     std::chrono::milliseconds pauseOfFile;
+    /// Of `bytesInMemory`: what the file gets together with what follows.
+    std::size_t bytesOfFile = 0;
 
     /// Those of `platform/linux/Limits.h`.
     static Limits ofService();

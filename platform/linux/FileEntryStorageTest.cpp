@@ -5,12 +5,12 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
-#include <atomic>
 #include <cerrno>
 #include <filesystem>
 #include <random>
 
 #include "platform/linux/Limits.h"
+#include "platform/linux/SpillFaults.h"
 #include "platform/linux/TestSupport.h"
 
 namespace ostrel {
@@ -19,42 +19,6 @@ namespace {
 constexpr ReporterID kSession{42};
 constexpr std::chrono::milliseconds kNoPause{0};
 constexpr std::size_t kFirstChunk = 1024;
-
-// What the calls below do; as the system's own unless a test says otherwise.
-struct Faults {
-  std::atomic<int> openError{0};
-  std::atomic<int> writeError{0};
-  std::atomic<int> readError{0};
-  std::atomic<bool> writesAreShort{false};
-  std::atomic<int> writes{0};
-};
-Faults faults;
-
-template <typename Result, typename Call>
-Result failingWith(int error, Call call) {
-  if (error == 0) return call();
-  errno = error;
-  return -1;
-}
-
-SpillCalls faultyCalls() {
-  return {[](const char* path, int flags, mode_t mode) {
-            return failingWith<int>(faults.openError,
-                                    [&] { return ::open(path, flags, mode); });
-          },
-          ::mkostemp,
-          [](int file, const iovec* parts, int count, off_t begin) {
-            ++faults.writes;
-            return failingWith<ssize_t>(faults.writeError, [&] {
-              if (!faults.writesAreShort) return ::pwritev(file, parts, count, begin);
-              return ::pwrite(file, parts->iov_base, (parts->iov_len + 1) / 2, begin);
-            });
-          },
-          [](int file, void* to, std::size_t size, off_t begin) {
-            return failingWith<ssize_t>(faults.readError,
-                                        [&] { return ::pread(file, to, size, begin); });
-          }};
-}
 
 bool append(StoredEntries& entries, std::string_view text) {
   const StoredEntries::Bytes parts[] = {
@@ -90,17 +54,9 @@ std::size_t openDescriptors() {
 
 class FileEntryStorageTest : public testing::Test {
  protected:
-  FileEntryStorageTest() {
-    faults.openError = 0;
-    faults.writeError = 0;
-    faults.readError = 0;
-    faults.writesAreShort = false;
-    faults.writes = 0;
-  }
-
   FileEntryStorage storageOf(std::size_t bytesOfList, std::size_t bytesOfAll) {
     return FileEntryStorage(directory_.path(), {bytesOfList, bytesOfAll, kNoPause},
-                            faultyCalls());
+                            faults_.calls());
   }
 
   void expectOneError(const std::string& end) {
@@ -109,6 +65,7 @@ class FileEntryStorageTest : public testing::Test {
     EXPECT_TRUE(lines[0].ends_with(end)) << lines[0];
   }
 
+  testing_support::SpillFaults faults_;
   testing_support::CapturedLog log_;
   testing_support::TemporaryDirectory directory_;
 };
@@ -198,7 +155,7 @@ TEST_F(FileEntryStorageTest, HasOneFileThatOnlyTheServiceCanRead) {
 
 TEST_F(FileEntryStorageTest, LeavesNoFileBehindWhereEachHasAName) {
   for (const int error : {EOPNOTSUPP, EISDIR}) {
-    faults.openError = error;
+    faults_.openError = error;
     FileEntryStorage storage = storageOf(/*bytesOfList=*/1, /*bytesOfAll=*/1);
     const auto entries = storage.makeEntries(kSession);
     for (int i = 0; i < 20; ++i) EXPECT_TRUE(append(*entries, std::string(500, 'x')));
@@ -229,7 +186,7 @@ TEST_F(FileEntryStorageTest, GivesTheRoomOnTheDiskBackWithEachList) {
 }
 
 TEST_F(FileEntryStorageTest, GoesOnAfterAWriteThatTookAPart) {
-  faults.writesAreShort = true;
+  faults_.writesAreShort = true;
   FileEntryStorage storage = storageOf(/*bytesOfList=*/4096, /*bytesOfAll=*/4096);
   const auto entries = storage.makeEntries(kSession);
   std::string expected;
@@ -248,19 +205,19 @@ TEST_F(FileEntryStorageTest, KeepsEntriesInMemoryWhileTheDiskIsFull) {
   for (int i = 0; i < 100; ++i) append(*entries, entry);
   ASSERT_TRUE(storage.hasFile());
 
-  faults.writeError = ENOSPC;
+  faults_.writeError = ENOSPC;
   for (int i = 0; i < 5000; ++i) ASSERT_TRUE(append(*entries, entry));
   EXPECT_EQ(bytesOf(*entries->snapshot()), std::string(510'000, 'x'));
   EXPECT_EQ(storage.refusedEntries(), 0u);
 
-  faults.writeError = 0;
+  faults_.writeError = 0;
   for (int i = 0; i < 5000; ++i) ASSERT_TRUE(append(*entries, entry));
   EXPECT_EQ(bytesOf(*entries->snapshot()), std::string(1'010'000, 'x'));
   EXPECT_LE(storage.bytesInMemory(), 128u * 1024);
 }
 
 TEST_F(FileEntryStorageTest, RefusesWhatFitsNeitherDiskNorMemory) {
-  faults.writeError = ENOSPC;
+  faults_.writeError = ENOSPC;
   FileEntryStorage storage = storageOf(/*bytesOfList=*/4096, /*bytesOfAll=*/10'000);
   const auto entries = storage.makeEntries(kSession);
   std::string expected;
@@ -279,7 +236,7 @@ TEST_F(FileEntryStorageTest, RefusesWhatFitsNeitherDiskNorMemory) {
   expectOneError("42: the session's list goes without some messages: " +
                  directory_.path() + ": No space left on device");
 
-  faults.writeError = 0;
+  faults_.writeError = 0;
   ASSERT_TRUE(append(*entries, "later"));
   EXPECT_EQ(bytesOf(*entries->snapshot()), expected + "later");
 }
@@ -296,31 +253,37 @@ TEST_F(FileEntryStorageTest, IsOfUseWithoutItsDirectory) {
 }
 
 TEST_F(FileEntryStorageTest, LeavesAFullDiskAloneForAWhile) {
-  faults.writeError = ENOSPC;
+  faults_.writeError = ENOSPC;
   FileEntryStorage storage(directory_.path(), {1, 1, std::chrono::hours(1)},
-                           faultyCalls());
+                           faults_.calls());
   const auto entries = storage.makeEntries(kSession);
   for (int i = 0; i < 100; ++i) append(*entries, std::string(100, 'x'));
-  EXPECT_EQ(faults.writes, 1);
+  EXPECT_EQ(faults_.writes, 1);
 }
 
 TEST_F(FileEntryStorageTest, SaysWhenItCannotReadBack) {
   FileEntryStorage storage = storageOf(/*bytesOfList=*/1, /*bytesOfAll=*/1);
   const auto entries = storage.makeEntries(kSession);
   for (int i = 0; i < 100; ++i) append(*entries, std::string(100, 'x'));
-  faults.readError = EIO;
+  faults_.readError = EIO;
   EXPECT_FALSE(entries->snapshot()->forEachRun([](StoredEntries::Bytes) {}));
   expectOneError("42: cannot read the session's list back: " + directory_.path() +
                  ": Input/output error");
 }
 
-// Lists that grow in turn, some of which end, with snapshots of any age, while the disk
-// is full now and then.
-TEST_F(FileEntryStorageTest, IsWhatWasAppendedWhateverTheSharesAndTheDisk) {
+/// Lists that grow in turn, some of which end, with snapshots of any age, while the disk
+/// is full now and then. `bytesOfFile` as in the limits.
+class FileEntryStorageLists : public FileEntryStorageTest,
+                              public testing::WithParamInterface<std::size_t> {};
+
+TEST_P(FileEntryStorageLists, AreWhatWasAppendedWhateverTheSharesAndTheDisk) {
   std::mt19937 random(5);
   for (int run = 0; run < 12; ++run) {
     const std::size_t share = random() % 20'000;
-    FileEntryStorage storage = storageOf(share, random() % 40'000);
+    const std::size_t shareOfAll = random() % 40'000;
+    FileEntryStorage storage(directory_.path(),
+                             {share, shareOfAll + GetParam(), kNoPause, GetParam()},
+                             faults_.calls());
     struct List {
       std::unique_ptr<StoredEntries> entries;
       std::string expected;
@@ -330,7 +293,7 @@ TEST_F(FileEntryStorageTest, IsWhatWasAppendedWhateverTheSharesAndTheDisk) {
         snapshots;
     std::uint64_t refused = 0;
     for (int step = 0; step < 500; ++step) {
-      if (random() % 20 == 0) faults.writeError = random() % 10 == 0 ? ENOSPC : 0;
+      if (random() % 20 == 0) faults_.writeError = random() % 10 == 0 ? ENOSPC : 0;
       if (lists.size() < 5) lists.push_back({storage.makeEntries(kSession), ""});
       const std::size_t chosen = random() % lists.size();
       List& list = lists[chosen];
@@ -360,6 +323,35 @@ TEST_F(FileEntryStorageTest, IsWhatWasAppendedWhateverTheSharesAndTheDisk) {
     snapshots.clear();
     EXPECT_EQ(storage.bytesInMemory(), 0u);
     EXPECT_FALSE(storage.hasFile());
+  }
+}
+
+INSTANTIATE_TEST_SUITE_P(WrittenOneByOneOrTogether, FileEntryStorageLists,
+                         testing::Values(0, SpillFile::kMostBytesInMemory));
+
+// A hundred thousand sessions with a few messages each are like this.
+TEST_F(FileEntryStorageTest, WritesTheEntriesOfManyShortListsTogether) {
+  constexpr std::size_t kLists = 1000;
+  FileEntryStorage storage(directory_.path(),
+                           {limits::kListBytesInMemory, limits::kListsBytesBehind,
+                            kNoPause, limits::kListsBytesBehind},
+                           faults_.calls());
+  std::vector<std::unique_ptr<StoredEntries>> lists;
+  for (std::size_t i = 0; i < kLists; ++i) lists.push_back(storage.makeEntries(kSession));
+  std::vector<std::string> expected(kLists);
+  for (int turn = 0; turn < 20; ++turn) {
+    for (std::size_t i = 0; i < kLists; ++i) {
+      const std::string entry = std::to_string(i * 100) + std::string(200, ',');
+      ASSERT_TRUE(append(*lists[i], entry));
+      expected[i] += entry;
+    }
+  }
+  // Four entries fill the first KiB of a list, which is written four times.
+  EXPECT_GT(faults_.writes, 0);
+  EXPECT_LE(faults_.writes, static_cast<int>(4 * kLists / 60));
+  EXPECT_LE(storage.bytesInMemory(), limits::kListsBytesBehind + kLists * kFirstChunk);
+  for (std::size_t i = 0; i < kLists; ++i) {
+    ASSERT_TRUE(bytesOf(*lists[i]->snapshot()) == expected[i]) << i;
   }
 }
 

@@ -144,6 +144,11 @@ inline constexpr std::size_t kListBytesInMemory = 256 * 1024;
 /// [FileEntryStorageTest.RefusesWhatFitsNeitherDiskNorMemory]
 inline constexpr std::size_t kListsBytesInMemory = 24 * 1024 * 1024;
 
+/// Of that, what waits for more of other sessions so that it is written to the file
+/// together.
+/// [SpillFileTest.GathersPiecesWhereThereIsMemoryForIt]
+inline constexpr std::size_t kListsBytesBehind = 128 * 1024;
+
 /// How long that file is left alone once it could not be written: a disk that is full
 /// is not asked with each message.
 /// [FileEntryStorageTest.LeavesAFullDiskAloneForAWhile]

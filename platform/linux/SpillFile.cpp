@@ -2,6 +2,10 @@
 // when they go; with the last the file goes too, and the next begins at 0. So there
 // is nothing to look for when one is added, and the file's length says nothing of
 // the room that it takes.
+//
+// A group has its place in the file from the start, so that its pieces have theirs too
+// before they are written. Places of groups are numbered: an extent's place says whether
+// it is a piece of one. Pieces share pages, which go when the last of them goes.
 #include "platform/linux/SpillFile.h"
 
 #include <fcntl.h>
@@ -10,8 +14,10 @@
 #include <unistd.h>
 
 #include <algorithm>
+#include <array>
 #include <cerrno>
 #include <utility>
+#include <vector>
 
 #include "platform/linux/SmallFile.h"
 
@@ -23,11 +29,34 @@ constexpr mode_t kFileMode = 0600;
 
 std::uint64_t roomOf(std::size_t size) { return (size + kPage - 1) / kPage * kPage; }
 
-void punchHole(int file, std::uint64_t begin, std::uint64_t size) {
-  // Where there are no holes, the room comes back with the file.
-  ::fallocate(file, FALLOC_FL_PUNCH_HOLE | FALLOC_FL_KEEP_SIZE, static_cast<off_t>(begin),
-              static_cast<off_t>(size));
-}
+// The places in the file that nothing is in any more. Neighbours make one hole.
+class Holes {
+ public:
+  explicit Holes(int file) : file_(file) {}
+  Holes(const Holes&) = delete;
+  Holes& operator=(const Holes&) = delete;
+  ~Holes() { punch(); }
+
+  void add(std::uint64_t begin, std::uint64_t size) {
+    if (begin != end_) {
+      punch();
+      begin_ = begin;
+    }
+    end_ = begin + size;
+  }
+
+ private:
+  void punch() const {
+    if (begin_ == end_) return;
+    // Where there are no holes, the room comes back with the file.
+    ::fallocate(file_, FALLOC_FL_PUNCH_HOLE | FALLOC_FL_KEEP_SIZE,
+                static_cast<off_t>(begin_), static_cast<off_t>(end_ - begin_));
+  }
+
+  const int file_;
+  std::uint64_t begin_ = 0;
+  std::uint64_t end_ = 0;
+};
 
 // 0, or the error.
 int writeAll(int file, std::span<iovec> parts, std::uint64_t begin,
@@ -61,43 +90,133 @@ SpillCalls SpillCalls::system() {
       ::mkostemp, ::pwritev, ::pread};
 }
 
+/// Pieces that are written together.
+struct SpillFile::Group {
+  explicit Group(std::uint64_t at) : begin(at), bytes(new std::uint8_t[kGroupBytes]) {}
+
+  bool hasRoom(std::size_t size) const { return kGroupBytes - used >= size; }
+
+  Extent add(std::span<const Bytes> parts, std::size_t size) {
+    std::uint8_t* at = bytes.get() + used;
+    for (const Bytes part : parts) at = std::copy(part.begin(), part.end(), at);
+    const Extent extent{begin + used, size};
+    used += size;
+    ++extents;
+    for (std::size_t page = pageOf(extent.begin); page <= lastPageOf(extent); ++page) {
+      ++extentsOfPage[page];
+    }
+    return extent;
+  }
+
+  /// Pages that are free by it are added to `holes` if the group is in the file.
+  void release(Extent extent, Holes& holes) {
+    --extents;
+    for (std::size_t page = pageOf(extent.begin); page <= lastPageOf(extent); ++page) {
+      if (--extentsOfPage[page] == 0 && !bytes) holes.add(begin + page * kPage, kPage);
+    }
+    if (extents == 0 && !isBeingWritten) used = 0;  // It may be filled anew.
+  }
+
+  /// It is in the file. What was released meanwhile leaves holes.
+  void becameWritten(Holes& holes) {
+    bytes.reset();
+    for (std::size_t page = 0; page * kPage < used; ++page) {
+      if (extentsOfPage[page] == 0) holes.add(begin + page * kPage, kPage);
+    }
+  }
+
+  const std::uint64_t begin;
+  std::unique_ptr<std::uint8_t[]> bytes;  // None once they are in the file.
+  std::size_t used = 0;
+  std::size_t extents = 0;
+  bool isBeingWritten = false;
+
+ private:
+  std::size_t pageOf(std::uint64_t at) const {
+    return static_cast<std::size_t>((at - begin) / kPage);
+  }
+  std::size_t lastPageOf(Extent extent) const {
+    return pageOf(extent.begin + extent.size - 1);
+  }
+
+  std::array<std::uint16_t, kGroupBytes / kPage> extentsOfPage{};
+};
+
 SpillFile::SpillFile(std::string directory, std::chrono::milliseconds pause,
-                     const SpillCalls& calls)
-    : directory_(std::move(directory)), pause_(pause), calls_(calls) {}
+                     std::size_t bytesInMemory, const SpillCalls& calls)
+    : directory_(std::move(directory)),
+      pause_(pause),
+      isGathering_(bytesInMemory >= kMostBytesInMemory),
+      calls_(calls) {}
+
+SpillFile::~SpillFile() = default;
 
 std::optional<SpillFile::Extent> SpillFile::write(std::span<const Bytes> parts) {
-  std::vector<iovec> pieces;
   std::size_t size = 0;
-  for (const Bytes part : parts) {
-    if (part.empty()) continue;
-    pieces.push_back({const_cast<std::uint8_t*>(part.data()), part.size()});
-    size += part.size();
+  for (const Bytes part : parts) size += part.size();
+  if (isGathering_ && size != 0 && size <= kLargestOfGroup) return gather(parts, size);
+  return writeAlone(parts, size);
+}
+
+std::optional<SpillFile::Extent> SpillFile::gather(std::span<const Bytes> parts,
+                                                   std::size_t size) {
+  std::unique_lock lock(mutex_);
+  for (;;) {
+    if (!isReady()) return std::nullopt;
+    const bool hasRoom = !filling_ || filling_->hasRoom(size);
+    const bool isWriting = full_ && full_->isBeingWritten;
+    if (isWriting && !hasRoom) break;
+    if (!isWriting) {
+      if (!hasRoom && !full_) full_ = std::move(filling_);
+      if (full_) {
+        if (!writeFullGroup(lock)) return std::nullopt;
+        continue;
+      }
+    }
+    if (!filling_) filling_ = beginGroup();
+    ++extents_;
+    return filling_->add(parts, size);
   }
-  const auto extent = begin(size);
-  if (!extent) return std::nullopt;
-  if (const int error = writeAll(file_.get(), pieces, extent->begin, calls_)) {
-    fail(error);
-    release({&*extent, 1});
+  // Nobody waits for the disk because of what others write.
+  lock.unlock();
+  return writeAlone(parts, size);
+}
+
+std::optional<SpillFile::Extent> SpillFile::writeAlone(std::span<const Bytes> parts,
+                                                       std::size_t size) {
+  std::vector<iovec> pieces;
+  for (const Bytes part : parts) {
+    if (!part.empty()) {
+      pieces.push_back({const_cast<std::uint8_t*>(part.data()), part.size()});
+    }
+  }
+  Extent extent{0, size};
+  {
+    const std::lock_guard lock(mutex_);
+    if (!isReady()) return std::nullopt;
+    extent.begin = end_;
+    end_ += roomOf(size);
+    ++extents_;
+  }
+  if (const int error = writeAll(file_.get(), pieces, extent.begin, calls_)) {
+    {
+      const std::lock_guard lock(mutex_);
+      fail(error);
+    }
+    release({&extent, 1});
     return std::nullopt;
   }
   return extent;
 }
 
-std::optional<SpillFile::Extent> SpillFile::begin(std::size_t size) {
-  const std::lock_guard lock(mutex_);
-  if (error_ != 0 && std::chrono::steady_clock::now() < retryAt_) return std::nullopt;
+// Whether the file is open and may be written.
+bool SpillFile::isReady() {
+  if (error_ != 0 && std::chrono::steady_clock::now() < retryAt_) return false;
   if (!file_) {
     file_.reset(openFile());
-    if (!file_) {
-      error_ = errno;
-      retryAt_ = std::chrono::steady_clock::now() + pause_;
-      return std::nullopt;
-    }
+    if (!file_) fail(errno);
   }
-  const Extent extent{end_, size};
-  end_ += roomOf(size);
-  ++extents_;
-  return extent;
+  return static_cast<bool>(file_);
 }
 
 // -1, with errno set, when there can be none.
@@ -114,8 +233,61 @@ int SpillFile::openFile() {
   return named;
 }
 
+std::shared_ptr<SpillFile::Group> SpillFile::beginGroup() {
+  const std::uint64_t place = (end_ + kGroupBytes - 1) / kGroupBytes;
+  end_ = (place + 1) * kGroupBytes;
+  auto group = std::make_shared<Group>(place * kGroupBytes);
+  groups_.emplace(place, group);
+  return group;
+}
+
+// Lets the lock go meanwhile. False: it cannot be written, and stays.
+bool SpillFile::writeFullGroup(std::unique_lock<std::mutex>& lock) {
+  const std::shared_ptr<Group> group = full_;
+  group->isBeingWritten = true;
+  ++extents_;  // The file stays.
+  const int file = file_.get();
+  lock.unlock();
+  iovec bytes{group->bytes.get(), group->used};
+  const int error = writeAll(file, {&bytes, 1}, group->begin, calls_);
+  lock.lock();
+  group->isBeingWritten = false;
+  if (error != 0) {
+    fail(error);
+  } else {
+    full_.reset();
+    Holes holes(file);
+    group->becameWritten(holes);
+  }
+  dropIfUnused(group);
+  const FileDescriptor last = dropExtents(1);
+  return error == 0;
+}
+
+std::shared_ptr<SpillFile::Group> SpillFile::groupOf(Extent extent) const {
+  const auto found = groups_.find(extent.begin / kGroupBytes);
+  return found != groups_.end() ? found->second : nullptr;
+}
+
+// The one that is filled goes on with other pieces.
+void SpillFile::dropIfUnused(const std::shared_ptr<Group>& group) {
+  if (group->extents != 0 || group->isBeingWritten || group == filling_) return;
+  if (group == full_) full_.reset();
+  groups_.erase(group->begin / kGroupBytes);
+}
+
+// The file, to be closed, if nothing is in it any more.
+FileDescriptor SpillFile::dropExtents(std::size_t count) {
+  extents_ -= count;
+  if (extents_ != 0) return {};
+  groups_.clear();
+  filling_.reset();
+  full_.reset();
+  end_ = 0;
+  return std::move(file_);
+}
+
 void SpillFile::fail(int error) {
-  const std::lock_guard lock(mutex_);
   error_ = error;
   retryAt_ = std::chrono::steady_clock::now() + pause_;
 }
@@ -124,6 +296,10 @@ std::optional<ErrorObject> SpillFile::read(Extent extent, std::uint8_t* to) {
   int file;
   {
     const std::lock_guard lock(mutex_);
+    if (const auto group = groupOf(extent); group && group->bytes) {
+      std::copy_n(group->bytes.get() + (extent.begin - group->begin), extent.size, to);
+      return std::nullopt;
+    }
     file = file_.get();
   }
   std::size_t done = 0;
@@ -141,22 +317,20 @@ void SpillFile::release(std::span<const Extent> extents) {
   if (extents.empty()) return;
   FileDescriptor last;  // Closed without the lock: a large file takes its time.
   const std::lock_guard lock(mutex_);
-  extents_ -= extents.size();
-  if (extents_ == 0) {
-    last = std::move(file_);
-    end_ = 0;
+  if (extents.size() == extents_) {
+    last = dropExtents(extents.size());
     return;
   }
-  std::uint64_t begin = extents.front().begin;
-  std::uint64_t end = begin;
+  Holes holes(file_.get());
   for (const Extent extent : extents) {
-    if (extent.begin != end) {
-      punchHole(file_.get(), begin, end - begin);
-      begin = extent.begin;
+    if (const auto group = groupOf(extent)) {
+      group->release(extent, holes);
+      dropIfUnused(group);
+    } else {
+      holes.add(extent.begin, roomOf(extent.size));
     }
-    end = extent.begin + roomOf(extent.size);
   }
-  punchHole(file_.get(), begin, end - begin);
+  dropExtents(extents.size());
 }
 
 std::optional<ErrorObject> SpillFile::latestError() const {
@@ -168,6 +342,11 @@ std::optional<ErrorObject> SpillFile::latestError() const {
 bool SpillFile::isOpen() const {
   const std::lock_guard lock(mutex_);
   return static_cast<bool>(file_);
+}
+
+std::size_t SpillFile::bytesInMemory() const {
+  const std::lock_guard lock(mutex_);
+  return (filling_ ? kGroupBytes : 0) + (full_ ? kGroupBytes : 0);
 }
 
 }  // namespace ostrel
