@@ -15,10 +15,11 @@ namespace {
 /// What the service would make of it; none when it would refuse it.
 std::optional<Dictionary> decoded(const Message& message) {
   const auto* bytes = reinterpret_cast<const std::uint8_t*>(message.encoded().data());
-  return wire::decodeDictionary({bytes, message.encoded().size()},
-                                {limits::kNesting, limits::kNodes, limits::kKeyBytes},
-                                /*account=*/nullptr)
-      .dictionary;
+  const std::size_t size = message.encoded().size();
+  const auto decoded = wire::decodeDictionary(
+      {bytes, size}, {limits::kNesting, limits::kNodes, limits::kKeyBytes},
+      /*owner=*/{});
+  return decoded.size == size ? decoded.dictionary : std::nullopt;
 }
 
 TEST(Message, HoldsEveryKindOfValueExactly) {

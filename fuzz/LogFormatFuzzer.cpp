@@ -46,7 +46,7 @@ void fill(std::string_view text) {
 
 void fillWithValues(std::span<const std::uint8_t> bytes) {
   const auto decoded = wire::decodeDictionary(
-      bytes, {limits::kNesting, limits::kNodes, limits::kKeyBytes}, /*account=*/nullptr);
+      bytes, {limits::kNesting, limits::kNodes, limits::kKeyBytes}, /*owner=*/{});
   if (!decoded.dictionary) return;
   const std::string line = format("%@", *decoded.dictionary);
   expectPlain(line);

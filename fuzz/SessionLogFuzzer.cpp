@@ -28,9 +28,9 @@ void expect(bool condition) {
 std::vector<Dictionary> decodeAll(std::span<const std::uint8_t> bytes) {
   std::vector<Dictionary> payloads;
   while (!bytes.empty() && payloads.size() < 64) {
-    auto decoded = wire::decodeLeadingDictionary(
+    auto decoded = wire::decodeDictionary(
         bytes, {limits::kNesting, limits::kNodes, limits::kKeyBytes},
-        /*account=*/nullptr);
+        /*owner=*/{});
     if (!decoded.dictionary) break;
     bytes = bytes.subspan(decoded.size);
     payloads.push_back(*std::move(decoded.dictionary));

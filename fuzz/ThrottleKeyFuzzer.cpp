@@ -44,7 +44,7 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
   static_cast<void>(isQuiet);
   const auto decoded = wire::decodeDictionary(
       {data, size}, {limits::kNesting, limits::kNodes, limits::kKeyBytes},
-      /*account=*/nullptr);
+      /*owner=*/{});
   if (!decoded.dictionary) return 0;
   const Dictionary& payload = *decoded.dictionary;
 

@@ -49,7 +49,7 @@ void readText(std::string_view text) {
 extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size) {
   const auto decoded = wire::decodeDictionary(
       {data, size}, {limits::kNesting, limits::kNodes, limits::kKeyBytes},
-      /*account=*/nullptr);
+      /*owner=*/{});
   if (decoded.dictionary) writePayload(decoded.dictionary->value());
   readText({reinterpret_cast<const char*>(data), size});
   return 0;

@@ -108,13 +108,10 @@ DecodeError takeReporterIDs(ItemReader& reader, std::size_t mostIDs, ReporterIDs
   return std::nullopt;
 }
 
-// Copied unless the frame lies in `owner`.
 DecodeError takeDictionary(ItemReader& reader, const PayloadLimits& limits,
                            const ValueBuffer& owner,
                            std::optional<Dictionary>& dictionary) {
-  DecodedDictionary decoded =
-      owner ? decodeLeadingDictionary(owner, reader.rest(), limits)
-            : decodeLeadingDictionary(reader.rest(), limits, /*account=*/nullptr);
+  DecodedDictionary decoded = decodeDictionary(reader.rest(), limits, owner);
   if (decoded.error) return decoded.error;
   reader.skip(decoded.size);
   dictionary = std::move(decoded.dictionary);

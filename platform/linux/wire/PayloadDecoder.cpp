@@ -37,7 +37,6 @@ constexpr std::string_view kWrongTag = "a tag other than 1 is not allowed";
 constexpr std::string_view kWrongDate = "a date is not a finite number";
 constexpr std::string_view kWrongSimple = "a simple value is neither true nor false";
 constexpr std::string_view kNotADictionary = "the payload is not a dictionary";
-constexpr std::string_view kTrailingBytes = "bytes follow the payload";
 
 std::uint64_t loadWord(const Byte* at) {
   std::uint64_t word;
@@ -503,28 +502,6 @@ class RepeatedKeyRemover {
   std::vector<Entry> entries_;
 };
 
-DecodeError checkDictionary(std::span<const std::uint8_t> bytes,
-                            const PayloadLimits& limits, std::size_t& size,
-                            bool& hasRepeatedKeys) {
-  if (bytes.empty()) return kTruncated;
-  if (bytes[0] >> 5 != kMapItem) return kNotADictionary;
-  return checkItem(bytes, limits, size, hasRepeatedKeys);
-}
-
-Dictionary copyOf(std::span<const std::uint8_t> item,
-                  std::shared_ptr<PayloadAccount> account) {
-  ValueBuffer buffer = ValueBuffer::copyOf(item, std::move(account));
-  const Byte* copied = buffer.data();
-  return Dictionary(std::move(buffer), copied);
-}
-
-Dictionary withoutRepeatedKeys(std::span<const std::uint8_t> item,
-                               std::shared_ptr<PayloadAccount> account) {
-  const std::string rewritten = RepeatedKeyRemover(item).run();
-  const auto* first = reinterpret_cast<const Byte*>(rewritten.data());
-  return copyOf({first, rewritten.size()}, std::move(account));
-}
-
 }  // namespace
 
 bool isUTF8(std::span<const std::uint8_t> text) {
@@ -565,43 +542,27 @@ DecodeError checkItem(std::span<const std::uint8_t> bytes, const PayloadLimits& 
   return check.run(size, hasRepeatedKeys);
 }
 
-DecodedDictionary decodeLeadingDictionary(const ValueBuffer& owner,
-                                          std::span<const std::uint8_t> bytes,
-                                          const PayloadLimits& limits) {
-  std::size_t size = 0;
-  bool hasRepeatedKeys = false;
-  if (auto error = checkDictionary(bytes, limits, size, hasRepeatedKeys)) {
-    return {std::nullopt, error};
-  }
-  if (hasRepeatedKeys) {
-    return {withoutRepeatedKeys(bytes.first(size), owner.account()), std::nullopt, size};
-  }
-  return {Dictionary(owner, bytes.data()), std::nullopt, size};
-}
-
-DecodedDictionary decodeLeadingDictionary(std::span<const std::uint8_t> bytes,
-                                          const PayloadLimits& limits,
-                                          std::shared_ptr<PayloadAccount> account) {
-  std::size_t size = 0;
-  bool hasRepeatedKeys = false;
-  if (auto error = checkDictionary(bytes, limits, size, hasRepeatedKeys)) {
-    return {std::nullopt, error};
-  }
-  if (hasRepeatedKeys) {
-    return {withoutRepeatedKeys(bytes.first(size), std::move(account)), std::nullopt,
-            size};
-  }
-  return {copyOf(bytes.first(size), std::move(account)), std::nullopt, size};
-}
-
 DecodedDictionary decodeDictionary(std::span<const std::uint8_t> bytes,
                                    const PayloadLimits& limits,
-                                   std::shared_ptr<PayloadAccount> account) {
-  DecodedDictionary decoded = decodeLeadingDictionary(bytes, limits, std::move(account));
-  if (!decoded.error && decoded.size != bytes.size()) {
-    return {std::nullopt, kTrailingBytes};
+                                   const ValueBuffer& owner) {
+  if (bytes.empty()) return {std::nullopt, kTruncated};
+  if (bytes[0] >> 5 != kMapItem) return {std::nullopt, kNotADictionary};
+  std::size_t size = 0;
+  bool hasRepeatedKeys = false;
+  if (auto error = checkItem(bytes, limits, size, hasRepeatedKeys)) {
+    return {std::nullopt, error};
   }
-  return decoded;
+  auto item = bytes.first(size);
+  if (owner && !hasRepeatedKeys) {
+    return {Dictionary(owner, item.data()), std::nullopt, size};
+  }
+  std::string rewritten;
+  if (hasRepeatedKeys) {
+    rewritten = RepeatedKeyRemover(item).run();
+    item = {reinterpret_cast<const Byte*>(rewritten.data()), rewritten.size()};
+  }
+  const ValueBuffer copy = ValueBuffer::copyOf(item, owner.account());
+  return {Dictionary(copy, copy.data()), std::nullopt, size};
 }
 
 }  // namespace ostrel::wire

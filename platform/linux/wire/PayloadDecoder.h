@@ -2,7 +2,6 @@
 
 #include <cstddef>
 #include <cstdint>
-#include <memory>
 #include <optional>
 #include <span>
 #include <string_view>
@@ -43,22 +42,11 @@ struct DecodedDictionary {
   std::size_t size = 0;  // Of the encoding that was decoded.
 };
 
-/// A payload at the start of `bytes`, which lie in `owner`: checked, and left where
-/// it is. Of entries with one key the last one is kept; such a payload is copied, and
-/// charged to the owner's account. Bytes behind the payload are left alone.
-DecodedDictionary decodeLeadingDictionary(const ValueBuffer& owner,
-                                          std::span<const std::uint8_t> bytes,
-                                          const PayloadLimits& limits);
-
-/// As above, copied once from `bytes`, which lie anywhere. The memory is charged to
-/// `account`, which may be none.
-DecodedDictionary decodeLeadingDictionary(std::span<const std::uint8_t> bytes,
-                                          const PayloadLimits& limits,
-                                          std::shared_ptr<PayloadAccount> account);
-
-/// As `decodeLeadingDictionary`, of the whole of `bytes`.
+/// A payload at the start of `bytes`: checked, and of entries with one key the last one
+/// kept. When `bytes` lie in `owner` it is left there. With `owner` none, and when an
+/// entry went, it is copied; the copy is charged to the account of `owner`. Bytes behind
+/// the payload are left alone.
 DecodedDictionary decodeDictionary(std::span<const std::uint8_t> bytes,
-                                   const PayloadLimits& limits,
-                                   std::shared_ptr<PayloadAccount> account);
+                                   const PayloadLimits& limits, const ValueBuffer& owner);
 
 }  // namespace ostrel::wire

@@ -11,8 +11,9 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
   using namespace ostrel;
   constexpr wire::PayloadLimits kLimits{limits::kNesting, limits::kNodes,
                                         limits::kKeyBytes};
-  const auto decoded = wire::decodeDictionary({data, size}, kLimits, /*account=*/nullptr);
+  const auto decoded = wire::decodeDictionary({data, size}, kLimits, /*owner=*/{});
   if (decoded.dictionary.has_value() == decoded.error.has_value()) std::abort();
+  if (decoded.size > size) std::abort();
   if (!decoded.dictionary) return 0;
 
   const ValueView value = decoded.dictionary->value();

@@ -42,7 +42,7 @@ class CountingAccount : public PayloadAccount {
 
 std::optional<Dictionary> decode(std::string_view bytes) {
   const ExactBytes exact(bytes);
-  return decodeDictionary(exact.span(), kTestLimits, /*account=*/nullptr).dictionary;
+  return decodeWhole(exact.span(), kTestLimits).dictionary;
 }
 
 struct Rejected {
@@ -381,35 +381,30 @@ TEST(PayloadDecoder, RejectsWhatIsNoDictionary) {
   EXPECT_FALSE(decode(""));
 }
 
-TEST(PayloadDecoder, RejectsBytesBehindTheDictionary) {
-  EXPECT_FALSE(decode(bytesOf({0xA0, 0x00})));
-}
-
-TEST(PayloadDecoder, LeavesBytesBehindALeadingDictionary) {
+TEST(PayloadDecoder, LeavesBytesBehindTheDictionary) {
   const std::string bytes = bytesOf({0xA1, 0x01, 0x02, 0xFF});
   const DecodedDictionary decoded =
-      decodeLeadingDictionary(spanOf(bytes), kTestLimits, /*account=*/nullptr);
+      decodeDictionary(spanOf(bytes), kTestLimits, /*owner=*/{});
   ASSERT_TRUE(decoded.dictionary);
   EXPECT_EQ(decoded.size, 3U);
 }
 
-TEST(PayloadDecoder, ChargesTheAccountAsLongAsTheDictionaryLives) {
-  const auto account = std::make_shared<CountingAccount>();
+TEST(PayloadDecoder, CopiesADictionaryWithoutAnOwner) {
+  std::optional<Dictionary> kept;
   {
-    const std::string bytes = bytesOf({0xA1, 0x01, 0x02});
-    const auto decoded = decodeDictionary(spanOf(bytes), kTestLimits, account);
-    ASSERT_TRUE(decoded.dictionary);
-    EXPECT_GE(account->bytes(), bytes.size());
+    const ExactBytes bytes(bytesOf({0xA1, 0x01, 0x02}));
+    kept = decodeDictionary(bytes.span(), kTestLimits, /*owner=*/{}).dictionary;
   }
-  EXPECT_EQ(account->bytes(), 0U);
+  EXPECT_EQ(description(kept->value()), "{1: 2}");
 }
 
 TEST(PayloadDecoder, ChargesNothingForWhatItRejects) {
   const auto account = std::make_shared<CountingAccount>();
-  const auto decoded =
-      decodeDictionary(spanOf(bytesOf({0xA1, 0x01, 0xF6})), kTestLimits, account);
+  const std::string bytes = bytesOf({0xA2, 0x01, 0x02, 0x01, 0xF6});
+  const ValueBuffer owner = ValueBuffer::copyOfInput(spanOf(bytes), account);
+  const auto decoded = decodeDictionary({owner.data(), owner.size()}, kTestLimits, owner);
   EXPECT_FALSE(decoded.dictionary);
-  EXPECT_EQ(account.use_count(), 1);
+  EXPECT_EQ(account.use_count(), 2) << "the test's and the owner's";
   EXPECT_EQ(account->bytes(), 0U);
 }
 
@@ -417,7 +412,7 @@ TEST(PayloadDecoder, LeavesADictionaryWhereItLies) {
   const std::string bytes = bytesOf({0x17, 0xA1, 0x01, 0x02});
   const ValueBuffer owner = ValueBuffer::copyOf(spanOf(bytes));
   const auto decoded =
-      decodeLeadingDictionary(owner, {owner.data() + 1, owner.size() - 1}, kTestLimits);
+      decodeDictionary({owner.data() + 1, owner.size() - 1}, kTestLimits, owner);
   ASSERT_TRUE(decoded.dictionary);
   EXPECT_EQ(decoded.dictionary->value().data(), owner.data() + 1);
 }
@@ -427,8 +422,7 @@ TEST(PayloadDecoder, KeepsTheMemoryOfADictionaryThatItLeft) {
   {
     const std::string bytes = bytesOf({0xA1, 0x01, 0x02});
     const ValueBuffer owner = ValueBuffer::copyOf(spanOf(bytes));
-    kept = decodeLeadingDictionary(owner, {owner.data(), owner.size()}, kTestLimits)
-               .dictionary;
+    kept = decodeDictionary({owner.data(), owner.size()}, kTestLimits, owner).dictionary;
   }
   EXPECT_EQ(description(kept->value()), "{1: 2}");
 }
@@ -439,7 +433,7 @@ TEST(PayloadDecoder, CopiesADictionaryWithRepeatedKeysAndChargesTheOwnersAccount
     const std::string bytes = bytesOf({0xA2, 0x01, 0x02, 0x01, 0x03});
     const ValueBuffer owner = ValueBuffer::copyOfInput(spanOf(bytes), account);
     const auto decoded =
-        decodeLeadingDictionary(owner, {owner.data(), owner.size()}, kTestLimits);
+        decodeDictionary({owner.data(), owner.size()}, kTestLimits, owner);
     ASSERT_TRUE(decoded.dictionary);
     EXPECT_EQ(description(decoded.dictionary->value()), "{1: 3}");
     EXPECT_EQ(decoded.size, bytes.size());

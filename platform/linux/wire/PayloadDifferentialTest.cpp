@@ -289,7 +289,7 @@ struct Ours {
 
 Ours ours(const std::string& item) {
   const ExactBytes exact(item);
-  const auto decoded = decodeDictionary(exact.span(), kLimits, /*account=*/nullptr);
+  const auto decoded = decodeWhole(exact.span(), kLimits);
   if (!decoded.dictionary) return {{}, {}, std::string(*decoded.error)};
   const ValueView value = decoded.dictionary->value();
   return {textOf(value, /*areDatesNumbers=*/false),
@@ -486,7 +486,7 @@ TEST(PayloadAgreement, WithJSONFromCBORUpToItsOwnRules) {
     const nlohmann::json json = jsonOf(item);
     if (json.is_discarded()) {
       if (!mine.text) continue;
-      const auto decoded = decodeDictionary(spanOf(item), kLimits, /*account=*/nullptr);
+      const auto decoded = decodeWhole(spanOf(item), kLimits);
       ASSERT_TRUE(holdsWhatJSONDoesNot(decoded.dictionary->value()) ||
                   check(item, kLimits).hasRepeatedKeys)
           << hex(item);

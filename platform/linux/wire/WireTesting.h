@@ -5,6 +5,7 @@
 #include <cstring>
 #include <initializer_list>
 #include <memory>
+#include <optional>
 #include <span>
 #include <string>
 #include <string_view>
@@ -52,6 +53,16 @@ inline Checked check(std::string_view bytes, const PayloadLimits& limits = kTest
   const ExactBytes exact(bytes);
   checked.error = checkItem(exact.span(), limits, checked.size, checked.hasRepeatedKeys);
   return checked;
+}
+
+/// The dictionary that `bytes` are from the first to the last.
+inline DecodedDictionary decodeWhole(std::span<const std::uint8_t> bytes,
+                                     const PayloadLimits& limits) {
+  DecodedDictionary decoded = decodeDictionary(bytes, limits, /*owner=*/{});
+  if (!decoded.error && decoded.size != bytes.size()) {
+    return {std::nullopt, "bytes follow the payload"};
+  }
+  return decoded;
 }
 
 }  // namespace ostrel::wire
