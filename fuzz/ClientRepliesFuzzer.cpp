@@ -2,42 +2,27 @@
 // time: each request ends once, at the latest when the client does.
 #include <poll.h>
 #include <sys/socket.h>
-#include <sys/un.h>
 
 #include <algorithm>
 #include <atomic>
 #include <cstddef>
 #include <cstdint>
-#include <cstdlib>
-#include <cstring>
 #include <span>
 #include <string>
 
+#include "fuzz/Fuzzing.h"
 #include "ostrel/OstrelReportingClient.h"
 #include "platform/linux/FileDescriptor.h"
+#include "platform/linux/TestSockets.h"
 #include "platform/linux/TestSupport.h"
 
 namespace {
 
 using namespace ostrel::reporting;
 using ostrel::FileDescriptor;
+using ostrel::fuzzing::expect;
 
 constexpr ReporterID kSession{7};
-
-void expect(bool condition) {
-  if (!condition) std::abort();
-}
-
-FileDescriptor listenAt(const std::string& path) {
-  FileDescriptor listener(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
-  sockaddr_un address{};
-  address.sun_family = AF_UNIX;
-  std::strncpy(address.sun_path, path.c_str(), sizeof address.sun_path - 1);
-  expect(::bind(listener.get(), reinterpret_cast<const sockaddr*>(&address),
-                sizeof address) == 0);
-  expect(::listen(listener.get(), /*n=*/8) == 0);
-  return listener;
-}
 
 struct Ended {
   std::atomic<int> once{0};
@@ -63,7 +48,8 @@ void ask(Client& client, Ended& ended) {
 extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size) {
   static const ostrel::testing_support::TemporaryDirectory directory;
   static const std::string path = directory / "socket";
-  static const FileDescriptor listener = listenAt(path);
+  static const FileDescriptor listener = ostrel::testing_support::listeningSocket(path);
+  expect(static_cast<bool>(listener));
 
   Ended ended;
   Options options;

@@ -4,25 +4,21 @@
 #include <algorithm>
 #include <cstddef>
 #include <cstdint>
-#include <cstdlib>
 #include <limits>
 #include <string>
 #include <string_view>
 
+#include "fuzz/Fuzzing.h"
 #include "platform/Logging.h"
-#include "platform/linux/Limits.h"
 #include "platform/linux/wire/PayloadDecoder.h"
 
 namespace {
 
 using namespace ostrel;
+using fuzzing::expect;
 
 // An argument takes 2 KiB and the mark of its cut.
 constexpr std::size_t kMostBytes = 2048 + 16;
-
-void expect(bool condition) {
-  if (!condition) std::abort();
-}
 
 void expectPlain(std::string_view line) {
   const std::span<const std::uint8_t> bytes(
@@ -45,8 +41,8 @@ void fill(std::string_view text) {
 }
 
 void fillWithValues(std::span<const std::uint8_t> bytes) {
-  const auto decoded = wire::decodeDictionary(
-      bytes, {limits::kNesting, limits::kNodes, limits::kKeyBytes}, /*owner=*/{});
+  const auto decoded =
+      wire::decodeDictionary(bytes, fuzzing::kPayloadLimits, /*owner=*/{});
   if (!decoded.dictionary) return;
   const std::string line = format("%@", *decoded.dictionary);
   expectPlain(line);

@@ -3,22 +3,20 @@
 // come and go, the next one is served.
 #include <poll.h>
 #include <sys/socket.h>
-#include <sys/un.h>
 
-#include <algorithm>
 #include <array>
 #include <cstddef>
 #include <cstdint>
-#include <cstdlib>
-#include <cstring>
 #include <memory>
 #include <optional>
 #include <string>
 #include <thread>
 
 #include "Statistics/Service/OstrelReportingServiceMain.h"
+#include "fuzz/Fuzzing.h"
 #include "platform/fake/FakePlatform.h"
 #include "platform/linux/SystemClock.h"
+#include "platform/linux/TestSockets.h"
 #include "platform/linux/TestSupport.h"
 #include "platform/linux/ThreadPoolWorkQueues.h"
 #include "platform/linux/TimedConditionFactory.h"
@@ -28,35 +26,11 @@
 namespace {
 
 using namespace ostrel;
+using fuzzing::expect;
+using fuzzing::Input;
 using wire::Operation;
 
 constexpr int kPatience = 60'000;  // Milliseconds.
-
-void expect(bool condition) {
-  if (!condition) std::abort();
-}
-
-/// The input, read from its beginning; zeros behind its end.
-class Input {
- public:
-  Input(const std::uint8_t* data, std::size_t size) : rest_(data, size) {}
-
-  bool isOver() const { return rest_.empty(); }
-  std::uint8_t byte() {
-    if (rest_.empty()) return 0;
-    const std::uint8_t first = rest_[0];
-    rest_ = rest_.subspan(1);
-    return first;
-  }
-  std::string bytes(std::size_t count) {
-    const auto taken = rest_.first(std::min(count, rest_.size()));
-    rest_ = rest_.subspan(taken.size());
-    return {taken.begin(), taken.end()};
-  }
-
- private:
-  std::span<const std::uint8_t> rest_;
-};
 
 /// The service in this process, on a socket of its own.
 class Service {
@@ -80,12 +54,8 @@ class Service {
   }
 
   FileDescriptor connect() const {
-    FileDescriptor socket(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
-    sockaddr_un address{};
-    address.sun_family = AF_UNIX;
-    std::strncpy(address.sun_path, path_.c_str(), sizeof address.sun_path - 1);
-    expect(::connect(socket.get(), reinterpret_cast<const sockaddr*>(&address),
-                     sizeof address) == 0);
+    FileDescriptor socket = testing_support::connectedSocket(path_);
+    expect(static_cast<bool>(socket));
     return socket;
   }
 

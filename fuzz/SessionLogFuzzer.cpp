@@ -3,34 +3,28 @@
 #include <algorithm>
 #include <cstddef>
 #include <cstdint>
-#include <cstdlib>
-#include <memory>
 #include <nlohmann/json.hpp>
 #include <string>
 #include <vector>
 
 #include "Statistics/Service/OstrelReportingSessionSummary.h"
+#include "fuzz/Fuzzing.h"
 #include "platform/linux/FileEntryStorage.h"
 #include "platform/linux/JSONTextSerialization.h"
-#include "platform/linux/Limits.h"
 #include "platform/linux/TestSupport.h"
 #include "platform/linux/wire/PayloadDecoder.h"
 
 namespace {
 
 using namespace ostrel;
-
-void expect(bool condition) {
-  if (!condition) std::abort();
-}
+using fuzzing::expect;
 
 // Each begins where the one before ended.
 std::vector<Dictionary> decodeAll(std::span<const std::uint8_t> bytes) {
   std::vector<Dictionary> payloads;
   while (!bytes.empty() && payloads.size() < 64) {
-    auto decoded = wire::decodeDictionary(
-        bytes, {limits::kNesting, limits::kNodes, limits::kKeyBytes},
-        /*owner=*/{});
+    auto decoded = wire::decodeDictionary(bytes, fuzzing::kPayloadLimits,
+                                          /*owner=*/{});
     if (!decoded.dictionary) break;
     bytes = bytes.subspan(decoded.size);
     payloads.push_back(*std::move(decoded.dictionary));

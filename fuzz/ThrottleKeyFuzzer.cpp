@@ -3,31 +3,19 @@
 #include <cmath>
 #include <cstddef>
 #include <cstdint>
-#include <cstdlib>
-#include <memory>
 #include <string>
 #include <string_view>
 
 #include "Statistics/OstrelReportingUtility.h"
 #include "Statistics/Service/OstrelReportingBlockThrottle.h"
-#include "platform/Logging.h"
-#include "platform/linux/Limits.h"
+#include "fuzz/Fuzzing.h"
 #include "platform/linux/wire/PayloadDecoder.h"
 
 namespace {
 
 using namespace ostrel;
+using fuzzing::expect;
 using Throttle = OstrelReportingBlockThrottle;
-
-struct QuietLog final : ScopedLog {
-  int verbosity(std::string_view) const override { return 9; }
-  LogLevel lowestLevel() const override { return LogLevel::kDebug; }
-  void write(const LogLine&) override {}
-};
-
-void expect(bool condition) {
-  if (!condition) std::abort();
-}
 
 std::string keyOf(const Dictionary& payload, std::int64_t id = 7) {
   return Throttle::buildMessageKey(payload, ReporterID{id}, MessageCategory{0x40000007},
@@ -37,14 +25,9 @@ std::string keyOf(const Dictionary& payload, std::int64_t id = 7) {
 }  // namespace
 
 extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size) {
-  static const bool isQuiet = [] {
-    setSystemLog(std::make_shared<QuietLog>());
-    return true;
-  }();
-  static_cast<void>(isQuiet);
-  const auto decoded = wire::decodeDictionary(
-      {data, size}, {limits::kNesting, limits::kNodes, limits::kKeyBytes},
-      /*owner=*/{});
+  fuzzing::silenceLog();
+  const auto decoded = wire::decodeDictionary({data, size}, fuzzing::kPayloadLimits,
+                                              /*owner=*/{});
   if (!decoded.dictionary) return 0;
   const Dictionary& payload = *decoded.dictionary;
 

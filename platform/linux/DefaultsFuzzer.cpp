@@ -2,30 +2,16 @@
 // values.
 #include <cstddef>
 #include <cstdint>
-#include <memory>
 #include <string_view>
 
+#include "fuzz/Fuzzing.h"
 #include "platform/linux/EtcDeviceInfo.h"
 #include "platform/linux/JSONUserDefaults.h"
 #include "platform/linux/TestSupport.h"
 
-namespace {
-
-struct QuietLog final : ostrel::ScopedLog {
-  int verbosity(std::string_view) const override { return 0; }
-  ostrel::LogLevel lowestLevel() const override { return ostrel::LogLevel::kError; }
-  void write(const ostrel::LogLine&) override {}
-};
-
-}  // namespace
-
 extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size) {
   static const ostrel::testing_support::TemporaryDirectory directory;
-  static const bool isQuiet = [] {
-    ostrel::setSystemLog(std::make_shared<QuietLog>());
-    return true;
-  }();
-  static_cast<void>(isQuiet);
+  ostrel::fuzzing::silenceLog();
   const std::string_view text(reinterpret_cast<const char*>(data), size);
   directory.write("suite.json", text);
   const auto suite = ostrel::JSONUserDefaults(directory.path()).openSuite("suite");

@@ -3,25 +3,25 @@
 #include <poll.h>
 #include <sys/eventfd.h>
 #include <sys/socket.h>
-#include <sys/un.h>
 #include <systemd/sd-bus.h>
 
 #include <algorithm>
 #include <cstddef>
 #include <cstdint>
 #include <cstdlib>
-#include <cstring>
-#include <span>
 #include <string>
 #include <thread>
 
-#include "platform/Logging.h"
+#include "fuzz/Fuzzing.h"
 #include "platform/linux/SensorProxyOrientation.h"
+#include "platform/linux/TestSockets.h"
 #include "platform/linux/TestSupport.h"
 
 namespace {
 
 using namespace ostrel;
+using fuzzing::expect;
+using fuzzing::Input;
 
 constexpr char kName[] = "net.hadess.SensorProxy";
 constexpr char kPath[] = "/net/hadess/SensorProxy";
@@ -29,45 +29,18 @@ constexpr char kProperties[] = "org.freedesktop.DBus.Properties";
 constexpr char kProperty[] = "AccelerometerOrientation";
 constexpr int kPatience = 20'000;  // Milliseconds.
 
-struct QuietLog final : ScopedLog {
-  int verbosity(std::string_view) const override { return 9; }
-  LogLevel lowestLevel() const override { return LogLevel::kDebug; }
-  void write(const LogLine&) override {}
-};
-
-void expect(bool condition) {
-  if (!condition) std::abort();
+/// Letters, so that it is a text.
+std::string textFrom(Input& input) {
+  constexpr const char* kKnown[] = {"undefined", "normal",     "bottom-up", "left-up",
+                                    "right-up",  "LightLevel", kProperty,   ""};
+  const std::uint8_t which = input.byte();
+  if (which < std::size(kKnown)) return kKnown[which];
+  std::string text = input.bytes(which);
+  std::ranges::transform(text, text.begin(), [](char c) {
+    return static_cast<char>('A' + static_cast<unsigned char>(c) % 58);
+  });
+  return text;
 }
-
-class Input {
- public:
-  Input(const std::uint8_t* data, std::size_t size) : rest_(data, size) {}
-
-  bool isOver() const { return rest_.empty(); }
-  std::uint8_t byte() {
-    if (rest_.empty()) return 0;
-    const std::uint8_t first = rest_[0];
-    rest_ = rest_.subspan(1);
-    return first;
-  }
-  /// Letters, so that it is a text.
-  std::string text() {
-    constexpr const char* kKnown[] = {"undefined", "normal",     "bottom-up", "left-up",
-                                      "right-up",  "LightLevel", kProperty,   ""};
-    const std::uint8_t which = byte();
-    if (which < std::size(kKnown)) return kKnown[which];
-    const auto letters = rest_.first(std::min<std::size_t>(which, rest_.size()));
-    rest_ = rest_.subspan(letters.size());
-    std::string text(letters.begin(), letters.end());
-    std::ranges::transform(text, text.begin(), [](char c) {
-      return static_cast<char>('A' + static_cast<unsigned char>(c) % 58);
-    });
-    return text;
-  }
-
- private:
-  std::span<const std::uint8_t> rest_;
-};
 
 /// Appends values of any type, one after the other and within one another. What the
 /// library refuses is left out.
@@ -75,7 +48,7 @@ void appendAnything(sd_bus_message* message, Input& input, int depth) {
   constexpr int kMostDepth = 4;
   switch (input.byte() % (depth < kMostDepth ? 10 : 6)) {
     case 0:
-      sd_bus_message_append(message, "s", input.text().c_str());
+      sd_bus_message_append(message, "s", textFrom(input).c_str());
       return;
     case 1:
       sd_bus_message_append(message, "i", int{input.byte()});
@@ -87,23 +60,23 @@ void appendAnything(sd_bus_message* message, Input& input, int depth) {
       sd_bus_message_append(message, "o", kPath);
       return;
     case 4:
-      sd_bus_message_append(message, "as", 2, "left-up", input.text().c_str());
+      sd_bus_message_append(message, "as", 2, "left-up", textFrom(input).c_str());
       return;
     case 5:
-      sd_bus_message_append(message, "v", "s", input.text().c_str());
+      sd_bus_message_append(message, "v", "s", textFrom(input).c_str());
       return;
     case 6:
       sd_bus_message_append(message, "v", "v", "i", int{input.byte()});
       return;
     case 7:
       if (sd_bus_message_open_container(message, 'r', "ss") >= 0) {
-        sd_bus_message_append(message, "ss", "a", input.text().c_str());
+        sd_bus_message_append(message, "ss", "a", textFrom(input).c_str());
         sd_bus_message_close_container(message);
       }
       return;
     case 8:
-      sd_bus_message_append(message, "a{sv}", 1, input.text().c_str(), "s",
-                            input.text().c_str());
+      sd_bus_message_append(message, "a{sv}", 1, textFrom(input).c_str(), "s",
+                            textFrom(input).c_str());
       return;
     default:
       appendAnything(message, input, depth + 1);
@@ -154,7 +127,7 @@ class ScriptedBus {
     switch (input_.byte() % 5) {
       case 0:
         sd_bus_reply_method_errorf(call, SD_BUS_ERROR_FAILED, "%s",
-                                   input_.text().c_str());
+                                   textFrom(input_).c_str());
         return;
       case 1:
         return;  // Never.
@@ -170,7 +143,7 @@ class ScriptedBus {
       }
       default:
         if (sd_bus_message_is_method_call(call, kProperties, "Get") > 0) {
-          sd_bus_reply_method_return(call, "v", "s", input_.text().c_str());
+          sd_bus_reply_method_return(call, "v", "s", textFrom(input_).c_str());
         } else {
           sd_bus_reply_method_return(call, "");
         }
@@ -203,9 +176,9 @@ class ScriptedBus {
       sd_bus_message_append(signal, "ss", "", shape == 1 ? ":1.9" : "");
     } else {
       sd_bus_message_open_container(signal, 'a', "{sv}");
-      sd_bus_message_append(signal, "{sv}", input_.text().c_str(), "i", 3);
+      sd_bus_message_append(signal, "{sv}", textFrom(input_).c_str(), "i", 3);
       sd_bus_message_append(signal, "{sv}", kProperty, shape == 1 ? "s" : "o",
-                            shape == 1 ? input_.text().c_str() : kPath);
+                            shape == 1 ? textFrom(input_).c_str() : kPath);
       sd_bus_message_close_container(signal);
       sd_bus_message_append(signal, "as", 0);
     }
@@ -220,14 +193,9 @@ class ScriptedBus {
 
 FileDescriptor listenAt(const std::string& path) {
   ::setenv("DBUS_SYSTEM_BUS_ADDRESS", ("unix:path=" + path).c_str(), /*replace=*/1);
-  setSystemLog(std::make_shared<QuietLog>());
-  FileDescriptor listener(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
-  sockaddr_un address{};
-  address.sun_family = AF_UNIX;
-  std::strncpy(address.sun_path, path.c_str(), sizeof address.sun_path - 1);
-  expect(::bind(listener.get(), reinterpret_cast<const sockaddr*>(&address),
-                sizeof address) == 0);
-  expect(::listen(listener.get(), /*n=*/8) == 0);
+  fuzzing::silenceLog();
+  FileDescriptor listener = testing_support::listeningSocket(path);
+  expect(static_cast<bool>(listener));
   return listener;
 }
 

@@ -3,22 +3,18 @@
 // written and read again as the same value.
 #include <cstddef>
 #include <cstdint>
-#include <cstdlib>
 #include <nlohmann/json.hpp>
 #include <string>
 
+#include "fuzz/Fuzzing.h"
 #include "platform/ValueJSON.h"
-#include "platform/linux/Limits.h"
 #include "platform/linux/ValueJSONReader.h"
 #include "platform/linux/wire/PayloadDecoder.h"
 
 namespace {
 
 using namespace ostrel;
-
-void expect(bool condition) {
-  if (!condition) std::abort();
-}
+using fuzzing::expect;
 
 void writePayload(ValueView value) {
   for (const JSONLayout layout : {JSONLayout::kCompact, JSONLayout::kPretty}) {
@@ -47,9 +43,8 @@ void readText(std::string_view text) {
 }  // namespace
 
 extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size) {
-  const auto decoded = wire::decodeDictionary(
-      {data, size}, {limits::kNesting, limits::kNodes, limits::kKeyBytes},
-      /*owner=*/{});
+  const auto decoded = wire::decodeDictionary({data, size}, fuzzing::kPayloadLimits,
+                                              /*owner=*/{});
   if (decoded.dictionary) writePayload(decoded.dictionary->value());
   readText({reinterpret_cast<const char*>(data), size});
   return 0;

@@ -5,25 +5,19 @@
 #include <algorithm>
 #include <cstddef>
 #include <cstdint>
-#include <cstdlib>
 #include <string>
 
-#include "platform/linux/Limits.h"
+#include "fuzz/Fuzzing.h"
 
 namespace {
 
 using namespace ostrel;
+using fuzzing::expect;
 using Bytes = std::span<const std::uint8_t>;
 
-constexpr wire::PayloadLimits kLimits{limits::kNesting, limits::kNodes,
-                                      limits::kKeyBytes};
-
-void expect(bool condition) {
-  if (!condition) std::abort();
-}
-
 wire::DecodeError decode(Bytes item, wire::Request& request) {
-  return wire::decodeRequest(item, kLimits, limits::kReporterIDs, /*owner=*/{}, request);
+  return wire::decodeRequest(item, fuzzing::kPayloadLimits, limits::kReporterIDs,
+                             /*owner=*/{}, request);
 }
 
 void tryRequest(Bytes item) {
@@ -46,7 +40,7 @@ void tryReply(Bytes item) {
   const auto operationOf = [](wire::RequestNumber number) {
     return std::optional(static_cast<wire::Operation>(number % 12));
   };
-  static_cast<void>(wire::decodeReply(item, kLimits, operationOf, reply));
+  static_cast<void>(wire::decodeReply(item, fuzzing::kPayloadLimits, operationOf, reply));
 }
 
 }  // namespace

@@ -2,25 +2,25 @@
 // it shows is a payload again, with nothing left to drop.
 #include <cstddef>
 #include <cstdint>
-#include <cstdlib>
 
-#include "platform/linux/Limits.h"
+#include "fuzz/Fuzzing.h"
 #include "platform/linux/wire/PayloadDecoder.h"
 
 extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size) {
   using namespace ostrel;
-  constexpr wire::PayloadLimits kLimits{limits::kNesting, limits::kNodes,
-                                        limits::kKeyBytes};
-  const auto decoded = wire::decodeDictionary({data, size}, kLimits, /*owner=*/{});
-  if (decoded.dictionary.has_value() == decoded.error.has_value()) std::abort();
-  if (decoded.size > size) std::abort();
+  using fuzzing::expect;
+  const auto decoded =
+      wire::decodeDictionary({data, size}, fuzzing::kPayloadLimits, /*owner=*/{});
+  expect(decoded.dictionary.has_value() != decoded.error.has_value());
+  expect(decoded.size <= size);
   if (!decoded.dictionary) return 0;
 
   const ValueView value = decoded.dictionary->value();
   static_cast<void>(description(value));
   std::size_t length = 0;
   bool hasRepeatedKeys = false;
-  if (wire::checkItem(value.bytes(), kLimits, length, hasRepeatedKeys)) std::abort();
-  if (length != value.bytes().size() || hasRepeatedKeys) std::abort();
+  expect(
+      !wire::checkItem(value.bytes(), fuzzing::kPayloadLimits, length, hasRepeatedKeys));
+  expect(length == value.bytes().size() && !hasRepeatedKeys);
   return 0;
 }
