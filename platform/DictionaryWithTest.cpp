@@ -5,6 +5,7 @@
 #include <vector>
 
 #include "platform/Value.h"
+#include "platform/fake/CountingAccount.h"
 
 namespace ostrel {
 namespace {
@@ -17,15 +18,6 @@ std::string encoded(const Dictionary& dictionary) {
 Dictionary built(const Dictionary& start, std::string_view key, const Value& value) {
   return DictionaryBuilder(start).set(key, value).build();
 }
-
-class CountingAccount final : public PayloadAccount {
- public:
-  void charge(std::size_t) noexcept override { ++buffers; }
-  void relieve(std::size_t) noexcept override {}
-  bool keep(std::size_t) noexcept override { return true; }
-  void discard(std::size_t) noexcept override {}
-  int buffers = 0;
-};
 
 TEST(DictionaryWith, AppendsAKeyThatIsNew) {
   const Dictionary start{{"a", 1}, {"b", 2}};
@@ -55,16 +47,13 @@ TEST(DictionaryWith, TellsATextKeyFromAnIntegerKey) {
 
 TEST(DictionaryWith, IsOneBufferOfTheSameAccount) {
   const auto account = std::make_shared<CountingAccount>();
-  const Dictionary plain{{"a", "text"}, {"b", 2}};
-  ValueBuffer buffer = ValueBuffer::copyOf(plain.value().bytes(), account);
-  const std::uint8_t* item = std::as_const(buffer).data();
-  const Dictionary start(std::move(buffer), item);
-  account->buffers = 0;
+  const Dictionary start = chargedTo(account, {{"a", "text"}, {"b", 2}});
+  const std::size_t before = account->timesCharged();
 
   const Dictionary result = start.with("c", Value(3));
 
   EXPECT_EQ(result.owner().account(), account);
-  EXPECT_EQ(account->buffers, 1);
+  EXPECT_EQ(account->timesCharged(), before + 1);
 }
 
 // Writes dictionaries as other encoders may: with heads that are longer than they

@@ -8,6 +8,7 @@
 #include <vector>
 
 #include "Statistics/CoreTestFixture.h"
+#include "platform/fake/CountingAccount.h"
 
 namespace ostrel {
 namespace {
@@ -196,41 +197,22 @@ TEST_F(OstrelReportingAggregatedPayloadsTest, ReferenceOutlivesWhatWasAppended) 
   EXPECT_EQ(list.size(), 2u);
 }
 
-class ClientAccount final : public PayloadAccount {
- public:
-  void charge(std::size_t) noexcept override {}
-  void relieve(std::size_t) noexcept override {}
-  bool keep(std::size_t bytes) noexcept override {
-    kept += bytes;
-    return true;
-  }
-  void discard(std::size_t bytes) noexcept override { kept -= bytes; }
-  std::size_t kept = 0;
-};
-
-Dictionary ofClient(const Dictionary& plain,
-                    const std::shared_ptr<ClientAccount>& client) {
-  ValueBuffer buffer = ValueBuffer::copyOf(plain.value().bytes(), client);
-  const std::uint8_t* const item = std::as_const(buffer).data();
-  return Dictionary(std::move(buffer), item);
-}
-
 TEST_F(OstrelReportingAggregatedPayloadsTest, ChargesTheClientForWhatItKeeps) {
-  const auto client = std::make_shared<ClientAccount>();
+  const auto client = std::make_shared<CountingAccount>();
   {
     OstrelReportingAggregatedPayloads list(storage_, ReporterID{42});
     const Dictionary small{{"a", 1}};
-    list.append("id", ofClient(small, client));
+    list.append("id", chargedTo(client, small));
     const std::size_t entry = 1 + 3 + small.value().bytes().size();
-    EXPECT_EQ(client->kept, entry);
+    EXPECT_EQ(client->kept(), entry);
     const Dictionary large = payloadOf(100'000);
-    list.append("id", ofClient(large, client));  // Copied: it is the client's.
-    EXPECT_EQ(client->kept, entry + 1 + 3 + 100'000);
+    list.append("id", chargedTo(client, large));  // Copied: it is the client's.
+    EXPECT_EQ(client->kept(), entry + 1 + 3 + 100'000);
     list.append("id", small);
-    EXPECT_EQ(client->kept, entry + 1 + 3 + 100'000);
+    EXPECT_EQ(client->kept(), entry + 1 + 3 + 100'000);
     EXPECT_EQ(list.size(), 3u);
   }
-  EXPECT_EQ(client->kept, 0u);
+  EXPECT_EQ(client->kept(), 0u);
 }
 
 }  // namespace

@@ -3,6 +3,7 @@
 #include <chrono>
 
 #include "Statistics/Service/SessionTestFixture.h"
+#include "platform/fake/CountingAccount.h"
 
 namespace ostrel {
 namespace {
@@ -53,22 +54,9 @@ TEST_F(OstrelReportingSingleMessage, SendsOnTheBackgroundQueueNeverInline) {
   EXPECT_EQ(replies, Replies{std::nullopt});
 }
 
-// Bears what one read of a connection brought.
-class InputAccount final : public PayloadAccount {
- public:
-  void charge(std::size_t bytes) noexcept override { bytes_ += bytes; }
-  void relieve(std::size_t bytes) noexcept override { bytes_ -= bytes; }
-  bool keep(std::size_t) noexcept override { return true; }
-  void discard(std::size_t) noexcept override {}
-  std::size_t bytes() const { return bytes_; }
-
- private:
-  std::size_t bytes_ = 0;
-};
-
 TEST_F(OstrelReportingSingleMessage, HoldsOnlyItselfInMemoryWhileItWaits) {
   constexpr std::size_t kInputBytes = 64 * 1024;
-  const auto account = std::make_shared<InputAccount>();
+  const auto account = std::make_shared<CountingAccount>();
   const Dictionary plain{{"a", 1}};
   const auto send = [&] {
     std::string input(kInputBytes, '\0');

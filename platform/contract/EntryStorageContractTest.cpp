@@ -1,6 +1,7 @@
 // What sessions collect until they stop.
 #include <thread>
 
+#include "platform/fake/CountingAccount.h"
 #include "platform/fake/FakeEntryStorage.h"
 #include "platform/linux/FileEntryStorage.h"
 #include "platform/linux/TestSupport.h"
@@ -27,25 +28,6 @@ struct EntriesInFile {
                             .bytesInMemory = 1,
                             .pauseOfFile = std::chrono::milliseconds(0)},
                            SpillCalls::system()};
-};
-
-// Takes so many bytes, and knows what it bears.
-class LimitedAccount final : public PayloadAccount {
- public:
-  explicit LimitedAccount(std::size_t most) : most_(most) {}
-  void charge(std::size_t) noexcept override {}
-  void relieve(std::size_t) noexcept override {}
-  bool keep(std::size_t bytes) noexcept override {
-    if (kept + bytes > most_) return false;
-    kept += bytes;
-    return true;
-  }
-  void discard(std::size_t bytes) noexcept override { kept -= bytes; }
-
-  std::size_t kept = 0;
-
- private:
-  const std::size_t most_;
 };
 
 std::span<const std::uint8_t> asBytes(std::string_view text) {
@@ -167,7 +149,7 @@ TYPED_TEST(EntryStorageContract, SnapshotIsReadWhileEntriesAreAppended) {
 
 TYPED_TEST(EntryStorageContract, TakesNoMoreThanTheAccountKeeps) {
   for (const std::size_t room : {299u, 300u, 301u}) {
-    const auto account = std::make_shared<LimitedAccount>(room);
+    const auto account = std::make_shared<CountingAccount>(room);
     const auto entries = this->storage_.makeEntries(kSession);
     EXPECT_TRUE(append(*entries, std::string(200, 'a'), account));
     EXPECT_EQ(append(*entries, std::string(100, 'b'), account), room >= 300) << room;
@@ -177,22 +159,22 @@ TYPED_TEST(EntryStorageContract, TakesNoMoreThanTheAccountKeeps) {
 }
 
 TYPED_TEST(EntryStorageContract, GivesEachAccountItsBytesBackAtTheEndOfTheList) {
-  const auto first = std::make_shared<LimitedAccount>(/*most=*/10000);
-  const auto second = std::make_shared<LimitedAccount>(/*most=*/10000);
+  const auto first = std::make_shared<CountingAccount>(/*mostKept=*/10000);
+  const auto second = std::make_shared<CountingAccount>(/*mostKept=*/10000);
   auto entries = this->storage_.makeEntries(kSession);
   for (int i = 0; i < 10; ++i) {
     append(*entries, std::string(30, 'a'), first);
     append(*entries, std::string(50, 'b'), second);
   }
-  EXPECT_EQ(first->kept, 300u);
-  EXPECT_EQ(second->kept, 500u);
+  EXPECT_EQ(first->kept(), 300u);
+  EXPECT_EQ(second->kept(), 500u);
   entries.reset();
-  EXPECT_EQ(first->kept, 0u);
-  EXPECT_EQ(second->kept, 0u);
+  EXPECT_EQ(first->kept(), 0u);
+  EXPECT_EQ(second->kept(), 0u);
 }
 
 TYPED_TEST(EntryStorageContract, LogsTheFirstRefusalOfEachListAndCountsAll) {
-  const auto account = std::make_shared<LimitedAccount>(/*most=*/0);
+  const auto account = std::make_shared<CountingAccount>(/*mostKept=*/0);
   for (int list = 0; list < 2; ++list) {
     const auto entries = this->storage_.makeEntries(kSession);
     for (int i = 0; i < 3; ++i) EXPECT_FALSE(append(*entries, "x", account));

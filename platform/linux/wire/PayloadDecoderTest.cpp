@@ -6,6 +6,7 @@
 #include <cmath>
 #include <limits>
 
+#include "platform/fake/CountingAccount.h"
 #include "platform/linux/wire/WireTesting.h"
 
 namespace ostrel::wire {
@@ -27,18 +28,6 @@ std::string repeated(std::string_view text, std::size_t count) {
   for (std::size_t i = 0; i < count; ++i) all += text;
   return all;
 }
-
-class CountingAccount : public PayloadAccount {
- public:
-  void charge(std::size_t bytes) noexcept override { bytes_ += bytes; }
-  void relieve(std::size_t bytes) noexcept override { bytes_ -= bytes; }
-  bool keep(std::size_t) noexcept override { return true; }
-  void discard(std::size_t) noexcept override {}
-  std::size_t bytes() const { return bytes_; }
-
- private:
-  std::size_t bytes_ = 0;
-};
 
 std::optional<Dictionary> decode(std::string_view bytes) {
   const ExactBytes exact(bytes);
