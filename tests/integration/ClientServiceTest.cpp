@@ -48,6 +48,11 @@ class Answers {
     changed_.wait_for(lock, kSoon, [&] { return texts_.size() >= count; });
     return texts_;
   }
+  /// The last one then; empty when there is none.
+  std::string waitForLast(std::size_t count) {
+    const auto texts = wait(count);
+    return texts.empty() ? "" : texts.back();
+  }
 
  private:
   std::mutex mutex_;
@@ -66,6 +71,16 @@ class ClientOfTheService : public testing::Test {
         std::vector<std::string>{"RUNTIME_DIRECTORY=" + directory / "run",
                                  "STATE_DIRECTORY=" + directory / "state",
                                  "LOGS_DIRECTORY=" + directory / "logs"});
+  }
+  /// Asks, each time once the answer before has come, until `answer` comes. What is asked
+  /// while the loss of a service is not noticed yet may be lost with it.
+  template <typename Ask>
+  void askUntil(const std::string& answer, const Ask& ask) {
+    std::size_t answered = answers.wait(0).size();
+    EXPECT_TRUE(testing_support::eventually([&] {
+      ask();
+      return answers.waitForLast(++answered) == answer;
+    })) << answers.waitForLast(0);
   }
   /// Without a word to anybody.
   void killService() { service.reset(); }
@@ -154,13 +169,9 @@ TEST_F(ClientOfTheService, ReachesItAgainAfterAKill) {
   killService();
   startService();
 
-  // What is asked while the loss is not noticed yet may be lost with it.
-  std::size_t asked = 1;
-  do {
+  askUntil("again 0 true", [&] {
     client.createReportingSession(kSession, answers.expect<bool>("again"));
-  } while (answers.wait(++asked).back() != "again 0 true" && asked < 100);
-
-  EXPECT_EQ(answers.wait(asked).back(), "again 0 true");
+  });
   // A dying service may still have a socket to connect to for a moment.
   EXPECT_GE(client.counts().connections, 2u);
 }
@@ -176,17 +187,10 @@ TEST_F(ClientOfTheService, MakesItsSessionsAnewWhenAskedTo) {
   killService();
   startService();
 
-  std::size_t asked = 1;
-  do {
+  // The type is set on the session's own queue, a moment after the session is there.
+  askUntil("type 0 3", [&] {
     client.getServiceNameForReporterID(kSession, answers.expect<ServiceType>("type"));
-  } while (answers.wait(++asked).back().substr(0, 6) != "type 0" && asked < 100);
-
-  // The type is set on the session's own queue, a moment later.
-  for (int i = 0; i < 100 && answers.wait(asked).back() != "type 0 3"; ++i) {
-    client.getServiceNameForReporterID(kSession, answers.expect<ServiceType>("type"));
-    ++asked;
-  }
-  EXPECT_EQ(answers.wait(asked).back(), "type 0 3");
+  });
 }
 
 TEST_F(ClientOfTheService, QueuesWhatIsAskedBeforeItIsThere) {
@@ -238,9 +242,7 @@ TEST_F(ClientOfTheService, ServesManyThreadsAtOnce) {
   }
   for (std::thread& thread : threads) thread.join();
 
-  for (int i = 0; i < 2000 && answered < kThreads * kMessages; ++i) {
-    std::this_thread::sleep_for(10ms);
-  }
+  testing_support::eventually([&] { return answered == kThreads * kMessages; });
   EXPECT_EQ(answered, kThreads * kMessages);
   EXPECT_EQ(client.counts().droppedRequests, 0u);
 }
