@@ -3,6 +3,10 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
+#include <cstdint>
+#include <initializer_list>
+#include <string_view>
+
 #include "platform/linux/Limits.h"
 #include "platform/linux/TestSupport.h"
 
@@ -18,12 +22,22 @@ using Kind = MisuseLog::Kind;
 
 const MisuseLog::Clock::time_point kNow{std::chrono::hours(1)};
 
+struct Misuse {
+  std::uint32_t user;
+  Kind kind;
+  std::string_view reason;
+};
+
+void noteAll(MisuseLog& log, std::initializer_list<Misuse> all) {
+  for (const Misuse& one : all) log.note(one.user, one.kind, one.reason, kNow);
+}
+
 TEST(MisuseLog, SaysWhoWhatAndWhy) {
   const CapturedLog log;
   MisuseLog misuse;
-  misuse.note(1000, Kind::kCutOff, "a frame is empty", kNow);
-  misuse.note(1001, Kind::kConnectionRefused, "there are too many", kNow);
-  misuse.note(1002, Kind::kSessionRefused, "there are too many", kNow);
+  noteAll(misuse, {{1000, Kind::kCutOff, "a frame is empty"},
+                   {1001, Kind::kConnectionRefused, "there are too many"},
+                   {1002, Kind::kSessionRefused, "there are too many"}});
   EXPECT_THAT(
       log.lines(LogLevel::kError),
       ElementsAre(
@@ -50,10 +64,10 @@ TEST(MisuseLog, LogsAKindOfAUserAgainAfterTheInterval) {
 TEST(MisuseLog, KeepsUsersAndKindsApart) {
   const CapturedLog log;
   MisuseLog misuse;
-  misuse.note(1000, Kind::kCutOff, "x", kNow);
-  misuse.note(1001, Kind::kCutOff, "x", kNow);
-  misuse.note(1000, Kind::kSessionRefused, "x", kNow);
-  misuse.note(1000, Kind::kCutOff, "y", kNow);
+  noteAll(misuse, {{1000, Kind::kCutOff, "x"},
+                   {1001, Kind::kCutOff, "x"},
+                   {1000, Kind::kSessionRefused, "x"},
+                   {1000, Kind::kCutOff, "y"}});
   EXPECT_THAT(log.lines(LogLevel::kError), SizeIs(3));
 }
 
@@ -61,8 +75,8 @@ TEST(MisuseLog, CountsAllAndTellsOfEach) {
   const CapturedLog log;
   int told = 0;
   MisuseLog misuse([&told] { ++told; });
-  for (int i = 0; i < 5; ++i) misuse.note(1000, Kind::kSessionRefused, "x", kNow);
-  misuse.note(1000, Kind::kConnectionRefused, "x", kNow);
+  for (int i = 0; i < 5; ++i) noteAll(misuse, {{1000, Kind::kSessionRefused, "x"}});
+  noteAll(misuse, {{1000, Kind::kConnectionRefused, "x"}});
   EXPECT_EQ(misuse.counts(), (MisuseLog::Counts{0, 1, 5}));
   EXPECT_EQ(told, 6);
 }

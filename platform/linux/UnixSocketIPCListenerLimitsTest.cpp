@@ -27,8 +27,7 @@ using testing::UnorderedElementsAre;
 TEST_F(UnixSocketListener, ChargesAllThatAMessageKeepsInMemory) {
   ListenerLimits limits;
   limits.queuedBytes = 64 * 1024;
-  serve(limits);
-  service->holdReplies();
+  serveHolding(limits);
   RawClient client(path);
   // One held message among others that are done with at once: a few kilobytes of
   // input stay alive for it.
@@ -44,9 +43,7 @@ TEST_F(UnixSocketListener, ChargesAllThatAMessageKeepsInMemory) {
   std::thread sender([&] {
     for (std::size_t i = 0; i < kBursts; ++i) client.send(burst);
   });
-  ASSERT_TRUE(service->waitForCalls(201));
-  std::this_thread::sleep_for(100ms);
-  const std::size_t whileHeld = service->calls().size();
+  const std::size_t whileHeld = callsWhileHeld(201);
   service->releaseReplies();
 
   EXPECT_TRUE(service->waitForCalls(kBursts * 201));
@@ -78,8 +75,7 @@ TEST_F(UnixSocketListener, TakesAFrameOfTheLargestSizeAndNoneLarger) {
 TEST_F(UnixSocketListener, HoldsBackAClientWithTooMuchUnderWayAndLosesNothing) {
   ListenerLimits limits;
   limits.queuedBytes = 64 * 1024;
-  serve(limits);
-  service->holdReplies();
+  serveHolding(limits);
   constexpr std::size_t kMessages = 2000;
   RawClient greedy(path);
   RawClient other(path);
@@ -90,9 +86,7 @@ TEST_F(UnixSocketListener, HoldsBackAClientWithTooMuchUnderWayAndLosesNothing) {
     }
     greedy.send(reportersRequest(5));
   });
-  ASSERT_TRUE(service->waitForCalls(40));
-  std::this_thread::sleep_for(100ms);
-  const std::size_t whileHeld = service->calls().size();
+  const std::size_t whileHeld = callsWhileHeld(40);
   other.send([] {
     wire::Request request;
     request.operation = wire::Operation::kReporterIDValid;
@@ -111,17 +105,14 @@ TEST_F(UnixSocketListener, HoldsBackAClientWithTooMuchUnderWayAndLosesNothing) {
 TEST_F(UnixSocketListener, HoldsBackAClientThatFloodsRequestsWithoutPayload) {
   ListenerLimits limits;
   limits.queuedBytes = 64 * 1024;
-  serve(limits);
-  service->holdReplies();
+  serveHolding(limits);
   constexpr std::size_t kRequests = 5000;
   RawClient client(path);
 
   std::thread sender([&] {
     for (std::size_t i = 0; i < kRequests; ++i) client.send(createRequest(0, 7));
   });
-  ASSERT_TRUE(service->waitForCalls(100));
-  std::this_thread::sleep_for(100ms);
-  const std::size_t whileHeld = service->calls().size();
+  const std::size_t whileHeld = callsWhileHeld(100);
   service->releaseReplies();
 
   EXPECT_TRUE(service->waitForCalls(kRequests));
@@ -133,8 +124,7 @@ TEST_F(UnixSocketListener, CutsNobodyOffWhoIsMerelyHeldBack) {
   ListenerLimits limits;
   limits.ofUser.queuedBytes = 64 * 1024;
   limits.halfFrameBytesOfUser = 64 * 1024;
-  serve(limits);
-  service->holdReplies();
+  serveHolding(limits);
   constexpr std::size_t kClients = 8;
   constexpr std::size_t kMessages = 300;
   std::string burst;
@@ -152,8 +142,7 @@ TEST_F(UnixSocketListener, CutsNobodyOffWhoIsMerelyHeldBack) {
       }
     });
   }
-  ASSERT_TRUE(service->waitForCalls(10));
-  std::this_thread::sleep_for(100ms);
+  callsWhileHeld(10);
   service->releaseReplies();
   for (std::thread& sender : senders) sender.join();
 
@@ -164,8 +153,7 @@ TEST_F(UnixSocketListener, CutsNobodyOffWhoIsMerelyHeldBack) {
 TEST_F(UnixSocketListener, ChargesEachDeliveryOfAMessage) {
   ListenerLimits limits;
   limits.queuedBytes = 64 * 1024;
-  serve(limits);
-  service->holdReplies();
+  serveHolding(limits);
   constexpr std::size_t kDeliveries = 32;
   constexpr std::size_t kMessages = 50;
   wire::Request message = messageRequest(0, "x");
@@ -173,9 +161,7 @@ TEST_F(UnixSocketListener, ChargesEachDeliveryOfAMessage) {
   RawClient client(path);
 
   for (std::size_t i = 0; i < kMessages; ++i) client.send(message);
-  ASSERT_TRUE(service->waitForCalls(1));
-  std::this_thread::sleep_for(100ms);
-  const std::size_t whileHeld = service->calls().size();
+  const std::size_t whileHeld = callsWhileHeld(1);
   service->releaseReplies();
 
   EXPECT_TRUE(service->waitForCalls(kMessages));
@@ -253,8 +239,7 @@ TEST_F(UnixSocketListener, ServesAClientWithLittleUnderWayHoweverMuchItsUserHas)
   ListenerLimits limits;
   limits.ofUser.queuedBytes = 1024;
   limits.reservedQueuedBytes = 2 * limits::kRequestBytes;
-  serve(limits);
-  service->holdReplies();
+  serveHolding(limits);
   RawClient greedy(path);
   greedy.send(messageRequest(1, std::string(4096, 'x')));
   ASSERT_TRUE(service->waitForCalls(1));
@@ -273,8 +258,7 @@ TEST_F(UnixSocketListener, LeavesWhatItCannotCarryOutInTheSocket) {
   ListenerLimits limits;
   limits.ofUser.queuedBytes = 1024;
   limits.reservedQueuedBytes = 0;
-  serve(limits);
-  service->holdReplies();
+  serveHolding(limits);
   RawClient first(path);
   first.send(messageRequest(1, std::string(4096, 'x')));
   ASSERT_TRUE(service->waitForCalls(1));

@@ -4,7 +4,9 @@
 #include <gtest/gtest.h>
 #include <unistd.h>
 
+#include <chrono>
 #include <condition_variable>
+#include <cstddef>
 #include <functional>
 #include <memory>
 #include <mutex>
@@ -139,6 +141,18 @@ class UnixSocketListener : public testing::Test, public IPCListenerDelegate {
     listener = *std::move(opened.value);
     listener->setDelegate(this);
     thread = std::thread([this] { listener->resume(); });
+  }
+  /// Serves, and answers nothing until the service's replies are released.
+  void serveHolding(const ListenerLimits& limits) {
+    serve(limits);
+    service->holdReplies();
+  }
+  /// How many requests are carried out while replies are held, `least` or more.
+  std::size_t callsWhileHeld(std::size_t least) {
+    EXPECT_TRUE(service->waitForCalls(least));
+    // Those that may not be would be by then.
+    std::this_thread::sleep_for(std::chrono::milliseconds(100));
+    return service->calls().size();
   }
   void stop() {
     if (!thread.joinable()) return;
