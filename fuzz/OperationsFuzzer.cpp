@@ -15,12 +15,10 @@
 #include "Statistics/Service/OstrelReportingServiceMain.h"
 #include "fuzz/Fuzzing.h"
 #include "platform/fake/FakePlatform.h"
-#include "platform/linux/SystemClock.h"
+#include "platform/linux/RealQueues.h"
 #include "platform/linux/TestSockets.h"
 #include "platform/linux/TestSupport.h"
 #include "platform/linux/ThreadPoolWorkQueues.h"
-#include "platform/linux/TimedConditionFactory.h"
-#include "platform/linux/TimerThread.h"
 #include "platform/linux/UnixSocketIPCListener.h"
 
 namespace {
@@ -36,11 +34,7 @@ constexpr int kPatience = 60'000;  // Milliseconds.
 class Service {
  public:
   explicit Service(const std::string& path) : path_(path) {
-    const auto timers = std::make_shared<TimerThread>();
-    queues_ = std::make_shared<ThreadPoolWorkQueues>(timers);
-    platform_.workQueues = queues_;
-    platform_.conditions = std::make_shared<TimedConditionFactory>(timers);
-    platform_.clock = std::make_shared<SystemClock>();
+    queues_ = testing_support::putOnRealQueues(platform_);
     auto opened = UnixSocketIPCListener::open(path, std::make_shared<PeerRegistry>());
     expect(opened.value.has_value());
     listener_ = *std::move(opened.value);

@@ -12,10 +12,8 @@
 #include "Statistics/OstrelReportingUtility.h"
 #include "Statistics/Service/OstrelReportingServiceDelegate.h"
 #include "platform/fake/FakePlatform.h"
-#include "platform/linux/SystemClock.h"
+#include "platform/linux/RealQueues.h"
 #include "platform/linux/ThreadPoolWorkQueues.h"
-#include "platform/linux/TimedConditionFactory.h"
-#include "platform/linux/TimerThread.h"
 
 namespace ostrel {
 namespace {
@@ -42,12 +40,8 @@ class WaitingSessions : public testing::Test {
  protected:
   WaitingSessions() {
     fakes.telemetryBackend->setDiscovery(FakeDiscovery::held());
-    const auto timers = std::make_shared<TimerThread>();
-    queues = std::make_shared<ThreadPoolWorkQueues>(timers);
     platform = fakes.platform();
-    platform.workQueues = queues;
-    platform.conditions = std::make_shared<TimedConditionFactory>(timers);
-    platform.clock = std::make_shared<SystemClock>();
+    queues = testing_support::putOnRealQueues(platform);
     root = OstrelReportingServiceDelegate::init(platform);
   }
 

@@ -14,11 +14,9 @@
 #include "platform/fake/FakePlatform.h"
 #include "platform/linux/DirectoryFileSystem.h"
 #include "platform/linux/JSONTextSerialization.h"
-#include "platform/linux/SystemClock.h"
+#include "platform/linux/RealQueues.h"
 #include "platform/linux/TestSupport.h"
 #include "platform/linux/ThreadPoolWorkQueues.h"
-#include "platform/linux/TimedConditionFactory.h"
-#include "platform/linux/TimerThread.h"
 
 namespace ostrel {
 namespace {
@@ -38,12 +36,8 @@ class LargeSession : public testing::Test {
   LargeSession() {
     forgetIsInternalBuildForTesting();
     fakes.deviceInfo->setAnswer("InternalBuild", Value(true));
-    const auto timers = std::make_shared<TimerThread>();
-    queues = std::make_shared<ThreadPoolWorkQueues>(timers);
     platform = fakes.platform();
-    platform.workQueues = queues;
-    platform.conditions = std::make_shared<TimedConditionFactory>(timers);
-    platform.clock = std::make_shared<SystemClock>();
+    queues = testing_support::putOnRealQueues(platform);
     platform.fileSystem = std::make_shared<DirectoryFileSystem>(directory.path());
     platform.json = std::make_shared<JSONTextSerialization>();
   }

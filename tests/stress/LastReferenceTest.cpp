@@ -18,10 +18,8 @@
 #include "Statistics/OstrelReportingUtility.h"
 #include "Statistics/Service/OstrelReportingServiceDelegate.h"
 #include "platform/fake/FakePlatform.h"
-#include "platform/linux/SystemClock.h"
+#include "platform/linux/RealQueues.h"
 #include "platform/linux/ThreadPoolWorkQueues.h"
-#include "platform/linux/TimedConditionFactory.h"
-#include "platform/linux/TimerThread.h"
 #include "tests/stress/AnsweringBackend.h"
 
 namespace ostrel {
@@ -87,10 +85,8 @@ class LastReference : public testing::Test {
     fakes.deviceInfo->setAnswer("InternalBuild", true);
     trace = std::make_shared<TeardownTrace>(fakes);
     platform = fakes.platform();
-    platform.workQueues = queues;
-    platform.conditions = std::make_shared<HastyConditions>(
-        std::make_shared<TimedConditionFactory>(timers));
-    platform.clock = std::make_shared<SystemClock>();
+    queues = testing_support::putOnRealQueues(platform);
+    platform.conditions = std::make_shared<HastyConditions>(platform.conditions);
     platform.kernelTrace = trace;
   }
   ~LastReference() override { forgetIsInternalBuildForTesting(); }
@@ -126,9 +122,7 @@ class LastReference : public testing::Test {
 
   FakePlatform fakes;
   OstrelReportingPlatform platform;
-  const std::shared_ptr<TimerThread> timers = std::make_shared<TimerThread>();
-  const std::shared_ptr<ThreadPoolWorkQueues> queues =
-      std::make_shared<ThreadPoolWorkQueues>(timers);
+  std::shared_ptr<ThreadPoolWorkQueues> queues;
   std::shared_ptr<TeardownTrace> trace;
 
  private:

@@ -13,10 +13,8 @@
 #include "Statistics/OstrelReportingUtility.h"
 #include "Statistics/Service/OstrelReportingServiceDelegate.h"
 #include "platform/fake/FakePlatform.h"
-#include "platform/linux/SystemClock.h"
+#include "platform/linux/RealQueues.h"
 #include "platform/linux/ThreadPoolWorkQueues.h"
-#include "platform/linux/TimedConditionFactory.h"
-#include "platform/linux/TimerThread.h"
 
 namespace ostrel {
 namespace {
@@ -33,12 +31,8 @@ class SessionStress : public testing::Test {
   SessionStress() {
     forgetIsInternalBuildForTesting();
     fakes.deviceInfo->setAnswer("InternalBuild", true);
-    const auto timers = std::make_shared<TimerThread>();
-    queues = std::make_shared<ThreadPoolWorkQueues>(timers);
     platform = fakes.platform();
-    platform.workQueues = queues;
-    platform.conditions = std::make_shared<TimedConditionFactory>(timers);
-    platform.clock = std::make_shared<SystemClock>();
+    queues = testing_support::putOnRealQueues(platform);
   }
   ~SessionStress() override { forgetIsInternalBuildForTesting(); }
 

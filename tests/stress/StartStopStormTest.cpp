@@ -14,10 +14,8 @@
 #include "Statistics/OstrelReportingUtility.h"
 #include "Statistics/Service/OstrelReportingServiceDelegate.h"
 #include "platform/fake/FakePlatform.h"
-#include "platform/linux/SystemClock.h"
+#include "platform/linux/RealQueues.h"
 #include "platform/linux/ThreadPoolWorkQueues.h"
-#include "platform/linux/TimedConditionFactory.h"
-#include "platform/linux/TimerThread.h"
 #include "tests/stress/AnsweringBackend.h"
 
 namespace ostrel {
@@ -40,14 +38,10 @@ class StartStopStorm : public testing::Test {
  protected:
   StartStopStorm() {
     forgetIsInternalBuildForTesting();
-    const auto timers = std::make_shared<TimerThread>();
-    queues = std::make_shared<ThreadPoolWorkQueues>(timers);
     backend = std::make_shared<AnsweringBackend>(fakes.telemetryBackend, /*seed=*/1);
     platform = fakes.platform();
-    platform.workQueues = queues;
-    platform.conditions = std::make_shared<HastyConditions>(
-        std::make_shared<TimedConditionFactory>(timers));
-    platform.clock = std::make_shared<SystemClock>();
+    queues = testing_support::putOnRealQueues(platform);
+    platform.conditions = std::make_shared<HastyConditions>(platform.conditions);
     platform.telemetryBackend = backend;
     root = OstrelReportingServiceDelegate::init(platform);
     fakes.listener->setDelegate(root.get());
