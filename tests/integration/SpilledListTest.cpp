@@ -43,9 +43,10 @@ std::vector<std::string> entriesOf(const AggregatedPayloadData& list) {
 Record runSession(unsigned seed, std::shared_ptr<EntryStorage> storage,
                   std::size_t* listBytes) {
   forgetIsInternalBuildForTesting();
+  OstrelReportingPlatform platform;  // The fakes may hold the session to their end.
   FakePlatform fakes;
   fakes.deviceInfo->setAnswer("InternalBuild", Value(true));
-  OstrelReportingPlatform platform = fakes.platform();
+  platform = fakes.platform();
   platform.json = std::make_shared<JSONTextSerialization>();
   if (storage) platform.entryStorage = std::move(storage);
   const auto session = OstrelReportingSession::initWithID(
