@@ -17,7 +17,7 @@
 #include "ostrel/OstrelReportingClient.h"
 
 // The sanitizers make system calls and allocate on their own.
-#if !defined(__SANITIZE_THREAD__) && !defined(__SANITIZE_ADDRESS__)
+#ifndef OSTREL_SANITIZED
 
 namespace {
 

@@ -15,7 +15,7 @@
 namespace ostrel::crash {
 
 /// How much slower things are in this build.
-#if defined(__SANITIZE_THREAD__) || defined(__SANITIZE_ADDRESS__)
+#ifdef OSTREL_SANITIZED
 inline constexpr int kSlowness = 10;
 #else
 inline constexpr int kSlowness = 1;

@@ -24,7 +24,7 @@ using testing::HasSubstr;
 using testing::Not;
 using testing_support::ChildProcess;
 
-#if defined(__SANITIZE_THREAD__) || defined(__SANITIZE_ADDRESS__)
+#ifdef OSTREL_SANITIZED
 // Sanitizers keep several times the memory of what they watch, and what was freed too.
 constexpr bool kMemoryIsBounded = false;
 #else
@@ -37,7 +37,7 @@ constexpr std::size_t kMostResidentWithStartsKiB = 192 * 1024;
 constexpr std::string_view kMakesStarts = "leaves-while-starting";
 
 // Those of the pools are made when they are first needed and stay.
-#if defined(__SANITIZE_THREAD__)
+#ifdef OSTREL_THREAD_SANITIZED
 constexpr std::size_t kMostThreads = 17;  // One is the sanitizer's.
 #else
 constexpr std::size_t kMostThreads = 16;

@@ -24,7 +24,7 @@ constexpr int kSessions = 10'000;
 constexpr std::size_t kMostThreads = 16;
 // What the sessions' own steps may take; many times that where the thread sanitizer
 // watches them.
-#if defined(__SANITIZE_THREAD__) || defined(__SANITIZE_ADDRESS__)
+#ifdef OSTREL_SANITIZED
 constexpr std::chrono::milliseconds kLateness{10'000};
 #else
 constexpr std::chrono::milliseconds kLateness{1500};

@@ -24,8 +24,7 @@ namespace {
 using std::chrono::steady_clock;
 
 // Fewer where the compiler was told not to be fast.
-#if defined(__SANITIZE_THREAD__) || defined(__SANITIZE_ADDRESS__) || \
-    !defined(__OPTIMIZE__)
+#if defined(OSTREL_SANITIZED) || !defined(__OPTIMIZE__)
 constexpr int kMessages = 50'000;
 #else
 constexpr int kMessages = 1'000'000;

@@ -28,7 +28,7 @@ namespace {
 constexpr int kSessions = 200;
 constexpr int kStormThreads = 8;
 // Fewer where every access is watched.
-#if defined(__SANITIZE_THREAD__) || defined(__SANITIZE_ADDRESS__)
+#ifdef OSTREL_SANITIZED
 constexpr int kStormSessions = 250;
 #else
 constexpr int kStormSessions = 2500;
