@@ -2,7 +2,6 @@
 // and nothing thrown across.
 #include <chrono>
 #include <exception>
-#include <new>
 #include <optional>
 #include <utility>
 #include <vector>

@@ -1,6 +1,5 @@
 #pragma once
 
-#include <map>
 #include <mutex>
 #include <string>
 #include <vector>

@@ -11,7 +11,6 @@
 #include <algorithm>
 #include <cerrno>
 #include <cstring>
-#include <span>
 
 #include "platform/linux/ChannelFileFormat.h"
 #include "platform/linux/FileDescriptor.h"

@@ -11,7 +11,6 @@
 #include <sys/un.h>
 
 #include <algorithm>
-#include <array>
 #include <cerrno>
 #include <climits>
 #include <cstdint>

@@ -3,11 +3,8 @@
 #include "platform/linux/ValueJSONReader.h"
 
 #include <chrono>
-#include <cmath>
-#include <limits>
 #include <memory>
 #include <nlohmann/json.hpp>
-#include <variant>
 #include <vector>
 
 #include "platform/linux/Limits.h"
