@@ -3,6 +3,8 @@
 
 #include <CLI/CLI.hpp>
 #include <functional>
+#include <string>
+#include <vector>
 
 #include "ostrelctl/ChannelsCommand.h"
 #include "ostrelctl/Commands.h"
@@ -147,6 +149,19 @@ void addChannelsCommands(CLI::App& app, const Tool& tool, Arguments& arguments) 
       ->required();
 }
 
+// What is wrong with the line. Of a command that there is not, the parser only says that
+// one is missing.
+std::string sentenceOf(const CLI::ParseError& error, const CLI::App& app) {
+  const CLI::App* chosen = &app;
+  while (!chosen->get_subcommands().empty()) chosen = chosen->get_subcommands().front();
+  const std::vector<std::string> unknown = chosen->remaining();
+  if (chosen->get_require_subcommand_min() != 0 && !unknown.empty() &&
+      !unknown.front().starts_with('-')) {
+    return "there is no command \"" + unknown.front() + '"';
+  }
+  return error.what();
+}
+
 }  // namespace
 
 int runTool(const Tool& tool, int argc, const char* const* argv) {
@@ -163,7 +178,7 @@ int runTool(const Tool& tool, int argc, const char* const* argv) {
   } catch (const CLI::ParseError& error) {
     // Help and the version are errors to the parser as well.
     if (error.get_exit_code() == 0) return app.exit(error, tool.out, tool.err);
-    tool.fail(std::string(error.what()) + "; see \"ostrelctl --help\"");
+    tool.fail(sentenceOf(error, app) + "; see \"ostrelctl --help\"");
     return Tool::kWrongUsage;
   }
   return arguments.command();

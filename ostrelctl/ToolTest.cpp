@@ -101,6 +101,13 @@ TEST_F(ToolTest, EndsWithStatusTwoOnWrongUsage) {
   EXPECT_NE(err_.str(), "");
 }
 
+TEST_F(ToolTest, SaysWhichCommandThereIsNot) {
+  EXPECT_EQ(run({"dance", "--json"}), 2);
+  EXPECT_THAT(err_.str(), HasSubstr("there is no command \"dance\"; see"));
+  EXPECT_EQ(run({"channels", "close"}), 2);
+  EXPECT_THAT(err_.str(), HasSubstr("there is no command \"close\"; see"));
+}
+
 TEST_F(ToolTest, PrintsItsVersion) {
   EXPECT_EQ(run({"--version"}), 0);
   EXPECT_THAT(out_.str(), ::testing::StartsWith("ostrelctl "));
