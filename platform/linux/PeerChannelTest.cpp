@@ -4,13 +4,17 @@
 
 #include <string>
 
+#include "platform/linux/PeerChannelTestSupport.h"
+
 namespace ostrel {
 namespace {
 
 constexpr std::size_t kMostUnread = 1000;
 
-class PeerChannelTest : public testing::Test {
+class PeerChannelTest : public testing_support::ChannelsOfAUser {
  protected:
+  PeerChannelTest() : ChannelsOfAUser(kMostUnread) {}
+
   /// A reply whose frame has `size` bytes.
   static std::string textForFrameOf(std::size_t size) {
     std::string frame;
@@ -28,13 +32,7 @@ class PeerChannelTest : public testing::Test {
     channel_.reply(1, ErrorObject{"", 0, textForFrameOf(size)});
   }
 
-  const std::shared_ptr<ServiceAccount> service_{
-      new ServiceAccount{Share(10), Share(1000)}};
-  const std::shared_ptr<UserAccount> user_ = std::make_shared<UserAccount>(
-      1000, UserAccount::Limits{/*queuedBytes=*/100, /*sessions=*/10, /*keptBytes=*/500},
-      service_);
-  PeerChannel channel_{1, std::make_shared<LoopWaker>(), user_,
-                       PeerChannel::Limits{/*queuedBytes=*/60, kMostUnread}};
+  PeerChannel channel_ = makeChannel(1);
 };
 
 using PeerChannelReplies = PeerChannelTest;
@@ -42,8 +40,7 @@ using PeerChannelBudget = PeerChannelTest;
 
 TEST_F(PeerChannelReplies, StayUnreadUpToTheLimit) {
   for (const std::size_t second : {499, 500}) {
-    PeerChannel channel(1, std::make_shared<LoopWaker>(), user_,
-                        PeerChannel::Limits{/*queuedBytes=*/60, kMostUnread});
+    PeerChannel channel = makeChannel(1);
     channel.reply(1, ErrorObject{"", 0, textForFrameOf(500)});
     channel.reply(1, ErrorObject{"", 0, textForFrameOf(second)});
     EXPECT_FALSE(channel.hasTooManyUnread()) << second;
@@ -70,8 +67,7 @@ TEST_F(PeerChannelBudget, IsTheConnectionsOwn) {
 }
 
 TEST_F(PeerChannelBudget, IsThatOfAllConnectionsOfTheUserToo) {
-  PeerChannel other(2, std::make_shared<LoopWaker>(), user_,
-                    PeerChannel::Limits{/*queuedBytes=*/60, kMostUnread});
+  PeerChannel other = makeChannel(2);
   channel_.charge(50);
   other.charge(50);
   EXPECT_FALSE(other.isOverBudget());
@@ -84,8 +80,7 @@ TEST_F(PeerChannelBudget, IsThatOfAllConnectionsOfTheUserToo) {
 
 TEST_F(PeerChannelBudget, IsGivenBackWithTheConnectionsRequests) {
   {
-    PeerChannel other(2, std::make_shared<LoopWaker>(), user_,
-                      PeerChannel::Limits{/*queuedBytes=*/60, kMostUnread});
+    PeerChannel other = makeChannel(2);
     other.chargeRequest(40);
   }
   EXPECT_EQ(user_->queued().used(), 0u);

@@ -4,18 +4,20 @@
 #include <optional>
 #include <string>
 
-#include "platform/linux/PeerChannel.h"
+#include "platform/linux/PeerChannelTestSupport.h"
 
 namespace ostrel {
 namespace {
 
-class UnreadReplies : public testing::Test {
+class UnreadReplies : public testing_support::ChannelsOfAUser {
  protected:
   static constexpr std::size_t kMost = 100'000;
   static constexpr std::size_t kMostOfUser = 2000;
 
+  UnreadReplies() : ChannelsOfAUser(kMost, limitsOfUser()) {}
+
   static UserAccount::Limits limitsOfUser() {
-    UserAccount::Limits limits{/*queuedBytes=*/100, /*sessions=*/10, /*keptBytes=*/500};
+    UserAccount::Limits limits = kLimitsOfUser;
     limits.unreadBytes = kMostOfUser;
     return limits;
   }
@@ -36,13 +38,7 @@ class UnreadReplies : public testing::Test {
     leaveUnread(channel, bytes - channel.unreadBytes() - bare);
   }
 
-  const std::shared_ptr<ServiceAccount> service_{
-      new ServiceAccount{Share(10), Share(1000)}};
-  const std::shared_ptr<UserAccount> user_ =
-      std::make_shared<UserAccount>(1000, limitsOfUser(), service_);
-  const std::shared_ptr<LoopWaker> waker_ = std::make_shared<LoopWaker>();
-  const PeerChannel::Limits limits_{/*queuedBytes=*/60, kMost};
-  PeerChannel channel_{1, waker_, user_, limits_};
+  PeerChannel channel_ = makeChannel(1);
 };
 
 TEST_F(UnreadReplies, OfOthersLeaveAClientItsRoomUpToTheLimitOfTheirUser) {
@@ -58,12 +54,12 @@ TEST_F(UnreadReplies, OfOthersLeaveAClientItsRoomUpToTheLimitOfTheirUser) {
 }
 
 TEST_F(UnreadReplies, BeyondItAreFewForEachClient) {
-  PeerChannel other(2, waker_, user_, limits_);
+  PeerChannel other = makeChannel(2);
   leaveUnread(other, 3000);
   for (const std::size_t more :
        {limits::kUnreadReplyBytesInNeed - 1, limits::kUnreadReplyBytesInNeed,
         limits::kUnreadReplyBytesInNeed + 1}) {
-    PeerChannel channel(3, waker_, user_, limits_);
+    PeerChannel channel = makeChannel(3);
     fill(channel, limits::kUnreadReplyBytesInNeed - 1000);
     ASSERT_FALSE(channel.hasTooManyUnread());
     leaveUnread(channel, 500);
