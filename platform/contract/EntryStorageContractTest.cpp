@@ -4,6 +4,7 @@
 #include "platform/fake/CountingAccount.h"
 #include "platform/fake/FakeEntryStorage.h"
 #include "platform/linux/FileEntryStorage.h"
+#include "platform/linux/StoredEntriesTesting.h"
 #include "platform/linux/TestSupport.h"
 
 namespace ostrel {
@@ -30,22 +31,9 @@ struct EntriesInFile {
                            SpillCalls::system()};
 };
 
-std::span<const std::uint8_t> asBytes(std::string_view text) {
-  return {reinterpret_cast<const std::uint8_t*>(text.data()), text.size()};
-}
-
-bool append(StoredEntries& entries, std::string_view text,
-            const std::shared_ptr<PayloadAccount>& account = nullptr) {
-  const StoredEntries::Bytes parts[] = {asBytes(text)};
-  return entries.append(parts, account);
-}
-
-std::string bytesOf(const StoredEntries::Snapshot& snapshot) {
-  std::string all;
-  EXPECT_TRUE(snapshot.forEachRun(
-      [&](StoredEntries::Bytes run) { all.append(run.begin(), run.end()); }));
-  return all;
-}
+using testing_support::append;
+using testing_support::asBytes;
+using testing_support::bytesOf;
 
 std::string entryOf(std::size_t number, std::size_t size) {
   std::string entry = std::to_string(number) + ':';

@@ -10,28 +10,20 @@
 #include <random>
 
 #include "platform/linux/Limits.h"
+#include "platform/linux/OwnProcess.h"
 #include "platform/linux/SpillFaults.h"
+#include "platform/linux/StoredEntriesTesting.h"
 #include "platform/linux/TestSupport.h"
 
 namespace ostrel {
 namespace {
 
+using testing_support::append;
+using testing_support::bytesOf;
+
 constexpr ReporterID kSession{42};
 constexpr std::chrono::milliseconds kNoPause{0};
 constexpr std::size_t kFirstChunk = 1024;
-
-bool append(StoredEntries& entries, std::string_view text) {
-  const StoredEntries::Bytes parts[] = {
-      {reinterpret_cast<const std::uint8_t*>(text.data()), text.size()}};
-  return entries.append(parts, nullptr);
-}
-
-std::string bytesOf(const StoredEntries::Snapshot& snapshot) {
-  std::string all;
-  EXPECT_TRUE(snapshot.forEachRun(
-      [&](StoredEntries::Bytes run) { all.append(run.begin(), run.end()); }));
-  return all;
-}
 
 // The descriptors of files without a name below `directory`.
 std::vector<int> namelessFiles(const std::string& directory) {
@@ -44,12 +36,6 @@ std::vector<int> namelessFiles(const std::string& directory) {
     }
   }
   return found;
-}
-
-std::size_t openDescriptors() {
-  return static_cast<std::size_t>(
-      std::distance(std::filesystem::directory_iterator("/proc/self/fd"),
-                    std::filesystem::directory_iterator()));
 }
 
 class FileEntryStorageTest : public testing::Test {
@@ -133,7 +119,7 @@ TEST_F(FileEntryStorageTest, ReadsBackWithoutHavingTheListInMemory) {
 }
 
 TEST_F(FileEntryStorageTest, HasOneFileThatOnlyTheServiceCanRead) {
-  const std::size_t before = openDescriptors();
+  const std::size_t before = testing_support::openDescriptors();
   FileEntryStorage storage = storageOf(/*bytesOfList=*/1, /*bytesOfAll=*/1);
   std::vector<std::unique_ptr<StoredEntries>> lists;
   for (int i = 0; i < 20; ++i) {
@@ -141,7 +127,7 @@ TEST_F(FileEntryStorageTest, HasOneFileThatOnlyTheServiceCanRead) {
     for (int j = 0; j < 20; ++j) append(*lists.back(), std::string(500, 'x'));
   }
   EXPECT_TRUE(std::filesystem::is_empty(directory_.path()));
-  EXPECT_EQ(openDescriptors(), before + 1);
+  EXPECT_EQ(testing_support::openDescriptors(), before + 1);
   const auto files = namelessFiles(directory_.path());
   ASSERT_EQ(files.size(), 1u);
   struct stat status {};
@@ -150,7 +136,7 @@ TEST_F(FileEntryStorageTest, HasOneFileThatOnlyTheServiceCanRead) {
   EXPECT_EQ(status.st_nlink, 0u);
   EXPECT_EQ(::fcntl(files[0], F_GETFD), FD_CLOEXEC);
   lists.clear();
-  EXPECT_EQ(openDescriptors(), before);
+  EXPECT_EQ(testing_support::openDescriptors(), before);
 }
 
 TEST_F(FileEntryStorageTest, LeavesNoFileBehindWhereEachHasAName) {

@@ -9,11 +9,11 @@
 #include <chrono>
 #include <cstring>
 #include <filesystem>
-#include <iterator>
 #include <string>
 #include <string_view>
 #include <thread>
 
+#include "platform/linux/OwnProcess.h"
 #include "platform/linux/UnixSocketIPCListenerTestSupport.h"
 
 namespace ostrel {
@@ -23,12 +23,6 @@ using namespace std::chrono_literals;
 using namespace testing_support;
 using testing::ElementsAre;
 using testing::HasSubstr;
-
-std::size_t openDescriptors() {
-  return static_cast<std::size_t>(
-      std::distance(std::filesystem::directory_iterator("/proc/self/fd"),
-                    std::filesystem::directory_iterator()));
-}
 
 TEST_F(UnixSocketListener, CarriesOutRequestsInTheirOrder) {
   serve();

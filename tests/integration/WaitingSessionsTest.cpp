@@ -3,7 +3,6 @@
 #include <gtest/gtest.h>
 
 #include <chrono>
-#include <filesystem>
 #include <future>
 #include <iterator>
 #include <memory>
@@ -12,6 +11,7 @@
 #include "Statistics/OstrelReportingUtility.h"
 #include "Statistics/Service/OstrelReportingServiceDelegate.h"
 #include "platform/fake/FakePlatform.h"
+#include "platform/linux/OwnProcess.h"
 #include "platform/linux/RealQueues.h"
 #include "platform/linux/ThreadPoolWorkQueues.h"
 
@@ -29,12 +29,6 @@ constexpr std::chrono::milliseconds kLateness{10'000};
 #else
 constexpr std::chrono::milliseconds kLateness{1500};
 #endif
-
-std::size_t threadsOfProcess() {
-  return static_cast<std::size_t>(
-      std::distance(std::filesystem::directory_iterator("/proc/self/task"),
-                    std::filesystem::directory_iterator()));
-}
 
 class WaitingSessions : public testing::Test {
  protected:
@@ -99,7 +93,7 @@ TEST_F(WaitingSessions, AreAllDetachedAfterNineSecondsAndHoldNoThread) {
     answered.get_future().wait();
     longestReply =
         std::max<std::chrono::nanoseconds>(longestReply, steady_clock::now() - asked);
-    mostThreads = std::max(mostThreads, threadsOfProcess());
+    mostThreads = std::max(mostThreads, testing_support::threadsOfProcess());
     ++repliesWhileWaiting;
   }
   const auto took = steady_clock::now() - begin;

@@ -2,10 +2,10 @@
 
 #include <array>
 #include <atomic>
-#include <filesystem>
 #include <thread>
 #include <vector>
 
+#include "platform/linux/OwnProcess.h"
 #include "platform/linux/ThreadPoolWorkQueues.h"
 #include "platform/linux/TimedConditionFactory.h"
 
@@ -15,11 +15,6 @@ namespace {
 using std::chrono::steady_clock;
 
 constexpr std::size_t kMostThreads = 16;
-
-std::size_t threadsOfThisProcess() {
-  const std::filesystem::directory_iterator tasks("/proc/self/task");
-  return static_cast<std::size_t>(std::distance(begin(tasks), end(tasks)));
-}
 
 class WorkQueueStress : public testing::Test {
  protected:
@@ -71,7 +66,7 @@ TEST_F(WorkQueueStress, TenThousandQueuesThatWaitHoldNoThread) {
   ASSERT_TRUE(drain());
   const auto allWait = steady_clock::now() - begin;
   ASSERT_LT(allWait, kTimeout) << "the first timed out before the last waited";
-  EXPECT_LE(threadsOfThisProcess(), kMostThreads);
+  EXPECT_LE(testing_support::threadsOfProcess(), kMostThreads);
 
   // The others are served meanwhile.
   const auto other = makeQueue();
@@ -86,7 +81,7 @@ TEST_F(WorkQueueStress, TenThousandQueuesThatWaitHoldNoThread) {
   timers_->scheduleAfter(kTimeout, [&isOver] { isOver = true; });
   std::size_t mostThreads = 0;
   while (!isOver) {
-    mostThreads = std::max(mostThreads, threadsOfThisProcess());
+    mostThreads = std::max(mostThreads, testing_support::threadsOfProcess());
     std::this_thread::sleep_for(std::chrono::milliseconds(10));
   }
   ASSERT_TRUE(drain());
