@@ -226,12 +226,16 @@ class FaultyService : public ::testing::TestWithParam<FailingCall> {
     endFaults();
   }
 
-  // Clients come, send and go; none waits for long.
-  void serveUnderFaults() {
+  void startAndSend() {
     start();
     ASSERT_TRUE(isAnswered(5s));
     sendAndStop(service_->socketPath(), sent_);
     sent_ += kMessages;
+  }
+
+  // Clients come, send and go; none waits for long.
+  void serveUnderFaults() {
+    ASSERT_NO_FATAL_FAILURE(startAndSend());
     ASSERT_TRUE(service_->waitForRows(kNumbers, static_cast<std::size_t>(sent_)));
     stored_ = sent_;
     beginFaults();
@@ -253,10 +257,7 @@ class FaultyService : public ::testing::TestWithParam<FailingCall> {
   }
 
   void endUnderFaults() {
-    start();
-    ASSERT_TRUE(isAnswered(5s));
-    sendAndStop(service_->socketPath(), sent_);
-    sent_ += kMessages;
+    ASSERT_NO_FATAL_FAILURE(startAndSend());
     beginFaults();
     const auto begin = SteadyClock::now();
     ::kill(service_->process().pid(), SIGTERM);

@@ -34,6 +34,14 @@ class StoreTest : public ::testing::Test {
     wattlog_ = std::make_unique<StoreWattlogSink>(store_);
   }
 
+  // A store in which a few messages may wait, and do for long.
+  void openWithSmallQueue() {
+    StoreOptions options;
+    options.queuedBytes = 4096;
+    options.commitWindow = std::chrono::hours(1);
+    open(options);
+  }
+
   void close() {
     analytics_.reset();
     wattlog_.reset();
@@ -283,10 +291,7 @@ TEST_F(StoreTest, WritesPowerEvents) {
 }
 
 TEST_F(StoreTest, RefusesMessagesBeyondTheBound) {
-  StoreOptions options;
-  options.queuedBytes = 4096;
-  options.commitWindow = std::chrono::hours(1);
-  open(options);
+  openWithSmallQueue();
   auto session = makeSession(1);
   const Dictionary payload{{"text", Value(std::string(1000, 'x'))}};
   int accepted = 0;
@@ -307,10 +312,7 @@ TEST_F(StoreTest, RefusesMessagesBeyondTheBound) {
 }
 
 TEST_F(StoreTest, CountsOnlyTheOwnBytesOfAMessageThatSharesItsBuffer) {
-  StoreOptions options;
-  options.queuedBytes = 4096;
-  options.commitWindow = std::chrono::hours(1);
-  open(options);
+  openWithSmallQueue();
   auto session = makeSession(1);
   std::string burst(64 * 1024, '\0');
   const auto own = kPayload.value().bytes();
