@@ -1,6 +1,8 @@
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <chrono>
+#include <unordered_set>
 
 #include "Statistics/Service/OstrelReportingServiceMain.h"
 #include "Statistics/Service/ServiceTestFixture.h"
@@ -398,6 +400,29 @@ TEST_F(OstrelReportingServiceConnection, FindsNoSessionOfAClientThatIsRemoved) {
   fakes.runUntilIdle();
 
   EXPECT_EQ(replies, (Replies{"{reporterID: 0, serviceType: 65535}", "()"}));
+}
+
+// In a table that takes an ID as its own hash they would all meet in one place.
+TEST_F(OstrelReportingServiceConnection, SpreadsSessionsWhoseIDsAreChosenToMeet) {
+  constexpr std::size_t kSessions = 3000;
+  std::unordered_set<std::int64_t> grown;
+  for (std::size_t i = 0; i < kSessions; ++i) grown.insert(static_cast<std::int64_t>(i));
+  const auto step = static_cast<std::int64_t>(grown.bucket_count());
+  const auto client = connect(kPid);
+
+  for (std::size_t i = 1; i <= kSessions; ++i) {
+    client->createReportingSession(ReporterID{static_cast<std::int64_t>(i) * step},
+                                   /*reply=*/nullptr);
+  }
+  fakes.runUntilIdle();
+
+  const auto& sessions = client->clientReportingSessionMap();
+  ASSERT_EQ(sessions.size(), kSessions);
+  std::size_t most = 0;
+  for (std::size_t bucket = 0; bucket < sessions.bucket_count(); ++bucket) {
+    most = std::max(most, sessions.bucket_size(bucket));
+  }
+  EXPECT_LT(most, 30u);
 }
 
 TEST_F(OstrelReportingServiceConnection, ServesALateRequestOfARemovedClientOnItsOwnMap) {

@@ -17,6 +17,7 @@
 #include "platform/ChangeNotification.h"
 #include "platform/IPCListener.h"
 #include "platform/OstrelReportingPlatform.h"
+#include "platform/SpreadHash.h"
 #include "platform/ThreadAnnotations.h"
 #include "platform/WorkQueue.h"
 
@@ -130,7 +131,7 @@ class OstrelReportingServerInstance final
       public std::enable_shared_from_this<OstrelReportingServerInstance> {
  public:
   using SessionMap =
-      std::unordered_map<ReporterID, std::shared_ptr<OstrelReportingSession>>;
+      std::unordered_map<ReporterID, std::shared_ptr<OstrelReportingSession>, SpreadHash>;
 
   /// `outError` is never written.
   static std::shared_ptr<OstrelReportingServerInstance> initWithMasterAndID(
