@@ -67,11 +67,10 @@ class Summary {
     group.hasText = true;
   }
 
-  /// Blank is what the second walk did not come to, for want of a readable list.
+  /// Blank is what the second walk did not come to, for want of a list that reads as it
+  /// did before.
   Dictionary finish() {
-    if (writtenValues_ != groupOfValue_.size()) {
-      for (const Group& group : groups_) std::fill_n(group.text, group.textBytes, ' ');
-    }
+    for (const Group& group : groups_) std::fill_n(group.text, group.textBytes, ' ');
     return Dictionary(event_, std::as_const(event_).data());
   }
 

@@ -149,6 +149,65 @@ TEST_F(OstrelReportingSessionSummary, HasBlanksForWhatCouldBeReadOnlyOnce) {
                         {"b", "{x: 1}       "}}));
 }
 
+// A list of two entries that gives its first when it is read first, and its second when
+// it is read again.
+class EntriesThatChange final : public StoredEntries {
+ public:
+  bool append(std::span<const Bytes> parts,
+              const std::shared_ptr<PayloadAccount>& /*account*/) override {
+    std::string& entry = entries_->emplace_back();
+    for (const Bytes part : parts) entry.append(part.begin(), part.end());
+    return true;
+  }
+  std::shared_ptr<const Snapshot> snapshot() override {
+    return std::make_shared<Reading>(entries_);
+  }
+
+ private:
+  using Entries = std::vector<std::string>;
+  class Reading final : public Snapshot {
+   public:
+    explicit Reading(std::shared_ptr<const Entries> entries)
+        : entries_(std::move(entries)) {}
+    bool forEachRun(const RunCallback& callback) const override {
+      const std::string& entry = entries_->at(readings_++);
+      callback({reinterpret_cast<const std::uint8_t*>(entry.data()), entry.size()});
+      return true;
+    }
+
+   private:
+    const std::shared_ptr<const Entries> entries_;
+    mutable std::size_t readings_ = 0;
+  };
+
+  const std::shared_ptr<Entries> entries_ = std::make_shared<Entries>();
+};
+
+class StorageThatChanges final : public EntryStorage {
+ public:
+  std::unique_ptr<StoredEntries> makeEntries(ReporterID /*session*/) override {
+    return std::make_unique<EntriesThatChange>();
+  }
+};
+
+TEST_F(OstrelReportingSessionSummary, HasBlanksWhereAListReadsShorterTheSecondTime) {
+  StorageThatChanges storage;
+  OstrelReportingAggregatedPayloads list(storage, ReporterID{42});
+  list.append("a", {{"x", 1000}});
+  list.append("a", {{"x", 1}});
+  EXPECT_EQ(summaryEvent(ServiceType{3}, list.snapshot()),
+            (Dictionary{{"Ostrel_Session_Summary_Event", "3"}, {"a", "{x: 1}   "}}));
+}
+
+TEST_F(OstrelReportingSessionSummary, HasNoMoreThanItsPlaceOfAListThatReadsLonger) {
+  StorageThatChanges storage;
+  OstrelReportingAggregatedPayloads list(storage, ReporterID{42});
+  list.append("a", {{"x", 1}});
+  list.append("a", {{"x", 1000}});
+  EXPECT_EQ(summaryEvent(ServiceType{3}, list.snapshot()),
+            (Dictionary{{"Ostrel_Session_Summary_Event", "3"}, {"a", "{x: 10"}}));
+}
+
 TEST_F(OstrelReportingSessionSummary, GroupsEachKeyOfAnEntryOfSeveral) {
   OstrelReportingAggregatedPayloads list(*fakes.entryStorage, ReporterID{42});
   list.append({{"device_orientation", "normal"}, {"device_orientation_time", 1.5}});
