@@ -6,6 +6,8 @@
 
 #include <algorithm>
 
+#include "platform/SpreadHash.h"
+
 namespace ostrel {
 namespace {
 
@@ -14,27 +16,15 @@ constexpr std::size_t kFewestSlots = 16;
 // So many IDs in a row have homes in a row: slots that share a line of the cache.
 constexpr std::uint64_t kRow = 4;
 
-// The system puts the stack and code at another place in each process.
-std::uint64_t makeSeed() {
-  static const char place = 0;
-  const char here = 0;
-  return reinterpret_cast<std::uintptr_t>(&place) * 0x9E3779B97F4A7C15 ^
-         reinterpret_cast<std::uintptr_t>(&here);
-}
-
 }  // namespace
 
 OstrelReportingSessionIndex::OstrelReportingSessionIndex()
-    : seed_(makeSeed()), slots_(kFewestSlots), bearers_(kFewestSlots) {}
+    : slots_(kFewestSlots), bearers_(kFewestSlots) {}
 
 // Clients count their sessions, so that IDs in a row are asked for in a row.
 std::size_t OstrelReportingSessionIndex::home(ReporterID reporterID) const {
   const auto id = static_cast<std::uint64_t>(reporterID);
-  std::uint64_t hash = id / kRow ^ seed_;
-  hash = (hash ^ (hash >> 32)) * 0xD6E8FEB86659FD93;
-  hash = (hash ^ (hash >> 32)) * 0xD6E8FEB86659FD93;
-  hash ^= hash >> 32;
-  return (hash * kRow + id % kRow) & (slots_.size() - 1);
+  return (SpreadHash()(id / kRow) * kRow + id % kRow) & (slots_.size() - 1);
 }
 
 OstrelReportingSessionIndex::Owner OstrelReportingSessionIndex::ownerAt(

@@ -70,8 +70,6 @@ class OstrelReportingSessionIndex {
   void vacate(std::size_t at);
   void resize(std::size_t slots);
 
-  // IDs are the clients' choice. Which of them meet in a slot nobody can foresee.
-  const std::uint64_t seed_;
   std::size_t used_ = 0;
   std::vector<Slot> slots_;  // A power of two.
   std::vector<Bearer> bearers_;
