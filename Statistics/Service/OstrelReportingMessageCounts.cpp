@@ -1,6 +1,7 @@
 #include "Statistics/Service/OstrelReportingMessageCounts.h"
 
 #include <algorithm>
+#include <charconv>
 #include <functional>
 
 namespace ostrel {

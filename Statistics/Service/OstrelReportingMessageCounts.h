@@ -1,7 +1,6 @@
 #pragma once
 
 #include <array>
-#include <charconv>
 #include <cstdint>
 #include <map>
 #include <string>
@@ -21,7 +20,7 @@ class MessageIdentifier {
   std::string_view text() const { return {text_.data(), size_}; }
 
  private:
-  // The longest name has 41 characters, the longest number 20.
+  // The longest name has 39 characters, the longest number 20.
   std::array<char, 64> text_;
   std::size_t size_;
 };

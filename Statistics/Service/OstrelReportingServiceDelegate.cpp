@@ -9,8 +9,6 @@
 
 #include <algorithm>
 #include <cmath>
-#include <limits>
-#include <mutex>
 #include <utility>
 
 #include "Statistics/OstrelReportingUtility.h"
@@ -207,13 +205,12 @@ void OstrelReportingServiceDelegate::indexSession(OstrelReportingSession& sessio
 
 std::shared_ptr<OstrelReportingSession>
 OstrelReportingServiceDelegate::findReportingSessionForID(ReporterID reporterID) const {
-  OstrelReportingSession* const session =
-      findReportingSessionForID(reporterID, Borrowed());
+  OstrelReportingSession* const session = borrowReportingSessionForID(reporterID);
   return session != nullptr ? session->shared_from_this() : nullptr;
 }
 
-OstrelReportingSession* OstrelReportingServiceDelegate::findReportingSessionForID(
-    ReporterID reporterID, Borrowed) const {
+OstrelReportingSession* OstrelReportingServiceDelegate::borrowReportingSessionForID(
+    ReporterID reporterID) const {
   if (reporterID == kNoReporter || !reportingEnabled()) return nullptr;
   OstrelReportingSession* const session = sessionIndex_.find(reporterID);
   if (session == nullptr) {
@@ -452,8 +449,7 @@ void OstrelReportingServerInstance::sendMessageStep(
   } else {
     for (const ReporterID reporterID : *reportingIDs) {
       if (reporterID == kNoReporter) continue;
-      if (auto* const session = master_->findReportingSessionForID(
-              reporterID, OstrelReportingServiceDelegate::Borrowed())) {
+      if (auto* const session = master_->borrowReportingSessionForID(reporterID)) {
         session->sendMessage(message, category, type, /*reply=*/nullptr);
       }
     }

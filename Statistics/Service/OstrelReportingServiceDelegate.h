@@ -97,8 +97,7 @@ class OstrelReportingServiceDelegate final
   void defaultsChangedStep(int token) OSTREL_ON_QUEUE(serverQueueRole);
 
   // The same without a reference: the session lives as long as its client's map.
-  struct Borrowed {};
-  OstrelReportingSession* findReportingSessionForID(ReporterID reporterID, Borrowed) const
+  OstrelReportingSession* borrowReportingSessionForID(ReporterID reporterID) const
       OSTREL_ON_QUEUE(serverQueueRole);
 
   // The index of the sessions of registered clients, so that a look-up does not walk
@@ -111,8 +110,7 @@ class OstrelReportingServiceDelegate final
   const OstrelReportingPlatform& platform_;
   std::shared_ptr<OstrelReportingDriverUtility> driverUtility_;
 
-  // On the queue. The index holds sessions of members of
-  // `clients_`.
+  // On the queue. The index holds sessions of members of `clients_`.
   Clients clients_ OSTREL_GUARDED_BY(serverQueueRole);
   OstrelReportingSessionIndex sessionIndex_ OSTREL_GUARDED_BY(serverQueueRole);
   std::uint64_t registrations_ OSTREL_GUARDED_BY(serverQueueRole) = 0;
