@@ -6,7 +6,7 @@
 #include <span>
 
 #include "Statistics/OstrelReportingTypes.h"
-#include "platform/Value.h"
+#include "platform/ValueBuffer.h"
 
 namespace ostrel {
 

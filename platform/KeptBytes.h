@@ -4,7 +4,7 @@
 #include <memory>
 #include <unordered_map>
 
-#include "platform/Value.h"
+#include "platform/ValueBuffer.h"
 
 namespace ostrel {
 

@@ -6,8 +6,8 @@
 #include <bit>
 #include <charconv>
 #include <cmath>
+#include <cstring>
 #include <limits>
-#include <new>
 
 namespace ostrel {
 namespace {
@@ -222,46 +222,30 @@ void appendScalarDescription(std::string& out, ValueView value) {
   }
 }
 
+template <typename Encode>
+std::string encoded(Encode encode) {
+  std::string bytes;
+  ValueEncoder encoder(bytes);
+  encode(encoder);
+  return bytes;
+}
+
+std::span<const std::uint8_t> asBytes(std::string_view text) {
+  return {reinterpret_cast<const std::uint8_t*>(text.data()), text.size()};
+}
+
+Dictionary joined(std::initializer_list<std::span<const std::uint8_t>> parts,
+                  std::shared_ptr<PayloadAccount> account) {
+  std::size_t size = 0;
+  for (const auto part : parts) size += part.size();
+  ValueBuffer buffer = ValueBuffer::make(size, std::move(account));
+  std::uint8_t* at = buffer.data();
+  for (const auto part : parts) at = std::ranges::copy(part, at).out;
+  const std::uint8_t* const item = std::as_const(buffer).data();
+  return Dictionary(std::move(buffer), item);
+}
+
 }  // namespace
-
-ValueBuffer ValueBuffer::makeUncharged(std::size_t size,
-                                       std::shared_ptr<PayloadAccount> account) {
-  void* memory = ::operator new(sizeof(Header) + size);
-  auto* header = new (memory) Header;
-  header->size = size;
-  header->account = std::move(account);
-  ValueBuffer buffer;
-  buffer.header_ = header;
-  return buffer;
-}
-
-ValueBuffer ValueBuffer::make(std::size_t size, std::shared_ptr<PayloadAccount> account) {
-  ValueBuffer buffer = makeUncharged(size, std::move(account));
-  buffer.charge(buffer.memory());
-  return buffer;
-}
-
-ValueBuffer ValueBuffer::copyOf(std::span<const std::uint8_t> bytes,
-                                std::shared_ptr<PayloadAccount> account) {
-  ValueBuffer buffer = make(bytes.size(), std::move(account));
-  std::memcpy(buffer.data(), bytes.data(), bytes.size());
-  return buffer;
-}
-
-ValueBuffer ValueBuffer::copyOfInput(std::span<const std::uint8_t> bytes,
-                                     std::shared_ptr<PayloadAccount> account) {
-  ValueBuffer buffer = makeUncharged(bytes.size(), std::move(account));
-  std::memcpy(buffer.data(), bytes.data(), bytes.size());
-  return buffer;
-}
-
-void ValueBuffer::destroy(Header* header) noexcept {
-  const std::shared_ptr<PayloadAccount> account = std::move(header->account);
-  const std::size_t charged = header->charged;
-  header->~Header();
-  ::operator delete(header);
-  if (account) account->relieve(charged);
-}
 
 ValueKind ValueView::kind() const {
   switch (*item_ >> 5) {
@@ -439,20 +423,6 @@ Value::Value(std::span<const std::uint8_t> encoded)
 
 Value::Value(ValueView view) : Value(view.bytes()) {}
 
-namespace {
-template <typename Encode>
-std::string encoded(Encode encode) {
-  std::string bytes;
-  ValueEncoder encoder(bytes);
-  encode(encoder);
-  return bytes;
-}
-
-std::span<const std::uint8_t> asBytes(std::string_view text) {
-  return {reinterpret_cast<const std::uint8_t*>(text.data()), text.size()};
-}
-}  // namespace
-
 Value::Value(bool value)
     : Value(asBytes(encoded([&](ValueEncoder& to) { to.boolean(value); }))) {}
 Value::Value(double value)
@@ -472,19 +442,6 @@ Value Value::ofSigned(std::int64_t integer) {
 Value Value::ofUnsigned(std::uint64_t integer) {
   return Value(asBytes(encoded([&](ValueEncoder& to) { to.unsignedInteger(integer); })));
 }
-
-namespace {
-Dictionary joined(std::initializer_list<std::span<const std::uint8_t>> parts,
-                  std::shared_ptr<PayloadAccount> account) {
-  std::size_t size = 0;
-  for (const auto part : parts) size += part.size();
-  ValueBuffer buffer = ValueBuffer::make(size, std::move(account));
-  std::uint8_t* at = buffer.data();
-  for (const auto part : parts) at = std::ranges::copy(part, at).out;
-  const std::uint8_t* const item = std::as_const(buffer).data();
-  return Dictionary(std::move(buffer), item);
-}
-}  // namespace
 
 Array::Array() : item_(&kEmptyArray) {}
 

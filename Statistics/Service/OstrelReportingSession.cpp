@@ -311,9 +311,9 @@ void OstrelReportingSession::sendMessage(Dictionary message, MessageCategory cat
 void OstrelReportingSession::deliverStep(const Dictionary& message,
                                          MessageCategory category, MessageType type,
                                          const ErrorReply& reply) {
-  const auto [details, list, mutableUserInfo] = takeDelivery();
+  const auto [details, list, configuredUserInfo] = takeDelivery();
   const Dictionary userInfo =
-      mutableUserInfo != nullptr ? mutableUserInfo->snapshot() : Dictionary();
+      configuredUserInfo != nullptr ? configuredUserInfo->snapshot() : Dictionary();
   const PayloadSurvey survey(message);
   OstrelReportingTallyraBridge::handleEvent(platform_, &message, category, type,
                                             userInfo);
