@@ -13,16 +13,11 @@ namespace ostrel {
 enum class ReporterID : std::int64_t {};
 inline constexpr ReporterID kNoReporter{0};
 
-/// IDs in order, with the interface of a vector. Nearly every message names one
-/// session: up to two IDs take no memory of their own.
+/// The IDs of one request in order, with what is used of a vector's interface. Nearly
+/// every message names one session: up to two IDs take no memory of their own.
 class ReporterIDs {
  public:
   using value_type = ReporterID;
-  using size_type = std::size_t;
-  using difference_type = std::ptrdiff_t;
-  using reference = ReporterID&;
-  using const_reference = const ReporterID&;
-  using iterator = ReporterID*;
   using const_iterator = const ReporterID*;
 
   ReporterIDs() = default;
@@ -58,8 +53,6 @@ class ReporterIDs {
   const ReporterID* end() const { return begin() + size_; }
   ReporterID& operator[](std::size_t index) { return begin()[index]; }
   const ReporterID& operator[](std::size_t index) const { return begin()[index]; }
-  const ReporterID& front() const { return *begin(); }
-  const ReporterID& back() const { return end()[-1]; }
 
   void reserve(std::size_t count) {
     if (count <= capacity_) return;
@@ -74,8 +67,6 @@ class ReporterIDs {
     if (size_ == capacity_) reserve(2 * capacity_);
     begin()[size_++] = id;
   }
-
-  void clear() { size_ = 0; }
 
   void swap(ReporterIDs& other) noexcept {
     std::swap(storage_, other.storage_);

@@ -80,14 +80,5 @@ TEST(ReporterIDs, AreEqualWhenAllAreInTheSameOrder) {
             (ReporterIDs{ReporterID{2}, ReporterID{1}}));
 }
 
-TEST(ReporterIDs, KeepTheirPlaceWhenCleared) {
-  ReporterIDs ids = numbered(5);
-  ids.clear();
-  EXPECT_TRUE(ids.empty());
-  ids.push_back(ReporterID{9});
-  EXPECT_EQ(ids.front(), ReporterID{9});
-  EXPECT_EQ(ids.back(), ReporterID{9});
-}
-
 }  // namespace
 }  // namespace ostrel
