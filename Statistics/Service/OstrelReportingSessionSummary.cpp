@@ -9,14 +9,10 @@
 #include <vector>
 
 #include "Statistics/OstrelReportingUtility.h"
+#include "Statistics/Service/OstrelReportingPayloadSurvey.h"
 
 namespace ostrel {
 namespace {
-
-bool holdsBlank(ValueView key) {
-  const auto text = key.string();
-  return text && text->find(' ') != std::string_view::npos;
-}
 
 // The summary of entries that need not be in memory: they are walked twice. The first
 // walk finds the groups and how long the text of each will be, the second writes the
@@ -153,14 +149,12 @@ class Summary {
 }  // namespace
 
 Dictionary SanitisedPayload(const Dictionary& message) {
-  const bool isClean =
-      std::none_of(message.begin(), message.end(),
-                   [](const auto& entry) { return holdsBlank(entry.key); });
-  if (isClean) return message;
+  if (!PayloadSurvey(message).hasBlankInKey()) return message;
   DictionaryBuilder sanitised(message.owner().account());
   for (const auto& [key, value] : message) {
-    if (holdsBlank(key)) {
-      std::string name(*key.string());
+    const auto text = key.string();
+    if (text && text->find(' ') != std::string_view::npos) {
+      std::string name(*text);
       std::replace(name.begin(), name.end(), ' ', '_');
       sanitised.set(Value(name), value);
     } else {
