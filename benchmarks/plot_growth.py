@@ -8,7 +8,8 @@ import sys
 from xml.sax.saxutils import escape
 
 WIDTH, HEIGHT = 640, 320
-LEFT, RIGHT, TOP, BOTTOM = 70, 20, 20, 50
+LEFT, RIGHT, TOP, BOTTOM = 70, 40, 20, 50
+LABEL_WIDTH = 40  # What the value of a point takes.
 
 
 def nice_ceiling(value):
@@ -47,7 +48,7 @@ def draw(curve):
     for tick in range(6):
         x, y = at(1, top * tick / 5)
         parts += [line(x, y, WIDTH - RIGHT, y, "#ddd"),
-                  text(x - 6, y + 4, f"{top * tick / 5:g}", "end")]
+                  text(x - 6, y + 4, f"{top * tick / 5:,g}", "end")]
     for decade in range(decades + 1):
         x, y = at(10**decade, 0)
         parts += [line(x, TOP, x, y, "#ddd"), text(x, y + 16, f"{10**decade:,}")]
@@ -61,9 +62,14 @@ def draw(curve):
     parts.append(
         f'<polyline points="{path}" fill="none" stroke="#1f77b4" stroke-width="2"/>'
     )
+    last = places[-1][0]
+    label_end = -math.inf
     for (x, y), (_, value) in zip(places, points):
-        parts += [f'<circle cx="{x:.1f}" cy="{y:.1f}" r="3.5" fill="#1f77b4"/>',
-                  text(x, y - 9, f"{value:.0f}")]
+        parts.append(f'<circle cx="{x:.1f}" cy="{y:.1f}" r="3.5" fill="#1f77b4"/>')
+        # Of points that stand close together one has its value; the last always has.
+        if x == last or (x >= label_end and x + LABEL_WIDTH <= last):
+            parts.append(text(x, y - 9, f"{value:,.0f}"))
+            label_end = x + LABEL_WIDTH
     return "\n".join(parts + ["</svg>", ""])
 
 
