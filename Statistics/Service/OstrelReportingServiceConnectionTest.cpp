@@ -416,13 +416,16 @@ TEST_F(OstrelReportingServiceConnection, SpreadsSessionsWhoseIDsAreChosenToMeet)
   }
   fakes.runUntilIdle();
 
-  const auto& sessions = client->clientReportingSessionMap();
-  ASSERT_EQ(sessions.size(), kSessions);
-  std::size_t most = 0;
-  for (std::size_t bucket = 0; bucket < sessions.bucket_count(); ++bucket) {
-    most = std::max(most, sessions.bucket_size(bucket));
-  }
-  EXPECT_LT(most, 30u);
+  onServerQueue([&] {
+    assertOnServerQueue();
+    const auto& sessions = client->clientReportingSessionMap();
+    EXPECT_EQ(sessions.size(), kSessions);
+    std::size_t most = 0;
+    for (std::size_t bucket = 0; bucket < sessions.bucket_count(); ++bucket) {
+      most = std::max(most, sessions.bucket_size(bucket));
+    }
+    EXPECT_LT(most, 30u);
+  });
 }
 
 TEST_F(OstrelReportingServiceConnection, ServesALateRequestOfARemovedClientOnItsOwnMap) {
