@@ -214,6 +214,22 @@ TEST_F(SessionStress, ServesAStormOfClientsOnSharedAndOwnSessions) {
             answer);
     }
   });
+  // However the storm went, the service goes on after it.
+  drain();
+  fakes.userDefaults->setSuite("com.orbisk.ostrel", {{"disable_reporting", false}});
+  fakes.notifications->post("com.orbisk.ostrel.reporting");
+  drain();
+  const std::size_t stopsOfStorm = stops;
+  const auto client = connections[0]->exportedObject();
+  client->createReportingSession(ReporterID{1}, /*reply=*/{});
+  client->startReportingSessionForID(ReporterID{1}, [&](bool isDone) {
+    if (isDone) ++stops;
+  });
+  drain();
+  client->stopReportingSessionForID(ReporterID{1}, /*reply=*/{});
+  drain();
+  EXPECT_EQ(stops, stopsOfStorm + 1);
+
   for (int i = 0; i < kThreads; ++i) {
     const auto& connection = connections[static_cast<std::size_t>(i)];
     for (const ReporterID id : {kShared, ReporterID{100 + i}}) {
