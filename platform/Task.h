@@ -7,20 +7,20 @@
 
 namespace ostrel {
 
-/// A piece of work that runs once at most: a move-only callable without
-/// arguments. Callables of up to `kInlineSize` bytes are kept inside, so that
-/// queueing one allocates nothing; the size holds the largest step of the
-/// message path.
-class Task {
+/// A callable without arguments that is called once at most, and moves but does not
+/// copy. Callables of up to `InlineSize` bytes are kept inside, so that making one
+/// allocates nothing.
+template <typename Result, std::size_t InlineSize>
+class OneShot {
  public:
-  static constexpr std::size_t kInlineSize = 120;
+  static constexpr std::size_t kInlineSize = InlineSize;
 
-  Task() = default;
+  OneShot() = default;
 
   template <typename F>
-  requires(!std::is_same_v<std::decay_t<F>, Task> &&
-           std::is_invocable_v<std::decay_t<F>&>)
-      Task(F&& callable) {  // Implicit, so that a lambda is a task.
+  requires(!std::is_same_v<std::decay_t<F>, OneShot> &&
+           std::is_invocable_r_v<Result, std::decay_t<F>&>)
+      OneShot(F&& callable) {  // Implicit, so that a lambda is one.
     using Callable = std::decay_t<F>;
     if constexpr (fits<Callable>()) {
       new (storage_) Callable(std::forward<F>(callable));
@@ -31,26 +31,26 @@ class Task {
     }
   }
 
-  Task(Task&& other) noexcept { take(other); }
-  Task& operator=(Task&& other) noexcept {
+  OneShot(OneShot&& other) noexcept { take(other); }
+  OneShot& operator=(OneShot&& other) noexcept {
     if (this != &other) {
       reset();
       take(other);
     }
     return *this;
   }
-  Task(const Task&) = delete;
-  Task& operator=(const Task&) = delete;
-  ~Task() { reset(); }
+  OneShot(const OneShot&) = delete;
+  OneShot& operator=(const OneShot&) = delete;
+  ~OneShot() { reset(); }
 
   explicit operator bool() const { return operations_ != nullptr; }
 
   /// Must not be empty.
-  void operator()() { operations_->run(storage_); }
+  Result operator()() { return operations_->run(storage_); }
 
  private:
   struct Operations {
-    void (*run)(void*);
+    Result (*run)(void*);
     void (*move)(void* from, void* to) noexcept;
     void (*destroy)(void*) noexcept;
   };
@@ -64,7 +64,7 @@ class Task {
 
   template <typename Callable>
   static constexpr Operations kInlineOperations = {
-      [](void* at) { (*static_cast<Callable*>(at))(); },
+      [](void* at) -> Result { return (*static_cast<Callable*>(at))(); },
       [](void* from, void* to) noexcept {
         new (to) Callable(std::move(*static_cast<Callable*>(from)));
         static_cast<Callable*>(from)->~Callable();
@@ -73,13 +73,13 @@ class Task {
 
   template <typename Callable>
   static constexpr Operations kHeapOperations = {
-      [](void* at) { (**static_cast<Callable**>(at))(); },
+      [](void* at) -> Result { return (**static_cast<Callable**>(at))(); },
       [](void* from, void* to) noexcept {
         new (to) Callable*(*static_cast<Callable**>(from));
       },
       [](void* at) noexcept { delete *static_cast<Callable**>(at); }};
 
-  void take(Task& other) noexcept {
+  void take(OneShot& other) noexcept {
     if (other.operations_ == nullptr) return;
     other.operations_->move(other.storage_, storage_);
     operations_ = std::exchange(other.operations_, nullptr);
@@ -93,5 +93,8 @@ class Task {
   alignas(std::max_align_t) std::byte storage_[kInlineSize];
   const Operations* operations_ = nullptr;
 };
+
+/// A piece of work. The size holds the largest step of the message path.
+using Task = OneShot<void, 120>;
 
 }  // namespace ostrel

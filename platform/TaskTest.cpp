@@ -113,6 +113,18 @@ TEST(Task, TakesACallableWhoseMoveMayThrow) {
   static_assert(std::is_nothrow_move_assignable_v<Task>);
 }
 
+TEST(OneShot, GivesWhatItsCallableGives) {
+  const int before = allocations;
+  OneShot<int, 16> small{[a = 20, b = 1] { return 2 * a + b; }};
+  OneShot<int, 16> moved = std::move(small);
+  EXPECT_EQ(moved(), 41);
+  EXPECT_EQ(allocations, before);
+  OneShot<int, 16> large{[a = std::array<int, 8>{1, 2}] { return a[0] + a[1]; }};
+  moved = std::move(large);
+  EXPECT_EQ(moved(), 3);
+  EXPECT_EQ(allocations, before + 1);
+}
+
 TEST(Task, IsEmptyUnlessMadeOtherwise) {
   Task task;
   EXPECT_FALSE(task);

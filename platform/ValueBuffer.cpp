@@ -5,6 +5,8 @@
 
 namespace ostrel {
 
+const std::shared_ptr<PayloadAccount> ValueBuffer::kNoAccount;
+
 ValueBuffer ValueBuffer::makeUncharged(std::size_t size,
                                        std::shared_ptr<PayloadAccount> account) {
   void* memory = ::operator new(sizeof(Header) + size);

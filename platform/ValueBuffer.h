@@ -62,8 +62,8 @@ class ValueBuffer {
     return reinterpret_cast<const std::uint8_t*>(header_ + 1);
   }
   std::size_t size() const { return header_ ? header_->size : 0; }
-  std::shared_ptr<PayloadAccount> account() const {
-    return header_ ? header_->account : nullptr;
+  const std::shared_ptr<PayloadAccount>& account() const {
+    return header_ ? header_->account : kNoAccount;
   }
   /// Charges the account `bytes` more, until the last reference goes. Only who made
   /// the buffer, while holding a reference. Nothing without an account.
@@ -82,6 +82,8 @@ class ValueBuffer {
     std::size_t charged = 0;
     std::shared_ptr<PayloadAccount> account;
   };
+  static const std::shared_ptr<PayloadAccount> kNoAccount;
+
   static ValueBuffer makeUncharged(std::size_t size,
                                    std::shared_ptr<PayloadAccount> account);
   static void destroy(Header* header) noexcept;

@@ -429,14 +429,15 @@ void OstrelReportingServerInstance::sendMessage(Dictionary message,
   OSTREL_LOG_DEBUG(logScope, "sending message for reporter %@", reportingIDs);
   servingQueue.load(std::memory_order_acquire)
       ->async([self = shared_from_this(), message = std::move(message), category, type,
-               reportingIDs = std::move(reportingIDs), reply = std::move(reply)] {
+               reportingIDs = std::move(reportingIDs),
+               reply = std::move(reply)]() mutable {
         assertOnServerQueue();
-        self->sendMessageStep(message, category, type, reportingIDs, reply);
+        self->sendMessageStep(std::move(message), category, type, reportingIDs, reply);
       });
 }
 
 void OstrelReportingServerInstance::sendMessageStep(
-    const Dictionary& message, MessageCategory category, MessageType type,
+    Dictionary message, MessageCategory category, MessageType type,
     const std::optional<ReporterIDs>& reportingIDs, const ErrorReply& reply) {
   master_->platform_.kernelTrace->trace(TraceCode::kSend);
   if (!master_->reportingEnabled()) {
@@ -450,7 +451,10 @@ void OstrelReportingServerInstance::sendMessageStep(
     for (const ReporterID reporterID : *reportingIDs) {
       if (reporterID == kNoReporter) continue;
       if (auto* const session = master_->borrowReportingSessionForID(reporterID)) {
-        session->sendMessage(message, category, type, /*reply=*/nullptr);
+        // Others that hold the message would share its count with the session's thread.
+        const bool isLast = &reporterID + 1 == reportingIDs->end();
+        session->sendMessage(isLast ? std::move(message) : message, category, type,
+                             /*reply=*/nullptr);
       }
     }
   }

@@ -193,8 +193,8 @@ class OstrelReportingServerInstance final
                             ReporterID reporterID, const BoolReply& reply)
       OSTREL_ON_QUEUE(serverQueueRole);
   void startStep(ReporterID reporterID, BoolReply reply) OSTREL_ON_QUEUE(serverQueueRole);
-  void sendMessageStep(const Dictionary& message, MessageCategory category,
-                       MessageType type, const std::optional<ReporterIDs>& reportingIDs,
+  void sendMessageStep(Dictionary message, MessageCategory category, MessageType type,
+                       const std::optional<ReporterIDs>& reportingIDs,
                        const ErrorReply& reply) OSTREL_ON_QUEUE(serverQueueRole);
   void sendToActiveSessions(const Dictionary& message, MessageCategory category,
                             MessageType type) OSTREL_ON_QUEUE(serverQueueRole);

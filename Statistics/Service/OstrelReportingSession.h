@@ -212,21 +212,21 @@ class OstrelReportingSession final
   void orientationChanged(std::string_view mode,
                           OrientationService::OrientationCode code);
 
-  // Constant after construction.
+  // Constant after construction, and what those read who queue messages. What the
+  // session's thread writes with each of them stands last: beside it, every message
+  // would have to wait for the line of the cache.
   const OstrelReportingPlatform& platform_;
   const ReporterID reporterID_;
   const std::shared_ptr<WorkQueue> sessionReportingQueue_;
+  const OstrelReportingProcessIdentifiers processIdentifiers_;
 
   // Shared. One lock for all properties that are not scalars: what a delivery needs
   // of them it takes at once. The pointers are set once and stay.
-  mutable SmallMutex mutex_;
-  std::atomic<bool> started_{false};  // The backend's thread sets it too.
-  std::atomic<ServiceType> serviceType_{kServiceTypeUnknown};
   mutable std::unique_ptr<Details> details_;
   std::shared_ptr<MutableDictionary> userInfo_;  // None until there is an entry.
-
-  const OstrelReportingProcessIdentifiers
-      processIdentifiers_;  // Constant, and last: seldom needed.
+  std::atomic<ServiceType> serviceType_{kServiceTypeUnknown};
+  std::atomic<bool> started_{false};  // The backend's thread sets it too.
+  mutable SmallMutex mutex_;
 };
 
 }  // namespace ostrel

@@ -70,7 +70,7 @@ class CountingAnalyticsSink final : public AnalyticsSink {
  public:
   explicit CountingAnalyticsSink(ServiceCounts& counts) : counts_(counts) {}
 
-  void sendEventLazy(std::string /*name*/, PayloadProvider /*provider*/) override {
+  void sendEventLazy(std::string_view /*name*/, PayloadProvider /*provider*/) override {
     count(counts_.analyticsEvents);
   }
 

@@ -1,5 +1,6 @@
 #include "platform/fake/RecordingSinks.h"
 
+#include <memory>
 #include <utility>
 
 #include "platform/fake/FakeUse.h"
@@ -9,15 +10,18 @@ namespace ostrel {
 RecordingAnalyticsSink::RecordingAnalyticsSink(SharedEventLog events)
     : events_(std::move(events)) {}
 
-void RecordingAnalyticsSink::sendEventLazy(std::string name, PayloadProvider provider) {
-  checkFakeUse(provider != nullptr, "an event has a provider");
+void RecordingAnalyticsSink::sendEventLazy(std::string_view name,
+                                           PayloadProvider provider) {
+  checkFakeUse(static_cast<bool>(provider), "an event has a provider");
+  Event event{std::string(name), [shared = std::make_shared<PayloadProvider>(
+                                      std::move(provider))] { return (*shared)(); }};
   if (events_->showsArguments()) {
-    events_->add("analytics " + name, {provider().value()});
+    events_->add("analytics " + event.name, {event.provider().value()});
   } else {
-    events_->add("analytics " + name);
+    events_->add("analytics " + event.name);
   }
   const std::lock_guard lock(mutex_);
-  sent_.push_back({std::move(name), std::move(provider)});
+  sent_.push_back(std::move(event));
 }
 
 std::vector<RecordingAnalyticsSink::Event> RecordingAnalyticsSink::sent() const {

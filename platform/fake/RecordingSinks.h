@@ -1,8 +1,10 @@
 #pragma once
 
+#include <functional>
 #include <mutex>
 #include <optional>
 #include <string>
+#include <string_view>
 #include <vector>
 
 #include "platform/AnalyticsSink.h"
@@ -17,12 +19,12 @@ class RecordingAnalyticsSink final : public AnalyticsSink {
  public:
   struct Event {
     std::string name;
-    PayloadProvider provider;
+    std::function<Dictionary()> provider;
   };
 
   explicit RecordingAnalyticsSink(SharedEventLog events);
 
-  void sendEventLazy(std::string name, PayloadProvider provider) override;
+  void sendEventLazy(std::string_view name, PayloadProvider provider) override;
 
   std::vector<Event> sent() const;
   std::vector<std::string> names() const;

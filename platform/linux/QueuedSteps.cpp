@@ -77,7 +77,9 @@ QueuedStep* takeMemory() {
     mine.count = kBatch;
   }
   --mine.count;
-  return popFrom(mine.steps);
+  QueuedStep* const step = popFrom(mine.steps);
+  if (mine.steps != nullptr) mine.steps->fetchAhead();
+  return step;
 }
 
 }  // namespace

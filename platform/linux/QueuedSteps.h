@@ -23,8 +23,21 @@ class QueuedStep {
   /// thread.
   static constexpr std::size_t kMostKept = 4096;
 
+  /// Asks for its memory, which another thread wrote last, before it is needed: each
+  /// line takes some 70 ns to come from another core. Only the address is used.
+  void fetchAhead() const {
+    const auto* const bytes = reinterpret_cast<const char*>(this);
+    for (std::size_t at = 0; at < sizeof(QueuedStep); at += kLine) {
+      __builtin_prefetch(bytes + at, /*rw=*/1);
+    }
+    __builtin_prefetch(bytes + sizeof(QueuedStep) - 1, /*rw=*/1);
+  }
+
   Task task;
   QueuedStep* next = nullptr;
+
+ private:
+  static constexpr std::size_t kLine = 64;
 };
 
 /// Steps in a row. Owns them; what is left at its end is dropped unrun.
@@ -57,6 +70,18 @@ class StepList {
     first_ = step;
   }
 
+  /// Puts all of `other` behind what is there.
+  void append(StepList& other) {
+    if (other.first_ == nullptr) return;
+    if (first_ == nullptr) {
+      first_ = other.first_;
+    } else {
+      last_->next = other.first_;
+    }
+    last_ = other.last_;
+    other.first_ = nullptr;
+  }
+
   /// Puts all of `other` before what is there.
   void prepend(StepList& other) {
     if (other.first_ == nullptr) return;
@@ -74,6 +99,7 @@ class StepList {
   void runFirst() {
     QueuedStep* const step = first_;
     first_ = step->next;
+    if (first_ != nullptr) first_->fetchAhead();
     step->task();
     step->task = Task();
     QueuedStep::takeBack(step);

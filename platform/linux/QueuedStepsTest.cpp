@@ -57,6 +57,21 @@ TEST_F(StepListTest, TakesStepsWhenItHasNone) {
   EXPECT_THAT(ran_, ElementsAre(0, 1));
 }
 
+TEST_F(StepListTest, TakesStepsBehindItsOwn) {
+  StepList other;
+  list_.append(other);
+  other.append(step(0));
+  other.append(step(1));
+  list_.append(other);
+  EXPECT_TRUE(other.empty());
+  other.append(step(2));
+  list_.append(other);
+  list_.append(other);
+  list_.append(step(3));
+  runAll();
+  EXPECT_THAT(ran_, ElementsAre(0, 1, 2, 3));
+}
+
 TEST_F(StepListTest, IsUsedAgainAfterItsEnd) {
   list_.append(step(0));
   runAll();

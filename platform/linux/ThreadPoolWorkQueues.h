@@ -10,6 +10,7 @@
 
 #include "platform/WorkQueue.h"
 #include "platform/linux/Limits.h"
+#include "platform/linux/QueuedSteps.h"
 #include "platform/linux/TimerThread.h"
 
 namespace ostrel {
@@ -84,17 +85,21 @@ class ThreadPoolWorkQueues::Batch {
   friend class ThreadPoolWorkQueues;
 
   bool takes() const { return strand_ == nullptr && !isRunning_; }
-  void take(std::shared_ptr<Strand> strand, std::shared_ptr<Pool> pool) {
-    strand_ = std::move(strand);
-    pool_ = std::move(pool);
-  }
+  void take(std::shared_ptr<Strand> strand);
   /// Other pools' threads find a whole batch when they wake up.
   void wakeLater(std::shared_ptr<Pool> pool) { poolsToWake_.push_back(std::move(pool)); }
-  /// Takes a strand for `pool`, to be handed over with others.
-  void gather(std::shared_ptr<Strand> strand, const std::shared_ptr<Pool>& pool);
+  /// Takes a step for a strand, to be handed over with the next ones.
+  void hold(Strand& strand, QueuedStep* step);
+  /// Queues what it holds.
+  void letGo();
+  /// Takes a strand for its pool, to be handed over with others.
+  void gather(std::shared_ptr<Strand> strand);
   void handOver(Gathered& gathered);
 
   bool isRunning_ = false;
+  std::shared_ptr<Strand> held_;  // Whose steps these are.
+  StepList heldSteps_;
+  int heldCount_ = 0;
   std::shared_ptr<Strand> strand_;
   std::shared_ptr<Pool> pool_;
   std::vector<std::shared_ptr<Pool>> poolsToWake_;

@@ -203,6 +203,116 @@ TEST_F(ThreadPoolWorkQueuesTest, ABatchHandsOverQueuesOfSeveralClasses) {
   EXPECT_EQ(count, 3);
 }
 
+// Around as many as are held back for one another.
+TEST_F(ThreadPoolWorkQueuesTest, ABatchHandsTheStepsOfAQueueOverInTheirOrder) {
+  for (const int steps : {1, 2, 63, 64, 65, 127, 128, 129, 1000}) {
+    const auto server = makeQueue(QualityOfService::kUserInteractive);
+    const auto session = makeQueue();
+    std::vector<int> ran;
+    {
+      const ThreadPoolWorkQueues::Batch batch;
+      for (int i = 0; i < steps; ++i) {
+        server->async([&, i] { session->async([&, i] { ran.push_back(i); }); });
+      }
+    }
+    ASSERT_TRUE(drain());
+    ASSERT_EQ(ran.size(), static_cast<std::size_t>(steps));
+    EXPECT_TRUE(std::is_sorted(ran.begin(), ran.end())) << steps;
+  }
+}
+
+TEST_F(ThreadPoolWorkQueuesTest, ABatchHandsStepsOverInTheOrderOfTheirQueues) {
+  const auto server = makeQueue(QualityOfService::kUserInteractive);
+  const auto first = makeQueue();
+  const auto second = makeQueue();
+  std::atomic<int> firstRan{0};
+  bool cameInOrder = true;
+  {
+    const ThreadPoolWorkQueues::Batch batch;
+    for (int i = 0; i < 500; ++i) {
+      server->async([&, i] {
+        first->async([&] { ++firstRan; });
+        // Queued later, by a step that another queue runs at its own time.
+        if (i % 7 == 0) {
+          second->async([&, i] {
+            first->async([&, i] { cameInOrder = cameInOrder && firstRan > i; });
+          });
+        }
+      });
+    }
+  }
+  ASSERT_TRUE(drain());
+  EXPECT_EQ(firstRan, 500);
+  EXPECT_TRUE(cameInOrder);
+}
+
+// The batch's queue goes on elsewhere since others wait: what it had held back is there
+// before what its later steps queue.
+TEST_F(ThreadPoolWorkQueuesTest, ABatchHoldsNothingBackWhenItsQueueGoesOnElsewhere) {
+  const auto server = makeQueue(QualityOfService::kUserInteractive);
+  const auto session = makeQueue();
+  Gate gate;
+  std::vector<std::shared_ptr<WorkQueue>> others;
+  for (std::size_t i = 0; i <= ThreadPoolWorkQueues::kMostInteractiveThreads; ++i) {
+    others.push_back(makeQueue(QualityOfService::kUserInteractive));
+    others.back()->async(gate.holdingStep());
+  }
+  for (std::size_t i = 0; i < ThreadPoolWorkQueues::kMostInteractiveThreads; ++i) {
+    gate.waitUntilHolding();
+  }
+  std::vector<int> ran;
+  std::thread::id lastThread;
+  {
+    const ThreadPoolWorkQueues::Batch batch;
+    for (int i = 0; i < 300; ++i) {
+      server->async([&, i] {
+        lastThread = std::this_thread::get_id();
+        session->async([&, i] { ran.push_back(i); });
+      });
+    }
+  }
+  for (std::size_t i = 0; i < others.size(); ++i) gate.open();
+  ASSERT_TRUE(drain());
+  EXPECT_NE(lastThread, std::this_thread::get_id());
+  ASSERT_EQ(ran.size(), 300u);
+  EXPECT_TRUE(std::is_sorted(ran.begin(), ran.end()));
+}
+
+TEST_F(ThreadPoolWorkQueuesTest, ABatchHandsStepsToAQueueThatIsHeld) {
+  const auto server = makeQueue(QualityOfService::kUserInteractive);
+  const auto session = makeQueue();
+  std::vector<int> ran;
+  session->async([&] { session->suspend(); });
+  ASSERT_TRUE(drain());
+  {
+    const ThreadPoolWorkQueues::Batch batch;
+    for (int i = 1; i <= 100; ++i) {
+      server->async([&, i] {
+        session->async([&, i] { ran.push_back(i); });
+        if (i == 50) session->resume([&] { ran.push_back(0); });
+      });
+    }
+  }
+  ASSERT_TRUE(drain());
+  ASSERT_EQ(ran.size(), 101u);
+  EXPECT_TRUE(std::is_sorted(ran.begin(), ran.end()));
+}
+
+TEST_F(ThreadPoolWorkQueuesTest, ABatchRunsWhatAReleasedQueueWasGiven) {
+  const auto server = makeQueue(QualityOfService::kUserInteractive);
+  int ran = 0;
+  {
+    const ThreadPoolWorkQueues::Batch batch;
+    server->async([&] {
+      const auto session = makeQueue();
+      session->async([&] { ++ran; });
+      session->async([&] { ++ran; });
+    });
+  }
+  ASSERT_TRUE(drain());
+  EXPECT_EQ(ran, 2);
+}
+
 TEST_F(ThreadPoolWorkQueuesTest, WaitsForWhatABatchHasNotHandedOver) {
   const auto server = makeQueue(QualityOfService::kUserInteractive);
   const auto session = makeQueue();

@@ -2,6 +2,7 @@
 
 #include <memory>
 #include <string>
+#include <string_view>
 #include <utility>
 
 #include "platform/AnalyticsSink.h"
@@ -16,8 +17,8 @@ class StoreAnalyticsSink final : public AnalyticsSink {
  public:
   explicit StoreAnalyticsSink(std::shared_ptr<Store> store) : store_(std::move(store)) {}
 
-  void sendEventLazy(std::string name, PayloadProvider provider) override {
-    store_->addAnalyticsEvent(std::move(name), std::move(provider));
+  void sendEventLazy(std::string_view name, PayloadProvider provider) override {
+    store_->addAnalyticsEvent(std::string(name), std::move(provider));
   }
 
  private:

@@ -179,8 +179,7 @@ StoreWriter::Result StoreWriter::write(StoreOperation& operation) {
 
 StoreWriter::Result StoreWriter::write(StoreOperation& operation, AnalyticsEvent& event) {
   if (event.provider) {
-    const AnalyticsSink::PayloadProvider provider = std::move(event.provider);
-    event.provider = nullptr;
+    AnalyticsSink::PayloadProvider provider = std::move(event.provider);
     if (!wants(event.name)) return std::nullopt;
     try {
       event.payload = provider();
