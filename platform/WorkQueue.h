@@ -25,6 +25,13 @@ class OSTREL_CAPABILITY("work queue") WorkQueue {
   /// Queues `step`. Any thread; never blocks, never runs the step inline.
   virtual void async(Task step) = 0;
 
+  /// Lets the calling thread run this queue until `leave`, as a step of the queue does:
+  /// for work that would be queued, and that nothing comes before. What others queue
+  /// meanwhile waits. False where the thread may not do so, as on most threads, or where
+  /// something is queued or runs: the work is to be queued then. Off all queues.
+  virtual bool tryEnter() { return false; }
+  virtual void leave() {}
+
   /// Holds everything that is queued back from the end of the current step
   /// until `resume`. A held queue holds no thread. Called on this queue.
   virtual void suspend() = 0;

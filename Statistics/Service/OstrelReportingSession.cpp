@@ -306,8 +306,7 @@ void OstrelReportingSession::sendMessage(Dictionary message, MessageCategory cat
   });
 }
 
-// One lock of the session's for all that the delivery needs of it, and one walk over
-// the payload for all that its parts ask of that.
+// One walk over the payload for all that the delivery's parts ask of that.
 void OstrelReportingSession::deliverStep(const Dictionary& message,
                                          MessageCategory category, MessageType type,
                                          const ErrorReply& reply) {
@@ -342,9 +341,14 @@ void OstrelReportingSession::deliverStep(const Dictionary& message,
 }
 
 OstrelReportingSession::Delivery OstrelReportingSession::takeDelivery() const {
-  const std::lock_guard lock(mutex_);
-  Details& made = details();
-  return {made, made.aggregatedPayloadData, userInfo_.get()};
+  Details* made = details_.get();
+  if (made == nullptr) {
+    const std::lock_guard lock(mutex_);
+    made = &details();
+  }
+  const auto* const info = userInfo_.get();
+  return {*made, made->aggregatedPayloadData.get(),
+          info != nullptr ? info->get() : nullptr};
 }
 
 // Kept: the count belongs to the name; codes with equal names share it.
@@ -496,31 +500,28 @@ std::shared_ptr<AggregatedPayloadData> OstrelReportingSession::makeList() const 
 
 // A session that was never started has a list too.
 OstrelReportingSession::Details& OstrelReportingSession::details() const {
-  if (details_ == nullptr) {
-    details_ = std::make_unique<Details>();
-    details_->aggregatedPayloadData = makeList();
-  }
-  return *details_;
+  if (Details* const made = details_.get()) return *made;
+  auto made = std::make_unique<Details>();
+  made->aggregatedPayloadData = makeList();
+  return details_.set(std::move(made));
 }
 
 std::shared_ptr<AggregatedPayloadData> OstrelReportingSession::aggregatedPayloadData()
     const {
-  return takeDelivery().list;
+  const std::lock_guard lock(mutex_);
+  return details().aggregatedPayloadData;
 }
 
 std::shared_ptr<MutableDictionary> OstrelReportingSession::mutableUserInfo() {
   const std::lock_guard lock(mutex_);
-  if (userInfo_ == nullptr) userInfo_ = std::make_shared<MutableDictionary>();
-  return userInfo_;
+  if (const auto* const made = userInfo_.get()) return *made;
+  return userInfo_.set(std::make_unique<std::shared_ptr<MutableDictionary>>(
+      std::make_shared<MutableDictionary>()));
 }
 
 Dictionary OstrelReportingSession::userInfo() const {
-  const MutableDictionary* made;
-  {
-    const std::lock_guard lock(mutex_);
-    made = userInfo_.get();
-  }
-  return made != nullptr ? made->snapshot() : Dictionary();
+  const auto* const made = userInfo_.get();
+  return made != nullptr ? (*made)->snapshot() : Dictionary();
 }
 
 std::string OstrelReportingSession::serviceName() const {

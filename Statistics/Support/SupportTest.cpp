@@ -7,6 +7,7 @@
 
 #include "Statistics/CoreTestFixture.h"
 #include "Statistics/Support/AtomicProperty.h"
+#include "Statistics/Support/MadeOnce.h"
 #include "Statistics/Support/Monitored.h"
 #include "Statistics/Support/MutableDictionary.h"
 
@@ -58,6 +59,18 @@ TEST(AtomicProperty, NeverShowsHalfAValue) {
       EXPECT_EQ(text, std::string(100, text[0]));
     }
   });
+}
+
+TEST(MadeOnce, IsThereOnceItIsMadeAndGoesAtTheEnd) {
+  auto value = std::make_shared<int>(4);
+  {
+    MadeOnce<std::shared_ptr<int>> made;
+    EXPECT_EQ(made.get(), nullptr);
+    auto& set = made.set(std::make_unique<std::shared_ptr<int>>(value));
+    EXPECT_EQ(made.get(), &set);
+    EXPECT_EQ(value.use_count(), 2);
+  }
+  EXPECT_EQ(value.use_count(), 1);
 }
 
 TEST(Monitored, LetsOneInAtATime) {

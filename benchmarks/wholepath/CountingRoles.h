@@ -14,21 +14,17 @@
 
 namespace ostrel::bench {
 
-inline void count(std::atomic<std::uint64_t>& counter) {
-  counter.fetch_add(1, std::memory_order_relaxed);
-}
-
 class CountingSession final : public TelemetrySession {
  public:
   explicit CountingSession(ServiceCounts& counts) : counts_(counts) {
-    count(counts_.sessions);
+    counts_.sessions.add();
   }
 
   void startConfiguration(BackendsCallback completion) override { completion(Array()); }
 
   Success sendMessage(std::uint16_t /*category*/, std::uint16_t /*type*/,
                       const Dictionary& /*payload*/) override {
-    count(counts_.messages);
+    counts_.messages.add();
     return {/*succeeded=*/true, /*error=*/{}};
   }
 
@@ -58,7 +54,7 @@ class CountingBackend final : public TelemetryBackend {
   Success sendOneMessage(const Dictionary& /*sessionInfo*/,
                          const Dictionary& /*userInfo*/, std::uint16_t /*category*/,
                          std::uint16_t /*type*/, const Dictionary& /*payload*/) override {
-    count(counts_.loneMessages);
+    counts_.loneMessages.add();
     return {/*succeeded=*/true, /*error=*/{}};
   }
 
@@ -71,7 +67,7 @@ class CountingAnalyticsSink final : public AnalyticsSink {
   explicit CountingAnalyticsSink(ServiceCounts& counts) : counts_(counts) {}
 
   void sendEventLazy(std::string_view /*name*/, PayloadProvider /*provider*/) override {
-    count(counts_.analyticsEvents);
+    counts_.analyticsEvents.add();
   }
 
  private:
@@ -85,7 +81,7 @@ class CountingWattlogSink final : public WattlogSink {
   void logRegisteredEvent(std::int32_t /*clientID*/, std::string_view /*name*/,
                           const Dictionary& /*event*/,
                           const std::optional<Dictionary>& /*attachment*/) override {
-    count(counts_.powerEvents);
+    counts_.powerEvents.add();
   }
 
  private:

@@ -179,6 +179,8 @@ class ThreadPoolWorkQueues::Strand final : public WorkQueue,
   explicit Strand(std::shared_ptr<const QueueKind> kind) : kind_(std::move(kind)) {}
 
   void async(Task task) override;
+  bool tryEnter() override;
+  void leave() override;
   void suspend() override;
   void resume(Task first) override;
   bool isCurrent() const override { return currentQueue == this; }
@@ -214,6 +216,9 @@ class ThreadPoolWorkQueues::Strand final : public WorkQueue,
   bool suspendWasCalled_ = false;  // The thread's that runs the strand.
   bool isPlaced_ = false;
   bool isSuspended_ = false;
+  /// Whether there is anything that nobody may get ahead of. Who runs the strand looks
+  /// without the lock.
+  std::atomic<bool> isBusy_{false};
   StepList waiting_;
   StepList firsts_;  // Of `resume` while the strand runs; the last goes first.
 };
@@ -250,9 +255,11 @@ void ThreadPoolWorkQueues::Strand::async(Task task) {
     batch->hold(*this, step);
     return;
   }
+  if (batch != nullptr) batch->letGo();
   {
     const std::lock_guard lock(mutex_);
     waiting_.append(step);
+    isBusy_.store(true, std::memory_order_relaxed);
     if (isPlaced_ || isSuspended_) return;
     isPlaced_ = true;
   }
@@ -263,6 +270,7 @@ void ThreadPoolWorkQueues::Strand::take(std::shared_ptr<Strand> strand, StepList
   {
     const std::lock_guard lock(strand->mutex_);
     strand->waiting_.append(steps);
+    strand->isBusy_.store(true, std::memory_order_relaxed);
     if (strand->isPlaced_ || strand->isSuspended_) return;
     strand->isPlaced_ = true;
   }
@@ -298,10 +306,28 @@ void ThreadPoolWorkQueues::Strand::place(std::shared_ptr<Strand> strand) {
   if (placed == Pool::Placed::kDropped) strand->drop();
 }
 
+// Whoever has queued something, so that this thread could know, is seen by it: then the
+// work is queued too. Else it is as if the work had been queued and run at once.
+bool ThreadPoolWorkQueues::Strand::tryEnter() {
+  Batch* const batch = currentBatch_;
+  if (batch == nullptr || batch->isRunning_) return false;
+  if (isBusy_.load(std::memory_order_relaxed) || !batch->has(*this)) return false;
+  batch->isRunning_ = true;
+  currentQueue = this;
+  return true;
+}
+
+void ThreadPoolWorkQueues::Strand::leave() {
+  currentQueue = nullptr;
+  currentBatch_->isRunning_ = false;
+  suspendWasCalled_ = false;
+}
+
 void ThreadPoolWorkQueues::Strand::drop() {
   StepList dropped;
   const std::lock_guard lock(mutex_);
   isPlaced_ = false;
+  isBusy_.store(isSuspended_, std::memory_order_relaxed);
   dropped.swap(waiting_);
 }
 
@@ -313,6 +339,7 @@ void ThreadPoolWorkQueues::Strand::suspend() {
     std::abort();
   }
   isSuspended_ = true;
+  isBusy_.store(true, std::memory_order_relaxed);
   suspendWasCalled_ = true;
 }
 
@@ -354,6 +381,7 @@ bool ThreadPoolWorkQueues::Strand::runSteps() {
       waiting_.prepend(steps);
       if (stepsLeft < 0) return true;
       waiting_.prepend(firsts_);
+      isBusy_.store(isSuspended_ || !waiting_.empty(), std::memory_order_relaxed);
       if (isSuspended_ || waiting_.empty()) {
         isPlaced_ = false;
         return false;
@@ -601,6 +629,22 @@ void ThreadPoolWorkQueues::Batch::letGo() {
   if (held_ == nullptr) return;
   heldCount_ = 0;
   Strand::take(std::move(held_), heldSteps_);
+}
+
+bool ThreadPoolWorkQueues::Batch::has(Strand& strand) {
+  if (strand_ != nullptr) return strand_.get() == &strand;
+  if (!strand.kind_->pool->isBatched()) return false;
+  {
+    const std::lock_guard lock(strand.mutex_);
+    if (strand.isPlaced_ || strand.isSuspended_) return false;
+    strand.isPlaced_ = true;
+  }
+  if (strand.kind_->pool->begin() == Pool::Placed::kDropped) {
+    strand.drop();
+    return false;
+  }
+  take(strand.shared_from_this());
+  return true;
 }
 
 void ThreadPoolWorkQueues::Batch::take(std::shared_ptr<Strand> strand) {

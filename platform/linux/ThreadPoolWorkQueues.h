@@ -24,10 +24,11 @@ namespace ostrel {
 class ThreadPoolWorkQueues final : public WorkQueueFactory {
  public:
   /// While it lives, the first idle interactive queue that the calling thread
-  /// queues on waits for its end, and runs then, on this thread. So a thread that
-  /// turns a batch of input into steps hands nothing over: a batch costs neither a
-  /// wake-up nor a change of threads, and a request is answered by the thread that
-  /// read it. At most one a thread; not on a queue.
+  /// queues on or enters is this thread's: it runs at the batch's end, and may be
+  /// entered until something is queued. So a thread that turns a batch of input into
+  /// steps hands nothing over: a batch costs neither a wake-up nor a change of threads,
+  /// and a request is answered by the thread that read it. At most one a thread; not on
+  /// a queue.
   class Batch;
 
   static constexpr std::size_t kMostInteractiveThreads = limits::kInteractiveThreads;
@@ -85,6 +86,8 @@ class ThreadPoolWorkQueues::Batch {
   friend class ThreadPoolWorkQueues;
 
   bool takes() const { return strand_ == nullptr && !isRunning_; }
+  /// Whether the strand is the batch's or has become so.
+  bool has(Strand& strand);
   void take(std::shared_ptr<Strand> strand);
   /// Other pools' threads find a whole batch when they wake up.
   void wakeLater(std::shared_ptr<Pool> pool) { poolsToWake_.push_back(std::move(pool)); }

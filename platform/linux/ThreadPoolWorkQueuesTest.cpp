@@ -313,6 +313,188 @@ TEST_F(ThreadPoolWorkQueuesTest, ABatchRunsWhatAReleasedQueueWasGiven) {
   EXPECT_EQ(ran, 2);
 }
 
+TEST_F(ThreadPoolWorkQueuesTest, ABatchEntersAQueueThatNobodyUses) {
+  const auto server = makeQueue(QualityOfService::kUserInteractive);
+  EXPECT_FALSE(server->tryEnter());
+  {
+    const ThreadPoolWorkQueues::Batch batch;
+    for (int i = 0; i < 3; ++i) {
+      ASSERT_TRUE(server->tryEnter());
+      EXPECT_TRUE(server->isCurrent());
+      EXPECT_FALSE(server->tryEnter());
+      server->leave();
+      EXPECT_FALSE(server->isCurrent());
+    }
+  }
+  EXPECT_FALSE(server->tryEnter());
+  EXPECT_TRUE(drain());
+  EXPECT_EQ(queues_->threadCount(), 0u);
+}
+
+TEST_F(ThreadPoolWorkQueuesTest, ABatchEntersNoQueueOnWhichSomethingWaits) {
+  const auto server = makeQueue(QualityOfService::kUserInteractive);
+  std::vector<int> ran;
+  {
+    const ThreadPoolWorkQueues::Batch batch;
+    ASSERT_TRUE(server->tryEnter());
+    ran.push_back(0);
+    server->async([&] { ran.push_back(1); });
+    server->leave();
+    EXPECT_FALSE(server->tryEnter());
+    server->async([&] { ran.push_back(2); });
+    EXPECT_FALSE(server->tryEnter());
+  }
+  EXPECT_EQ(ran, (std::vector<int>{0, 1, 2}));
+  const ThreadPoolWorkQueues::Batch batch;
+  ASSERT_TRUE(server->tryEnter());
+  server->leave();
+  std::thread([&] { server->async([&] { ran.push_back(3); }); }).join();
+  EXPECT_FALSE(server->tryEnter());
+}
+
+TEST_F(ThreadPoolWorkQueuesTest, ABatchEntersNoQueueThatAThreadRuns) {
+  const auto server = makeQueue(QualityOfService::kUserInteractive);
+  Gate gate;
+  server->async(gate.holdingStep());
+  gate.waitUntilHolding();
+  {
+    const ThreadPoolWorkQueues::Batch batch;
+    EXPECT_FALSE(server->tryEnter());
+  }
+  gate.open();
+  ASSERT_TRUE(drain());
+  const ThreadPoolWorkQueues::Batch batch;
+  EXPECT_TRUE(server->tryEnter());
+  server->leave();
+}
+
+TEST_F(ThreadPoolWorkQueuesTest, ABatchEntersOneInteractiveQueueOnly) {
+  const auto first = makeQueue(QualityOfService::kUserInteractive);
+  const auto second = makeQueue(QualityOfService::kUserInteractive);
+  const auto utility = makeQueue();
+  const ThreadPoolWorkQueues::Batch batch;
+  EXPECT_FALSE(utility->tryEnter());
+  ASSERT_TRUE(first->tryEnter());
+  EXPECT_FALSE(second->tryEnter());
+  first->leave();
+  EXPECT_FALSE(second->tryEnter());
+}
+
+TEST_F(ThreadPoolWorkQueuesTest, AnEnteredQueueHoldsOthersStepsBackUntilTheBatchEnds) {
+  const auto server = makeQueue(QualityOfService::kUserInteractive);
+  std::thread::id thread;
+  {
+    const ThreadPoolWorkQueues::Batch batch;
+    ASSERT_TRUE(server->tryEnter());
+    std::thread([&] {
+      server->async([&] { thread = std::this_thread::get_id(); });
+    }).join();
+    server->leave();
+    EXPECT_EQ(thread, std::thread::id());
+    EXPECT_FALSE(queues_->drain(steady_clock::now()));
+  }
+  ASSERT_TRUE(drain());
+  EXPECT_EQ(thread, std::this_thread::get_id());
+}
+
+TEST_F(ThreadPoolWorkQueuesTest, AnEnteredQueueMayBeHeld) {
+  const auto server = makeQueue(QualityOfService::kUserInteractive);
+  std::vector<int> ran;
+  {
+    const ThreadPoolWorkQueues::Batch batch;
+    ASSERT_TRUE(server->tryEnter());
+    server->suspend();
+    server->leave();
+    EXPECT_FALSE(server->tryEnter());
+    server->async([&] { ran.push_back(2); });
+  }
+  EXPECT_TRUE(ran.empty());
+  {
+    const ThreadPoolWorkQueues::Batch batch;
+    EXPECT_FALSE(server->tryEnter());
+    server->resume([&] { ran.push_back(1); });
+    EXPECT_FALSE(server->tryEnter());
+  }
+  EXPECT_EQ(ran, (std::vector<int>{1, 2}));
+  const ThreadPoolWorkQueues::Batch batch;
+  EXPECT_TRUE(server->tryEnter());
+  server->leave();
+}
+
+// Steps that are queued while a queue is entered, and others between, at any length.
+TEST_F(ThreadPoolWorkQueuesTest, AnEnteredQueueQueuesStepsInTheirOrder) {
+  const auto server = makeQueue(QualityOfService::kUserInteractive);
+  const auto first = makeQueue();
+  const auto second = makeQueue();
+  std::vector<int> ran;
+  int count = 0;
+  int entered = 0;
+  const auto queueNext = [&] {
+    const int number = count++;
+    first->async([&ran, number] { ran.push_back(number); });
+    if (number % 5 == 0) second->async([] {});
+  };
+  for (int round = 0; round < 50; ++round) {
+    const ThreadPoolWorkQueues::Batch batch;
+    for (int i = 0; i < round * 3; ++i) {
+      if (i % 11 == 10) {
+        server->async(queueNext);
+      } else if (server->tryEnter()) {
+        ++entered;
+        queueNext();
+        server->leave();
+      } else {
+        server->async(queueNext);
+      }
+      // From the thread itself, on no queue.
+      if (i % 7 == 6) queueNext();
+    }
+  }
+  ASSERT_TRUE(drain());
+  EXPECT_GT(entered, 100);
+  ASSERT_EQ(ran.size(), static_cast<std::size_t>(count));
+  EXPECT_TRUE(std::is_sorted(ran.begin(), ran.end()));
+}
+
+// Threads that queue on an entered queue, and wait for what they queued.
+TEST_F(ThreadPoolWorkQueuesTest, AnEnteredQueueRunsOneStepAtATime) {
+  const auto server = makeQueue(QualityOfService::kUserInteractive);
+  int runs = 0;  // Of the queue.
+  std::atomic<bool> isOver{false};
+  std::vector<std::thread> others;
+  std::atomic<int> queued{0};
+  for (int i = 0; i < 2; ++i) {
+    others.emplace_back([&] {
+      while (!isOver) {
+        std::binary_semaphore ran{0};
+        server->async([&] {
+          ++runs;
+          ran.release();
+        });
+        ++queued;
+        ran.acquire();
+      }
+    });
+  }
+  for (int i = 0; i < 3000; ++i) {
+    const ThreadPoolWorkQueues::Batch batch;
+    for (int j = 0; j < 5; ++j) {
+      if (server->tryEnter()) {
+        server->assertCurrent();
+        ++runs;
+        server->leave();
+      } else {
+        server->async([&] { ++runs; });
+      }
+      ++queued;
+    }
+  }
+  isOver = true;
+  for (std::thread& thread : others) thread.join();
+  ASSERT_TRUE(drain());
+  EXPECT_EQ(runs, queued);
+}
+
 TEST_F(ThreadPoolWorkQueuesTest, WaitsForWhatABatchHasNotHandedOver) {
   const auto server = makeQueue(QualityOfService::kUserInteractive);
   const auto session = makeQueue();

@@ -33,10 +33,10 @@ class UserAccount {
               std::shared_ptr<ServiceAccount> service)
       : user_(user),
         queued_(limits.queuedBytes),
-        sessions_(limits.sessions),
-        keptBytes_(limits.keptBytes),
         mostUnreadBytes_(limits.unreadBytes),
-        service_(std::move(service)) {}
+        service_(std::move(service)),
+        sessions_(limits.sessions),
+        keptBytes_(limits.keptBytes) {}
 
   std::uint32_t user() const { return user_; }
 
@@ -81,11 +81,13 @@ class UserAccount {
 
   const std::uint32_t user_;
   RequestBudget queued_;
-  Share sessions_;
-  Share keptBytes_;
   const std::size_t mostUnreadBytes_;
   std::atomic<std::size_t> unreadBytes_{0};
   const std::shared_ptr<ServiceAccount> service_;
+  // On a line of the cache of their own: sessions' threads write them, and the thread
+  // that reads looks at the others with each message.
+  alignas(64) Share sessions_;
+  Share keptBytes_;
 };
 
 }  // namespace ostrel
