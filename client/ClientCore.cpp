@@ -218,21 +218,41 @@ void ClientCore::close() {
     closeDeadline_ = Clock::now() + std::max(options_.closeTimeout, milliseconds::zero());
     wake();
   }
-  if (isOwnThread()) {
-    isSilent_ = true;
-    const auto handlers = pending_.takeAll();
-    if (thread_.joinable()) thread_.detach();
-    lock.unlock();
-    for (const Handler& handler : handlers) callHandler(handler, Status::kClosed);
-    return;
+  if (!isOwnThread()) {
+    changed_.wait_until(lock, closeDeadline_ + kHandlerGrace,
+                        [&] { return isFinished_; });
   }
-  changed_.wait_until(lock, closeDeadline_ + kHandlerGrace, [&] { return isFinished_; });
-  if (!thread_.joinable()) return;
+  // What the thread has not told is told here: it may be this one, or be held up by a
+  // handler or by a machine that is busy, and no handler is called later.
+  isSilent_ = true;
+  endAll(Status::kClosed);
   std::thread thread = std::move(thread_);
   const bool isFinished = isFinished_;
-  isSilent_ = true;
   lock.unlock();
+  tellEndings();
+  if (!thread.joinable()) return;
   isFinished ? thread.join() : thread.detach();
+}
+
+// With the lock.
+void ClientCore::endAll(Status status) {
+  for (Handler& handler : pending_.takeAll()) {
+    endings_.push_back({std::move(handler), status});
+  }
+}
+
+// The endings are taken one by one, so that `close` may tell those that are left.
+void ClientCore::tellEndings() {
+  while (true) {
+    Ending ending;
+    {
+      const std::lock_guard lock(mutex_);
+      if (endings_.empty()) return;
+      ending = std::move(endings_.front());
+      endings_.pop_front();
+    }
+    callHandler(ending.handler, ending.status);
+  }
 }
 
 bool ClientCore::isConnected() const {
@@ -337,7 +357,6 @@ void ClientCore::connected(ClientSocket socket) {
 }
 
 void ClientCore::connectionLost(const std::string& reason) {
-  std::vector<Handler> handlers;
   bool isExpected;
   {
     const auto noFork = ForkGuard::lock();
@@ -352,7 +371,7 @@ void ClientCore::connectionLost(const std::string& reason) {
     queue_.clear();
     queueSent_ = 0;
     sessionsToRestore_ = sessions_;
-    handlers = pending_.takeAll();
+    endAll(isExpected ? Status::kClosed : Status::kConnectionLost);
     changed_.notify_all();
   }
   writing_.clear();
@@ -362,9 +381,7 @@ void ClientCore::connectionLost(const std::string& reason) {
   if (hasReplied_ || now - connectedAt_ >= kGoodConnection) backOff_ = kFirstBackOff;
   nextAttempt_ = now + withJitter(backOff_);
   backOff_ = std::min<Clock::duration>(backOff_ * 2, kLongestBackOff);
-  for (const Handler& handler : handlers) {
-    callHandler(handler, isExpected ? Status::kClosed : Status::kConnectionLost);
-  }
+  tellEndings();
   if (!isExpected) tellConnection(/*isConnected=*/false, reason);
 }
 
@@ -516,14 +533,15 @@ bool ClientCore::takeReply(std::span<const std::uint8_t> item) {
 }
 
 void ClientCore::endExpired() {
-  std::vector<Handler> expired;
   {
     const std::lock_guard lock(mutex_);
     if (pending_.nextDeadline() == Clock::time_point::max()) return;
-    expired = pending_.takeExpired(Clock::now());
-    counts_.timedOutRequests += expired.size();
+    for (Handler& handler : pending_.takeExpired(Clock::now())) {
+      endings_.push_back({std::move(handler), Status::kTimedOut});
+      ++counts_.timedOutRequests;
+    }
   }
-  for (const Handler& handler : expired) callHandler(handler, Status::kTimedOut);
+  tellEndings();
 }
 
 void ClientCore::tellConnection(bool isConnected, const std::string& reason) {
@@ -578,7 +596,6 @@ void ClientCore::waitUntil(Clock::time_point time, bool wantsToWrite) {
 }
 
 void ClientCore::finish() {
-  std::vector<Handler> handlers;
   {
     const auto noFork = ForkGuard::lock();
     const std::lock_guard lock(mutex_);
@@ -588,10 +605,10 @@ void ClientCore::finish() {
     socket_.close();
     isConnected_ = false;
     queue_.clear();
-    handlers = pending_.takeAll();
+    endAll(Status::kClosed);
   }
   rings_.clear();
-  for (const Handler& handler : handlers) callHandler(handler, Status::kClosed);
+  tellEndings();
   const std::lock_guard lock(mutex_);
   newRings_.clear();
   isFinished_ = true;

@@ -4,6 +4,7 @@
 #include <chrono>
 #include <condition_variable>
 #include <cstdint>
+#include <deque>
 #include <functional>
 #include <memory>
 #include <mutex>
@@ -66,8 +67,15 @@ class ClientCore final : public ForkAware,
 
   void closeInChild() noexcept override;
 
+  // A request that is over, whose handler is still to be told.
+  struct Ending {
+    Handler handler;
+    Status status;
+  };
+
   // On any thread, with the lock.
   Submission refuse(Submission reason);
+  void endAll(Status status);
   PendingRequests::TimePoint deadlineAfter(
       const std::optional<std::chrono::milliseconds>& timeout) const;
   bool isOwnThread() const { return std::this_thread::get_id() == threadID_; }
@@ -89,6 +97,7 @@ class ClientCore final : public ForkAware,
   bool readFrames();
   bool takeReply(std::span<const std::uint8_t> item);
   void endExpired();
+  void tellEndings();
   void tellConnection(bool isConnected, const std::string& reason);
   bool isClosingDone() const;
   bool hasAnythingToSend() const;
@@ -123,7 +132,7 @@ class ClientCore final : public ForkAware,
   std::optional<WakeEvent> wake_;
   Phase phase_ = Phase::kOpen;
   bool isConnected_ = false;
-  bool isSilent_ = false;  // Closed from a handler: calls no other one.
+  bool isSilent_ = false;  // `close` is over: the thread calls no handler any more.
   bool isFinished_ = false;
   std::thread thread_;
   std::thread::id threadID_;
@@ -135,6 +144,7 @@ class ClientCore final : public ForkAware,
   std::string queue_;          // Whole frames.
   std::size_t queueSent_ = 0;  // Of the first ones, written already.
   PendingRequests pending_;
+  std::deque<Ending> endings_;
   RestorableSessions sessions_;
   RestorableSessions sessionsToRestore_;
   std::vector<std::shared_ptr<AudioSender::Ring>> newRings_;

@@ -8,6 +8,8 @@
 #include <chrono>
 #include <condition_variable>
 #include <cstring>
+#include <future>
+#include <memory>
 #include <mutex>
 #include <string_view>
 
@@ -250,6 +252,30 @@ TEST_F(ClientOfAHostileService, ClosesWhileItNeverReads) {
   service.accept();
   client.close();
   EXPECT_THAT(endings.wait(20), testing::AllOf(SizeIs(20), Each(Status::kClosed)));
+}
+
+// The client's own thread, which a handler holds up, cannot tell the others any more.
+TEST_F(ClientOfAHostileService, EndsAllByTheTimeThatItIsClosedThoughAHandlerHangs) {
+  struct Hang {
+    std::promise<void> isEntered;
+    std::promise<void> mayGo;
+  };
+  const auto hang = std::make_shared<Hang>();
+  client.getServiceNameForReporterID(kSession, [hang](const Reply<ServiceType>&) {
+    hang->isEntered.set_value();
+    hang->mayGo.get_future().wait();
+  });
+  client.startReportingSessionForID(kSession, endings.taken());
+  client.getAllReporters(endings.taken());
+  client.stopReportingSessionForID(kSession, endings.taken());
+  service.accept();
+  service.read(4);
+  service.say(frameOf("\x82\x01\x0b"sv));
+  hang->isEntered.get_future().wait();
+
+  client.close();
+  EXPECT_THAT(endings.wait(0), testing::AllOf(SizeIs(3), Each(Status::kClosed)));
+  hang->mayGo.set_value();
 }
 
 }  // namespace

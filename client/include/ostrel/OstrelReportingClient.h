@@ -126,8 +126,9 @@ class OSTREL_PUBLIC Client {
   bool flush(std::chrono::milliseconds timeout);
 
   /// Hands over what waits, says farewell and ends all open requests, within
-  /// `Options::closeTimeout`; later calls return `kClosed`. No handler runs
-  /// after it returns, but the one that it is called from.
+  /// `Options::closeTimeout`; later calls return `kClosed`. No handler is called
+  /// after it returns. One that is running then is waited for, 100 ms beyond
+  /// that time at most, unless it is the one that `close` is called from.
   void close();
 
   bool isConnected() const;
