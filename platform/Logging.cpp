@@ -9,7 +9,7 @@
 namespace ostrel {
 namespace {
 
-constexpr std::size_t kMostArgumentBytes = 2048;
+constexpr std::size_t kMostArgumentBytes = LogArgument::kMostBytes;
 
 class StandardErrorLog final : public ScopedLog {
  public:

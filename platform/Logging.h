@@ -74,6 +74,10 @@ class LogArgument {
           appendText(out, *static_cast<const T*>(at));
         }) {}
 
+  /// What of its text a line takes at most.
+  static constexpr std::size_t kMostBytes = 2048;
+
+  /// All of its text, or more of it than that.
   void appendTo(std::string& out) const { append_(out, value_); }
 
  private:
@@ -115,6 +119,7 @@ class LogArgument {
       out += '(';
       bool isFirst = true;
       for (const auto& element : value) {
+        if (out.size() > kMostBytes) return;  // The rest would be cut off.
         if (!isFirst) out += ", ";
         isFirst = false;
         appendText(out, element);

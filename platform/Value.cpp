@@ -584,7 +584,7 @@ DictionaryBuilder::DictionaryBuilder(std::shared_ptr<PayloadAccount> account)
 
 DictionaryBuilder::DictionaryBuilder(const Dictionary& start)
     : DictionaryBuilder(start.owner().account()) {
-  merge(start);
+  for (const auto& [key, value] : start) set(key, value);
 }
 
 std::optional<std::size_t> DictionaryBuilder::indexOf(std::string_view encodedKey) const {
@@ -613,7 +613,9 @@ DictionaryBuilder& DictionaryBuilder::set(ValueView key, ValueView value) {
   entry.value = scratch_.size();
   ValueEncoder(scratch_).item(value);
   entry.end = scratch_.size();
+  bytes_ += entry.end - entry.key;
   if (known) {
+    bytes_ -= entries_[*known].end - entries_[*known].key;
     entries_[*known] = entry;
     return *this;
   }
@@ -627,8 +629,27 @@ DictionaryBuilder& DictionaryBuilder::set(ValueView key, ValueView value) {
 }
 
 DictionaryBuilder& DictionaryBuilder::merge(const Dictionary& other) {
-  for (const auto& [key, value] : other) set(key, value);
+  const std::shared_ptr<PayloadAccount> client = other.owner().account();
+  if (client && !account_) account_ = client->accountOfMerged();
+  const std::size_t before = bytes_;
+  for (const auto& [key, value] : other) {
+    if (client) {
+      PayloadAccount::Merged merged = with(key, value);
+      merged.growth = merged.bytes - std::min(merged.bytes, before);
+      if (!client->mayMerge(merged)) continue;
+    }
+    set(key, value);
+  }
   return *this;
+}
+
+PayloadAccount::Merged DictionaryBuilder::with(ValueView key, ValueView value) const {
+  const std::string encodedKey = canonicalKey(key);
+  const std::size_t added = encodedKey.size() + value.bytes().size();
+  const auto known = indexOf(encodedKey);
+  if (!known) return {entries_.size() + 1, bytes_ + added};
+  return {entries_.size(),
+          bytes_ + added - (entries_[*known].end - entries_[*known].key)};
 }
 
 bool DictionaryBuilder::contains(std::string_view key) const {
@@ -638,8 +659,7 @@ bool DictionaryBuilder::contains(std::string_view key) const {
 Dictionary DictionaryBuilder::build() const {
   std::string head;
   ValueEncoder(head).beginDictionary(entries_.size());
-  std::size_t size = head.size();
-  for (const Entry& entry : entries_) size += entry.end - entry.key;
+  const std::size_t size = head.size() + bytes_;
   ValueBuffer buffer = ValueBuffer::make(size, account_);
   std::uint8_t* at = buffer.data();
   std::memcpy(at, head.data(), head.size());

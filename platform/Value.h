@@ -379,7 +379,8 @@ class DictionaryBuilder {
 
   DictionaryBuilder& set(std::string_view key, const Value& value);
   DictionaryBuilder& set(ValueView key, ValueView value);
-  /// Adds all entries of `other`; equal keys are replaced.
+  /// Adds the entries of `other`, all that their client may; equal keys are replaced.
+  /// What is built is borne by who bears the first that is merged, unless somebody does.
   DictionaryBuilder& merge(const Dictionary& other);
 
   bool contains(std::string_view key) const;
@@ -408,7 +409,9 @@ class DictionaryBuilder {
                                              entries_[index].value - entries_[index].key);
   }
   std::optional<std::size_t> indexOf(std::string_view encodedKey) const;
+  PayloadAccount::Merged with(ValueView key, ValueView value) const;
 
+  std::size_t bytes_ = 0;                  // Of what is not replaced.
   std::string scratch_;                    // Encoded keys and values, replaced ones too.
   std::vector<Entry> entries_;             // Offsets into `scratch_`.
   std::set<std::size_t, KeyOrder> order_;  // Filled once a walk would be slow.

@@ -26,6 +26,17 @@ class PayloadAccount {
   virtual bool keep(std::size_t bytes) noexcept = 0;
   /// Gives back what `keep` took. Any thread.
   virtual void discard(std::size_t bytes) noexcept = 0;
+
+  /// Asks whether an entry of this client's may be merged into a dictionary that goes
+  /// on when the message is gone. False: the entry is left out. Any thread, locks held.
+  struct Merged {
+    std::size_t entries;
+    std::size_t bytes;
+    std::size_t growth = 0;  // Of the bytes, since the merge began.
+  };
+  virtual bool mayMerge(const Merged& /*then*/) noexcept { return true; }
+  /// Who bears such a dictionary; none: nobody. Any thread, locks held.
+  virtual std::shared_ptr<PayloadAccount> accountOfMerged() noexcept { return nullptr; }
 };
 
 /// The shared bytes below values: one allocation, counted references.

@@ -294,16 +294,36 @@ std::shared_ptr<OstrelReportingSession> OstrelReportingServerInstance::ownSessio
   return found != clientReportingSessionMap_.end() ? found->second : nullptr;
 }
 
+// To find and sort 40,000 sessions takes 10 ms, which every other client waits for.
+const std::vector<OstrelReportingServerInstance::Entry>&
+OstrelReportingServerInstance::entriesInOrder() const {
+  const auto isBefore = [](const Entry& a, const Entry& b) {
+    return a.reporterID < b.reporterID;
+  };
+  if (!std::exchange(isOrderKnown_, true)) {
+    latestEntries_.clear();
+    for (const auto& [reporterID, session] : clientReportingSessionMap_) {
+      latestEntries_.push_back({reporterID, &session});
+    }
+    entriesInOrder_.clear();
+  }
+  if (latestEntries_.empty()) return entriesInOrder_;
+  std::sort(latestEntries_.begin(), latestEntries_.end(), isBefore);
+  const auto middle = static_cast<std::ptrdiff_t>(entriesInOrder_.size());
+  entriesInOrder_.insert(entriesInOrder_.end(), latestEntries_.begin(),
+                         latestEntries_.end());
+  std::inplace_merge(entriesInOrder_.begin(), entriesInOrder_.begin() + middle,
+                     entriesInOrder_.end(), isBefore);
+  latestEntries_ = {};
+  return entriesInOrder_;
+}
+
 std::vector<std::shared_ptr<OstrelReportingSession>>
 OstrelReportingServerInstance::sessionsInOrder() const {
   std::vector<std::shared_ptr<OstrelReportingSession>> sessions;
-  sessions.reserve(clientReportingSessionMap_.size());
-  for (const auto& [reporterID, session] : clientReportingSessionMap_) {
-    sessions.push_back(session);
-  }
-  std::sort(sessions.begin(), sessions.end(), [](const auto& a, const auto& b) {
-    return a->reporterID() < b->reporterID();
-  });
+  const std::vector<Entry>& entries = entriesInOrder();
+  sessions.reserve(entries.size());
+  for (const Entry& entry : entries) sessions.push_back(*entry.session);
   return sessions;
 }
 
@@ -319,7 +339,9 @@ void OstrelReportingServerInstance::createReportingSession(ReporterID reporterID
 void OstrelReportingServerInstance::createStep(ReporterID reporterID,
                                                const BoolReply& reply) {
   master_->platform_.kernelTrace->trace(TraceCode::kCreate);
-  auto& session = clientReportingSessionMap_[reporterID];
+  const auto [place, isNew] = clientReportingSessionMap_.try_emplace(reporterID);
+  auto& session = place->second;
+  if (isNew && isOrderKnown_) latestEntries_.push_back({reporterID, &session});
   session = OstrelReportingSession::initWithID(
       reporterID, /*processIdentifiers=*/{clientID_}, master_->platform_);
   master_->indexSession(*session, *this);
@@ -544,6 +566,9 @@ void OstrelReportingServerInstance::destroyStep(ReporterID reporterID,
   if (const auto session = ownSession(reporterID)) {
     if (session->started()) session->stop();
     master_->sessionIndex_.remove(reporterID, *this);
+    isOrderKnown_ = false;
+    entriesInOrder_ = {};
+    latestEntries_ = {};
     clientReportingSessionMap_.erase(reporterID);
   }
   OSTREL_LOG_DEFAULT(logScope, "destroying %lli", reporterID);
@@ -582,8 +607,8 @@ void OstrelReportingServerInstance::getAllReporters(ReporterIDsReply reply) {
 void OstrelReportingServerInstance::getAllReportersStep(const ReporterIDsReply& reply) {
   ReporterIDs reporters;
   for (const auto& client : master_->clients()) {
-    for (const auto& session : client->sessionsInOrder()) {
-      reporters.push_back(session->reporterID());
+    for (const auto& entry : client->entriesInOrder()) {
+      reporters.push_back(entry.reporterID);
     }
   }
   call(reply, reporters);

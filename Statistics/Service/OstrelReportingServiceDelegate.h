@@ -209,6 +209,13 @@ class OstrelReportingServerInstance final
   std::shared_ptr<OstrelReportingSession> ownSession(ReporterID reporterID) const
       OSTREL_ON_QUEUE(serverQueueRole);
 
+  /// One of the map.
+  struct Entry {
+    ReporterID reporterID;
+    const std::shared_ptr<OstrelReportingSession>* session;
+  };
+  const std::vector<Entry>& entriesInOrder() const OSTREL_ON_QUEUE(serverQueueRole);
+
   // Constant after construction.
   const std::shared_ptr<OstrelReportingServiceDelegate> master_;
   const ProcessID clientID_;
@@ -216,6 +223,10 @@ class OstrelReportingServerInstance final
   // On the queue. `registration_` numbers the registered clients in their
   // order; 0 while this one is not registered.
   SessionMap clientReportingSessionMap_ OSTREL_GUARDED_BY(serverQueueRole);
+  // The map in its order since somebody asked for that, but for what was made after.
+  mutable std::vector<Entry> entriesInOrder_ OSTREL_GUARDED_BY(serverQueueRole);
+  mutable std::vector<Entry> latestEntries_ OSTREL_GUARDED_BY(serverQueueRole);
+  mutable bool isOrderKnown_ OSTREL_GUARDED_BY(serverQueueRole) = false;
   std::uint64_t registration_ OSTREL_GUARDED_BY(serverQueueRole) = 0;
 
   // Shared, each with its own lock.

@@ -53,19 +53,39 @@ inline constexpr std::size_t kQueuedBytes = 4 * 1024 * 1024;
 /// many times the memory.
 /// [RequestBudget.IsExceededBeyondItsBytes,
 /// PeerChannelBudget.IsThatOfAllConnectionsOfTheUserToo]
-inline constexpr std::size_t kQueuedBytesOfUser = 32 * 1024 * 1024;
+inline constexpr std::size_t kQueuedBytesOfUser = 16 * 1024 * 1024;
 
 /// What a connection may have of that when the user's other connections have it all: a
 /// client with a request or two is served however much the others sent.
 /// [UnixSocketListener.ServesAClientWithLittleUnderWayHoweverMuchItsUserHas]
 inline constexpr std::size_t kReservedQueuedBytes = 8 * 1024;
 
+/// That of all the user's connections together, where these are few: then each has its
+/// part of it, `kMostReservedBytes` at most. A client with some requests a moment is
+/// served while others have all that they may.
+/// [PeerChannelBudget.ReservesMoreWhereConnectionsAreFew]
+inline constexpr std::size_t kReservedQueuedBytesOfUser =
+    kConnectionsOfUser * kReservedQueuedBytes;
+inline constexpr std::size_t kMostReservedBytes = 64 * 1024;
+
 /// Sessions in all, and of one user. Room for the 16,384 that are promised and for
 /// load tests of 100,000 by one user; an idle session costs some 500 bytes.
 /// [UserAccount.TakesSessionsUpToTheUsersShareAndTheServices,
 /// UnixSocketListener.MakesAsManySessionsAsAllowedAndAnswersYesForOneMore]
 inline constexpr std::size_t kSessions = 256 * 1024;
-inline constexpr std::size_t kSessionsOfUser = 128 * 1024;
+inline constexpr std::size_t kSessionsOfUser = 100 * 1024;
+
+/// What one of them is taken to need in memory as long as it is idle.
+/// [CrowdedUser.HasMoreThanItsMemory]
+inline constexpr std::size_t kSessionBytes = 512;
+
+/// What all that one user's clients have in memory may be: requests under way, replies
+/// and halves of frames, user infos, sessions. Beyond it there is only a part of each
+/// share, an eighth or, of requests, a quarter and, of frames, a half; so that the
+/// service stays within 96 MiB though the shares are more together.
+/// [CrowdedUser.HasMoreThanItsMemory,
+/// CrowdedUser.HasPartOfEachShare]
+inline constexpr std::size_t kMemoryOfUser = 20 * 1024 * 1024;
 
 /// Bytes of the entries that sessions keep for their summaries, in all, and of the
 /// messages of one user's clients. Room for a session of a million messages with its
@@ -85,10 +105,49 @@ inline constexpr std::size_t kRequestBytes = 256;
 /// [UnixSocketListener.ChargesEachDeliveryOfAMessage]
 inline constexpr std::size_t kDeliveryBytes = 512;
 
+/// What a request costs besides that starts a session, until the start is over and what
+/// it put into the store's queue is written: the client may have gone meanwhile.
+/// [RequestBurden.OfAStartLastsUntilItsLastStepHasRun]
+inline constexpr std::size_t kStartBytes = 4096;
+
+/// What one costs besides that stops or destroys a session or changes its type, until its
+/// last step on the session's queue has run, and the store's likewise.
+/// [RequestBurden.OfAStopLastsUntilItsLastStepHasRun]
+inline constexpr std::size_t kSessionStepBytes = 512;
+
 /// What a request that wants a reply costs besides: the callback, and the reply
 /// that it causes. Keeps the replies to what is queued below `kUnreadReplyBytes`.
 /// [UnixSocketListener.CutsOffAClientThatNeverReadsItsReplies]
 inline constexpr std::size_t kReplyBytes = 256;
+
+// Turns
+
+/// Work that a client's turn may take, in nanoseconds of an estimate: then the requests
+/// that it brought are served, and others have theirs. Some hundred messages of usual
+/// size, so that a turn costs no more than it did when it had no end.
+/// [PeerConnectionTurn.EndsWhenItsWorkIsDone]
+inline constexpr std::uint64_t kTurnWork = 500'000;
+
+/// How long turns are taken before the sockets are looked at again: whoever was quiet
+/// then goes before the rest of the line.
+/// [FairLineOrder.LetsWhoAsksForLittleGoFirst]
+inline constexpr std::chrono::milliseconds kTurnsBetweenLooks{1};
+
+// What sessions are told of themselves
+
+/// Of one session's user info, which configurations add to and nothing takes from. An
+/// entry beyond it is left out. A few dozen entries are usual, of a kilobyte or two.
+/// [UserInfo.TakesBytesUpToTheLimit]
+inline constexpr std::size_t kUserInfoBytes = 64 * 1024;
+
+/// Its entries: each configuration looks at all of them.
+/// [UserInfo.TakesEntriesUpToTheLimit]
+inline constexpr std::size_t kUserInfoEntries = 512;
+
+/// The bytes of all that one user's clients gave, the copies that live telemetry sessions
+/// have among them: a kilobyte for each of 16,384 sessions.
+/// [UserInfo.OfAllSessionsOfAUserTakesBytesUpToTheLimit]
+inline constexpr std::size_t kUserInfoBytesOfUser = 16 * 1024 * 1024;
 
 // Replies
 
@@ -106,16 +165,16 @@ inline constexpr std::size_t kUnreadReplyBytesToPause = kUnreadReplyBytes / 4;
 /// them. Beyond it each may have `kUnreadReplyBytesInNeed`, so that many connections
 /// do not make many times the memory.
 /// [UnreadReplies.OfOthersLeaveAClientItsRoomUpToTheLimitOfTheirUser]
-inline constexpr std::size_t kUnreadReplyBytesOfUser = 16 * 1024 * 1024;
+inline constexpr std::size_t kUnreadReplyBytesOfUser = 8 * 1024 * 1024;
 
 /// Of one connection, then: a thousand short replies.
 /// [UnreadReplies.BeyondItAreFewForEachClient]
 inline constexpr std::size_t kUnreadReplyBytesInNeed = 16 * 1024;
 
-/// Bytes of frames that are not whole yet, of all connections of one user: fifty of the
-/// largest. Beyond it the connection that is in one longest is cut off.
+/// Bytes of frames that are not whole yet, of all connections of one user: some 25 of
+/// the largest. Beyond it the connection that is in one longest is cut off.
 /// [UnixSocketListener.CutsOffWhoIsLongestInAFrameWhereAUserHasTooManyHalves]
-inline constexpr std::size_t kHalfFrameBytesOfUser = 16 * 1024 * 1024;
+inline constexpr std::size_t kHalfFrameBytesOfUser = 8 * 1024 * 1024;
 
 /// How long such a client may read nothing at all before it is cut off.
 /// [UnixSocketListener.CutsOffAClientThatNeverReadsItsReplies]
@@ -139,10 +198,10 @@ inline constexpr std::chrono::seconds kMisuseLogInterval{60};
 /// [FileEntryStorageTest.LeavesAListInMemoryUpToItsShare]
 inline constexpr std::size_t kListBytesInMemory = 256 * 1024;
 
-/// The same of all sessions together: a hundred long ones at a time, and a small part of
-/// what the service may have. Each session begins with 1 KiB whatever the others have.
-/// [FileEntryStorageTest.RefusesWhatFitsNeitherDiskNorMemory]
-inline constexpr std::size_t kListsBytesInMemory = 24 * 1024 * 1024;
+/// The same of all sessions together: some dozens of long ones at a time, and a small
+/// part of what the service may have. Each session begins with 1 KiB whatever the others
+/// have. [FileEntryStorageTest.RefusesWhatFitsNeitherDiskNorMemory]
+inline constexpr std::size_t kListsBytesInMemory = 12 * 1024 * 1024;
 
 /// Of that, what waits for more of other sessions so that it is written to the file
 /// together.

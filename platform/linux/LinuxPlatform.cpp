@@ -117,6 +117,7 @@ Outcome<std::unique_ptr<LinuxPlatform>> LinuxPlatform::open() {
       new Bindings{log, peers, timers, notice, misuse, *std::move(listener.value)});
   notice->setStore(bindings->store);
   bindings->listener->setHeapKeeper(std::make_shared<HeapKeeper>(timers));
+  bindings->listener->setDisposal(&bindings->queues->backgroundQueue());
   return {std::unique_ptr<LinuxPlatform>(new LinuxPlatform(std::move(bindings))),
           std::nullopt};
 }

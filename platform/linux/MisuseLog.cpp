@@ -14,6 +14,8 @@ std::string_view sentenceOf(MisuseLog::Kind kind) {
       return "is not let in";
     case MisuseLog::Kind::kSessionRefused:
       return "gets no session";
+    case MisuseLog::Kind::kUserInfoRefused:
+      return "has no room for entries of a configuration";
   }
   return "";
 }
@@ -50,6 +52,8 @@ std::string_view MisuseLog::keyOf(Kind kind) {
       return "connections_refused";
     case Kind::kSessionRefused:
       return "sessions_refused";
+    case Kind::kUserInfoRefused:
+      return "configurations_cut";
   }
   return "";
 }

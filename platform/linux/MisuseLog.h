@@ -18,8 +18,13 @@ class MisuseLog {
  public:
   using Clock = std::chrono::steady_clock;
 
-  enum class Kind : std::size_t { kCutOff, kConnectionRefused, kSessionRefused };
-  static constexpr std::size_t kKinds = 3;
+  enum class Kind : std::size_t {
+    kCutOff,
+    kConnectionRefused,
+    kSessionRefused,
+    kUserInfoRefused
+  };
+  static constexpr std::size_t kKinds = 4;
 
   using Counts = std::array<std::uint64_t, kKinds>;
 

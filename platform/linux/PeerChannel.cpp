@@ -25,6 +25,7 @@ PeerChannel::PeerChannel(LoopWaker::ConnectionID id, std::shared_ptr<LoopWaker> 
       user_(std::move(user)),
       unreadReplyBytes_(limits.unreadReplyBytes),
       reservedQueuedBytes_(limits.reservedQueuedBytes),
+      mostReservedBytes_(limits.mostReservedBytes),
       own_(limits.queuedBytes),
       idsReplyBytes_(kAssumedIDsReplyBytes) {}
 
@@ -53,6 +54,15 @@ void PeerChannel::reply(wire::RequestNumber number, const wire::ReplyValue& valu
 void PeerChannel::charge(std::size_t bytes) noexcept {
   own_.take(bytes);
   user_->queued().take(bytes);
+}
+
+bool PeerChannel::mayMerge(const Merged& then) noexcept {
+  if (then.entries <= limits::kUserInfoEntries && then.bytes <= limits::kUserInfoBytes &&
+      user_->hasRoomForInfo(then.growth)) {
+    return true;
+  }
+  hasRefusedMerge_ = true;
+  return false;
 }
 
 void PeerChannel::relieve(std::size_t bytes) noexcept { give(bytes); }

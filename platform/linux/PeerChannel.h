@@ -25,8 +25,10 @@ class PeerChannel final : public PayloadAccount {
   struct Limits {
     std::size_t queuedBytes;
     std::size_t unreadReplyBytes;
-    /// What the connection may have under way whatever its user has.
+    /// What the connection may have under way whatever its user has: at least, and where
+    /// its user has few.
     std::size_t reservedQueuedBytes = 0;
+    std::size_t mostReservedBytes = 0;
   };
 
   PeerChannel(LoopWaker::ConnectionID id, std::shared_ptr<LoopWaker> waker,
@@ -41,6 +43,15 @@ class PeerChannel final : public PayloadAccount {
   void relieve(std::size_t bytes) noexcept override;
   bool keep(std::size_t bytes) noexcept override { return user_->keep(bytes); }
   void discard(std::size_t bytes) noexcept override { user_->discard(bytes); }
+  bool mayMerge(const Merged& then) noexcept override;
+  std::shared_ptr<PayloadAccount> accountOfMerged() noexcept override {
+    return user_->accountOfInfos();
+  }
+  /// Whether `mayMerge` said no since the last call.
+  bool takeRefusedMerge() noexcept {
+    return hasRefusedMerge_.load(std::memory_order_relaxed) &&
+           hasRefusedMerge_.exchange(false);
+  }
 
   /// The loop's: one more session of the client's user. False: it has as many as it
   /// may have, or the service has.
@@ -85,7 +96,11 @@ class PeerChannel final : public PayloadAccount {
 
  private:
   void give(std::size_t bytes) noexcept;
-  bool isBeyondReserve() const { return own_.used() > reservedQueuedBytes_; }
+  bool isBeyondReserve() const {
+    const std::size_t used = own_.used();
+    return used > reservedQueuedBytes_ &&
+           used > user_->reservedQueuedBytes(reservedQueuedBytes_, mostReservedBytes_);
+  }
   void updateUnread();
 
   const LoopWaker::ConnectionID id_;
@@ -93,7 +108,9 @@ class PeerChannel final : public PayloadAccount {
   const std::shared_ptr<UserAccount> user_;
   const std::size_t unreadReplyBytes_;
   const std::size_t reservedQueuedBytes_;
+  const std::size_t mostReservedBytes_;
 
+  std::atomic<bool> hasRefusedMerge_{false};
   RequestBudget own_;
   std::atomic<bool> awaitsReserve_{false};
   std::uint64_t chargedMark_ = 0;  // The loop's.

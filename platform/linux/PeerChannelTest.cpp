@@ -78,6 +78,28 @@ TEST_F(PeerChannelBudget, IsThatOfAllConnectionsOfTheUserToo) {
   EXPECT_FALSE(other.isOverBudget());
 }
 
+TEST_F(PeerChannelBudget, ReservesMoreWhereConnectionsAreFew) {
+  UserAccount::Limits limits{/*queuedBytes=*/100, /*sessions=*/10, /*keptBytes=*/500};
+  limits.reservedQueuedBytes = 40;
+  const auto user = std::make_shared<UserAccount>(1000, limits, service_);
+  user->queued().take(101);
+  const auto mayHave = [&](std::size_t connections, std::size_t bytes) {
+    user->setConnections(connections);
+    PeerChannel channel(1, std::make_shared<LoopWaker>(), user,
+                        PeerChannel::Limits{/*queuedBytes=*/60, kMostUnread,
+                                            /*reservedQueuedBytes=*/5,
+                                            /*mostReservedBytes=*/20});
+    channel.charge(bytes);
+    return !channel.isOverBudget();
+  };
+  EXPECT_TRUE(mayHave(/*connections=*/4, /*bytes=*/10));
+  EXPECT_FALSE(mayHave(/*connections=*/4, /*bytes=*/11));
+  EXPECT_TRUE(mayHave(/*connections=*/1, /*bytes=*/20)) << "that is the most";
+  EXPECT_FALSE(mayHave(/*connections=*/1, /*bytes=*/21));
+  EXPECT_TRUE(mayHave(/*connections=*/100, /*bytes=*/5)) << "that is the least";
+  EXPECT_FALSE(mayHave(/*connections=*/100, /*bytes=*/6));
+}
+
 TEST_F(PeerChannelBudget, IsGivenBackWithTheConnectionsRequests) {
   {
     PeerChannel other = makeChannel(2);

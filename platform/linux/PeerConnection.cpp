@@ -18,9 +18,44 @@ namespace {
 // A frame that is not whole grows by as much as comes, not by what it claims.
 constexpr std::size_t kMostGrowth = 64 * 1024;
 
-// Read at a time while the user's clients have all under way that they may: some more
-// than a connection has for itself then, and little that has to wait in memory.
-constexpr std::size_t kReadInNeed = 2 * limits::kReservedQueuedBytes;
+// Read at a time: at first and at most.
+constexpr std::size_t kFirstReadBytes = 16 * 1024;
+constexpr std::size_t kLeastReadBytes = 4 * 1024;
+
+// Work, in nanoseconds: what requests were seen to take on the server's queue, log lines
+// included.
+constexpr std::uint64_t kWorkOfRequest = 2000;
+constexpr std::uint64_t kWorkOfConfiguration = 20'000;
+constexpr std::uint64_t kWorkOfMessage = 500;
+constexpr std::uint64_t kWorkOfDelivery = 500;
+constexpr std::uint64_t kWorkOfByte = 2;
+constexpr std::uint64_t kWorkOfLaterByte = 20;  // Of many keys, at the worst.
+constexpr std::size_t kFirstBytes = 4096;
+constexpr std::uint64_t kWorkOfReading = 2000;
+constexpr std::uint64_t kWorkOfSessionListed = 100;
+constexpr std::uint64_t kWorkOfSessionAsked = 200;
+
+std::uint64_t workOf(const wire::Request& request, std::size_t bytes,
+                     std::size_t sessionsOfAll) {
+  const std::size_t first = std::min(bytes, kFirstBytes);
+  const std::uint64_t work = first * kWorkOfByte + (bytes - first) * kWorkOfLaterByte;
+  switch (request.operation) {
+    case wire::Operation::kSendMessage:
+      return work + kWorkOfMessage +
+             (request.reporterIDs ? request.reporterIDs->size() * kWorkOfDelivery
+                                  : sessionsOfAll * kWorkOfSessionAsked);
+    case wire::Operation::kGetAllReporters:
+      return work + kWorkOfRequest + sessionsOfAll * kWorkOfSessionListed;
+    case wire::Operation::kSetConfiguration:
+      return work + kWorkOfConfiguration;
+    default:
+      return work + kWorkOfRequest;
+  }
+}
+
+// Read at a time while the user's clients have all under way that they may: part of what
+// a connection has for itself then, since what cannot be carried out waits in memory.
+constexpr std::size_t kReadInNeed = limits::kReservedQueuedBytes / 2;
 
 // What of a frame is copied once more. A client that writes byte by byte makes the
 // service copy half of this for each.
@@ -44,10 +79,12 @@ bool closePassedDescriptors(msghdr& message) {
   return hasPassed;
 }
 
-// How many of the first bytes are frames that are whole and not too large.
-std::size_t wholeFrames(std::span<const std::uint8_t> bytes, std::size_t mostBytes) {
+// How many of the first bytes are frames that are whole and not too large; no further
+// frame from `enough` on.
+std::size_t wholeFrames(std::span<const std::uint8_t> bytes, std::size_t mostBytes,
+                        std::size_t enough) {
   std::size_t whole = 0;
-  while (bytes.size() - whole >= wire::kFrameHeaderSize) {
+  while (whole < enough && bytes.size() - whole >= wire::kFrameHeaderSize) {
     const std::size_t length = wire::frameLength(bytes.data() + whole);
     if (length == 0 || length > mostBytes) break;
     if (bytes.size() - whole - wire::kFrameHeaderSize < length) break;
@@ -66,7 +103,8 @@ PeerConnection::PeerConnection(ID id, FileDescriptor socket, PeerIdentity peer,
       peer_(peer),
       channel_(std::move(channel)),
       limits_(limits),
-      misuse_(misuse) {}
+      misuse_(misuse),
+      readBytes_(kFirstReadBytes) {}
 
 std::string PeerConnection::description() const {
   return format("<connection %lu of process %i, user %u>", id_, peer_.pid, peer_.user);
@@ -89,6 +127,19 @@ void PeerConnection::setInvalidationHandler(std::function<void()> handler) {
   invalidated_ = std::move(handler);
 }
 
+std::uint64_t PeerConnection::takeTurn(std::span<std::uint8_t> buffer) {
+  work_ = 0;
+  noteRefusedMerge();
+  if (ending_ != Ending::kNone) return 0;
+  if (std::exchange(isUnfinished_, false)) {
+    if (!holdBackIfFull()) processPending();
+  } else if (wantsToRead()) {
+    work_ += kWorkOfReading;
+    read(buffer);
+  }
+  return work_;
+}
+
 // What is pending is a frame that is not whole. A little is put before what comes
 // next, so that a burst costs one call to the system; to more the rest is read
 // directly, so that a frame costs one copy however small its pieces are.
@@ -107,24 +158,33 @@ void PeerConnection::read(std::span<std::uint8_t> buffer) {
   }
   std::copy(pending_.begin(), pending_.end(), buffer.begin());
   std::span<std::uint8_t> room = buffer.subspan(pending_.size());
-  // What is read now will mostly be held back: it stays in the socket.
-  if (channel_->isUserOverBudget()) {
-    room = room.first(std::min(room.size(), kReadInNeed));
-  }
+  // What would be held back, or wait for the next turn, stays in the socket.
+  room = room.first(std::min(room.size(), channel_->isUserOverBudget()
+                                              ? std::min(readBytes_, kReadInNeed)
+                                              : readBytes_));
   const ssize_t count = receive(room);
   if (count <= 0) return;
   const auto bytes = buffer.first(pending_.size() + static_cast<std::size_t>(count));
   const std::size_t done = process(bytes);
   if (ending_ != Ending::kNone) return;
+  if (!isTurnOver() && static_cast<std::size_t>(count) == room.size()) {
+    readBytes_ = std::min(2 * readBytes_, buffer.size());
+  }
   if (done != 0 || pending_.empty()) pendingSince_ = Clock::now();
   pending_.assign(reinterpret_cast<const char*>(bytes.data()) + done,
                   bytes.size() - done);
 }
 
-void PeerConnection::continueReading() {
+void PeerConnection::noteRefusedMerge() {
+  if (!channel_->takeRefusedMerge()) return;
+  misuse_.note(peer_.user, MisuseLog::Kind::kUserInfoRefused, "there is too much",
+               Clock::now());
+}
+
+void PeerConnection::goOn() {
   if (!isHeldBack_ || ending_ != Ending::kNone) return;
   isHeldBack_ = false;
-  if (!holdBackIfFull()) processPending();
+  isUnfinished_ = !holdBackIfFull() && !pending_.empty();
 }
 
 ssize_t PeerConnection::receive(std::span<std::uint8_t> room) {
@@ -157,13 +217,13 @@ ssize_t PeerConnection::receive(std::span<std::uint8_t> room) {
 // Their payloads are left where they lie, in one copy of all that came: a burst of
 // messages takes one piece of memory and not one each (some 120 ns a message less).
 std::size_t PeerConnection::process(std::span<const std::uint8_t> bytes) {
-  const std::size_t whole = wholeFrames(bytes, limits_.frameBytes);
+  const std::size_t whole = wholeFrames(bytes, limits_.frameBytes, readBytes_);
   if (whole != 0 && holdBackIfFull()) return 0;
   ValueBuffer input = ValueBuffer::copyOfInput(bytes.first(whole), channel_);
   const auto frames = std::span(std::as_const(input).data(), whole);
   std::size_t used = 0;
   std::size_t done = 0;
-  while (done != whole && !holdBackIfFull()) {
+  while (done != whole && !isTurnOver() && !holdBackIfFull()) {
     const std::size_t length = wire::frameLength(frames.data() + done);
     used += carryOut(input, frames.subspan(done + wire::kFrameHeaderSize, length));
     if (ending_ != Ending::kNone) break;
@@ -172,6 +232,9 @@ std::size_t PeerConnection::process(std::span<const std::uint8_t> bytes) {
   // One message keeps all of them alive.
   if (used != 0) input.charge(input.memory() - used);
   if (done == whole) checkNextFrame(bytes.subspan(whole));
+  if (ending_ != Ending::kNone || isHeldBack_) return done;
+  if (isTurnOver()) readBytes_ = std::clamp(done, kLeastReadBytes, readBytes_);
+  isUnfinished_ = wholeFrames(bytes.subspan(done), limits_.frameBytes, /*enough=*/1) != 0;
   return done;
 }
 
@@ -227,6 +290,7 @@ std::size_t PeerConnection::carryOut(ValueBuffer& input,
   }
   // A client that has gone may have left thousands of questions behind.
   if (isDeaf_ && onlyAsks(request.operation)) return 0;
+  work_ += workOf(request, item.size(), channel_->sessionsOfAll());
   if (!countSession(request)) {
     dispatchRefusedSession(*object_, channel_, request);
     return 0;
@@ -277,6 +341,7 @@ std::size_t PeerConnection::missingBytes() const {
 }
 
 void PeerConnection::write(Clock::time_point now) {
+  noteRefusedMerge();
   const std::size_t before = channel_->unreadBytes();
   // A client that cannot be written to has gone; what it sent is still read.
   if (!channel_->flush(socket_.get())) {
@@ -308,10 +373,10 @@ void PeerConnection::breakOff(Ending ending, std::string_view reason) {
   channel_->flush(socket_.get());
 }
 
-void PeerConnection::invalidate() {
+std::shared_ptr<void> PeerConnection::invalidate() {
+  noteRefusedMerge();
   if (ending_ == Ending::kFarewell) channel_->flush(socket_.get());
   channel_->close();
-  channel_->giveSessions(sessions_.size());
   socket_.reset();
   if (ending_ != Ending::kFarewell && ending_ != Ending::kNone && interrupted_) {
     interrupted_();
@@ -319,7 +384,17 @@ void PeerConnection::invalidate() {
   if (invalidated_) invalidated_();
   interrupted_ = nullptr;
   invalidated_ = nullptr;
-  object_.reset();
+  struct Estate {
+    ~Estate() {
+      object.reset();
+      channel->giveSessions(sessions);
+    }
+    std::shared_ptr<OstrelReportingServiceProtocol> object;
+    std::shared_ptr<PeerChannel> channel;
+    std::size_t sessions;
+  };
+  return std::shared_ptr<Estate>(
+      new Estate{std::move(object_), channel_, sessions_.size()});
 }
 
 }  // namespace ostrel

@@ -27,9 +27,9 @@ struct ListenerLimits {
   std::size_t frameBytes = limits::kFrameBytes;
   std::size_t reporterIDs = limits::kReporterIDs;
   wire::PayloadLimits payload{limits::kNesting, limits::kNodes, limits::kKeyBytes};
-  std::size_t halfFrameBytesOfUser = limits::kHalfFrameBytesOfUser;
   std::size_t queuedBytes = limits::kQueuedBytes;
   std::size_t reservedQueuedBytes = limits::kReservedQueuedBytes;
+  std::size_t mostReservedBytes = limits::kMostReservedBytes;
   UserAccount::Limits ofUser{limits::kQueuedBytesOfUser, limits::kSessionsOfUser,
                              limits::kKeptBytesOfUser};
   std::size_t sessions = limits::kSessions;
@@ -37,6 +37,7 @@ struct ListenerLimits {
   std::size_t unreadReplyBytes = limits::kUnreadReplyBytes;
   std::size_t unreadReplyBytesToPause = limits::kUnreadReplyBytesToPause;
   std::chrono::milliseconds unreadPatience = limits::kUnreadPatience;
+  std::uint64_t turnWork = limits::kTurnWork;
 };
 
 /// Who is at the other end of a socket, by the kernel.
@@ -79,11 +80,14 @@ class PeerConnection final : public IPCConnection {
   const PeerIdentity& peer() const { return peer_; }
   bool isResumed() const { return isResumed_; }
 
-  /// Takes what the socket holds, once through `buffer`, and carries out the
-  /// requests that are whole.
-  void read(std::span<std::uint8_t> buffer);
-  /// Goes on with what was read before, if there is room for it now.
-  void continueReading();
+  /// Goes on with what was read before, or takes what the socket holds, once through
+  /// `buffer`; and carries out the requests that are whole, until the turn's work is
+  /// done. Returns that work, as `limits::kTurnWork` counts it.
+  std::uint64_t takeTurn(std::span<std::uint8_t> buffer);
+  /// Whether the next turn has something to do that is here already.
+  bool isUnfinished() const { return isUnfinished_ && ending_ == Ending::kNone; }
+  /// Looks whether there is room again for requests of a client that is held back.
+  void goOn();
   /// Writes replies as far as the client takes them.
   void write(Clock::time_point now);
   /// Cuts off a client that has read nothing for too long.
@@ -95,23 +99,32 @@ class PeerConnection final : public IPCConnection {
   bool isHeldBack() const { return isHeldBack_; }
   /// What of a frame is there that is not whole, and since when it waits. What is held
   /// back waits for the service, not for the client, and does not count.
-  std::size_t halfFrameBytes() const { return isHeldBack_ ? 0 : pending_.size(); }
+  std::size_t halfFrameBytes() const {
+    return isHeldBack_ || isUnfinished_ ? 0 : pending_.size();
+  }
   Clock::time_point pendingSince() const { return pendingSince_; }
   /// When `checkPatience` has something to say; none while the client reads.
   bool isImpatient() const { return hasUnread_; }
   Clock::time_point patienceEnds() const { return lastRead_ + limits_.unreadPatience; }
+
+  /// The client's sessions.
+  std::size_t sessions() const { return sessions_.size(); }
 
   Ending ending() const { return ending_; }
   std::string_view endingReason() const { return reason_; }
 
   /// Ends it with a reason that the client is told as far as it listens.
   void breakOff(Ending ending, std::string_view reason);
-  /// Closes the socket and calls the handlers. The last call.
-  void invalidate();
+  /// Closes the socket and calls the handlers. The last call. What is returned is what
+  /// the client leaves behind: its sessions, perhaps many, which go with it.
+  std::shared_ptr<void> invalidate();
 
  private:
+  void read(std::span<std::uint8_t> buffer);
   ssize_t receive(std::span<std::uint8_t> room);
+  void noteRefusedMerge();
   std::size_t process(std::span<const std::uint8_t> bytes);
+  bool isTurnOver() const { return work_ >= limits_.turnWork; }
   void processPending();
   std::size_t carryOut(ValueBuffer& input, std::span<const std::uint8_t> item);
   bool countSession(const wire::Request& request);
@@ -138,6 +151,9 @@ class PeerConnection final : public IPCConnection {
   std::string reason_;
   Ending ending_ = Ending::kNone;
   bool isResumed_ = false;
+  std::uint64_t work_ = 0;     // Of this turn.
+  std::size_t readBytes_;      // As much as a turn gets done, as far as is known.
+  bool isUnfinished_ = false;  // Frames that are whole are pending.
   bool isHeldBack_ = false;
   bool hasUnread_ = false;
   bool isDeaf_ = false;      // It will not read any more.

@@ -87,6 +87,7 @@ QueuedStep* takeMemory() {
 QueuedStep* QueuedStep::make(Task&& task) {
   QueuedStep* const step = takeMemory();
   step->task = std::move(task);
+  if (Burden::current() != nullptr) step->burden = BurdenShare::current();
   return step;
 }
 

@@ -4,6 +4,7 @@
 #include <utility>
 
 #include "platform/Task.h"
+#include "platform/linux/Burden.h"
 
 namespace ostrel {
 
@@ -14,9 +15,9 @@ namespace ostrel {
 /// through the allocator, at whose lock the two would meet each time.
 class QueuedStep {
  public:
-  /// A step with `task`. Any thread.
+  /// A step with `task`, which bears what the calling thread bears. Any thread.
   static QueuedStep* make(Task&& task);
-  /// Takes back the memory of a step whose task was reset. Any thread.
+  /// Takes back the memory of a step that was ended. Any thread.
   static void takeBack(QueuedStep* step) noexcept;
 
   /// How many steps' memory is kept at most for steps to come, beside a few dozen a
@@ -33,8 +34,26 @@ class QueuedStep {
     __builtin_prefetch(bytes + sizeof(QueuedStep) - 1, /*rw=*/1);
   }
 
+  /// Runs the task and ends it.
+  void run() {
+    if (!burden) {
+      task();
+      task = Task();
+      return;
+    }
+    const Burden::Scope bearing(burden.get());
+    task();
+    end();
+  }
+  /// What the task holds goes first, then the burden.
+  void end() noexcept {
+    task = Task();
+    burden = BurdenShare();
+  }
+
   Task task;
   QueuedStep* next = nullptr;
+  BurdenShare burden;
 
  private:
   static constexpr std::size_t kLine = 64;
@@ -100,8 +119,7 @@ class StepList {
     QueuedStep* const step = first_;
     first_ = step->next;
     if (first_ != nullptr) first_->fetchAhead();
-    step->task();
-    step->task = Task();
+    step->run();
     QueuedStep::takeBack(step);
   }
 
@@ -109,7 +127,7 @@ class StepList {
   void dropFirst() {
     QueuedStep* const step = first_;
     first_ = step->next;
-    step->task = Task();
+    step->end();
     QueuedStep::takeBack(step);
   }
 

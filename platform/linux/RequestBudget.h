@@ -15,23 +15,30 @@ class RequestBudget {
 
   /// True when a waiter is to be told, which is then no waiter any more.
   bool give(std::size_t bytes) noexcept {
-    return used_.fetch_sub(bytes) - bytes <= most_ / 2 && isAwaited_.load() &&
-           isAwaited_.exchange(false);
+    return used_.fetch_sub(bytes) - bytes <= half() && takeWaiter();
   }
 
-  bool isExceeded() const { return used_.load() > most_; }
+  /// From now on so many may be under way; what is beyond it runs off. True as `give`.
+  bool limitTo(std::size_t most) noexcept {
+    if (most_.exchange(most) >= most) return false;
+    return used_.load() <= half() && takeWaiter();
+  }
 
+  bool isExceeded() const { return used_.load() > most_.load(); }
   /// Begins to wait until at most half is used; false when that is so already.
   bool await() {
     isAwaited_ = true;
     // Whoever gives after this sees the waiter; whoever gave before is seen here.
-    return used_.load() > most_ / 2;
+    return used_.load() > half();
   }
 
   std::size_t used() const { return used_.load(); }
 
  private:
-  const std::size_t most_;
+  std::size_t half() const { return most_.load() / 2; }
+  bool takeWaiter() noexcept { return isAwaited_.load() && isAwaited_.exchange(false); }
+
+  std::atomic<std::size_t> most_;
   std::atomic<std::size_t> used_{0};
   std::atomic<bool> isAwaited_{false};
 };

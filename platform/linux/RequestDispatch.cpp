@@ -3,11 +3,14 @@
 // keeps in memory (the step on the queue, its ID list, its reply) is charged by a
 // ticket that the reply callback owns. Requests run in the order in which they were
 // queued, so that a ticket that is called or dropped says the same of all before it.
+// What a request puts on a session's queue, and from there into the store's, is none of
+// these: it is charged to a burden that travels with it.
 #include "platform/linux/RequestDispatch.h"
 
 #include <array>
 #include <utility>
 
+#include "platform/linux/Burden.h"
 #include "platform/linux/Limits.h"
 #include "platform/linux/wire/OperationTable.h"
 
@@ -43,6 +46,34 @@ class RequestTicket {
   const wire::RequestNumber number_;
   const std::uint64_t mark_;
 };
+
+class SessionStepBurden final : public Burden {
+ public:
+  SessionStepBurden(std::shared_ptr<PeerChannel> channel, std::size_t bytes)
+      : channel_(std::move(channel)), bytes_(bytes) {
+    channel_->charge(bytes_);
+  }
+
+ private:
+  ~SessionStepBurden() override { channel_->relieve(bytes_); }
+
+  const std::shared_ptr<PeerChannel> channel_;
+  const std::size_t bytes_;
+};
+
+// Of what a request leaves for a session's queue to do.
+std::size_t burdenOf(Operation operation) {
+  switch (operation) {
+    case Operation::kStartReportingSessionForID:
+      return limits::kStartBytes;
+    case Operation::kSetServiceType:
+    case Operation::kStopReportingSessionForID:
+    case Operation::kDestroyReportingSession:
+      return limits::kSessionStepBytes;
+    default:
+      return 0;
+  }
+}
 
 // A reply callback of any of the protocol's types, or none.
 class Reply {
@@ -157,6 +188,11 @@ void dispatchRequest(OstrelReportingServiceProtocol& object,
     ticket = std::make_shared<RequestTicket>(channel, request.number,
                                              channel->chargeRequest(cost));
   }
+  BurdenShare burden;
+  if (const std::size_t bytes = burdenOf(request.operation); bytes != 0) {
+    burden = BurdenShare(new SessionStepBurden(channel, bytes));
+  }
+  const Burden::Scope bearing(burden.get());
   const auto row = static_cast<std::size_t>(request.operation);
   kHandlers[row].call(object, request, Reply(std::move(ticket)));
 }

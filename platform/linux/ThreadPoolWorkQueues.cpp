@@ -697,7 +697,7 @@ class ThreadPoolWorkQueues::Background final : public ConcurrentQueue {
 ThreadPoolWorkQueues::ThreadPoolWorkQueues(std::shared_ptr<TimerThread> timers)
     : shared_(std::make_shared<Shared>()),
       pools_{std::make_shared<Pool>(
-                 Pool::Kind{"ostrel-ui-", /*niceness=*/-5, kMostInteractiveThreads,
+                 Pool::Kind{"ostrel-ui-", kInteractiveNiceness, kMostInteractiveThreads,
                             /*isBatched=*/true},
                  shared_, timers),
              std::make_shared<Pool>(

@@ -30,16 +30,18 @@ class BlockedSignals {
 
 }  // namespace
 
+// On Linux a priority belongs to a thread, not to its process.
+bool setNiceness(int niceness) {
+  return setpriority(PRIO_PROCESS, static_cast<id_t>(gettid()), niceness) == 0;
+}
+
 std::thread startThread(const std::string& name, int niceness,
                         std::function<void()> body) {
   const BlockedSignals blocked;
   return std::thread(
       [name = name.substr(0, kMostNameBytes), niceness, body = std::move(body)] {
         pthread_setname_np(pthread_self(), name.c_str());
-        // On Linux a priority belongs to a thread, not to its process.
-        if (niceness != 0) {
-          setpriority(PRIO_PROCESS, static_cast<id_t>(gettid()), niceness);
-        }
+        setNiceness(niceness);
         body();
       });
 }

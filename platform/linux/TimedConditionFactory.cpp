@@ -3,6 +3,8 @@
 #include <mutex>
 #include <utility>
 
+#include "platform/linux/Burden.h"
+
 namespace ostrel {
 namespace {
 
@@ -48,6 +50,8 @@ class TimedCondition final : public Condition,
   }
 
   const std::shared_ptr<TimerThread> timers_;
+  // Of who waits: what they hold meanwhile is theirs.
+  const BurdenShare burden_ = BurdenShare::current();
   std::mutex mutex_;  // What `lock` and `unlock` mean; of all that follows.
   std::uint64_t waits_ = 0;
   Waiter waiter_;

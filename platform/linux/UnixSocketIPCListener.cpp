@@ -1,8 +1,10 @@
-// One thread, one epoll. The requests that one look at the sockets brings are served
-// on this thread too before it waits again, and their replies written: a round trip
-// takes no other thread. A connection is in the epoll only while it has something
-// to wait for: a client that is held back is taken out, so that its hanging up does
-// not spin the loop, and comes back when its requests have been carried out.
+// One thread, one epoll. Whoever is readable at a look stands in line for a turn. What
+// the turns of a while bring is served on this thread too before it looks again, and
+// the replies written: a round trip takes no other thread, and a client that asks little
+// waits for little however much the others ask. A connection is in the epoll only while
+// it has something to wait for: a client that is held back is taken out, so that its
+// hanging up does not spin the loop, and comes back when its requests have been carried
+// out.
 #include "platform/linux/UnixSocketIPCListener.h"
 
 #include <sys/epoll.h>
@@ -17,6 +19,7 @@
 #include "platform/linux/ProcProcessInfo.h"
 #include "platform/linux/SystemdService.h"
 #include "platform/linux/ThreadPoolWorkQueues.h"
+#include "platform/linux/Threads.h"
 
 #ifndef SO_PEERPIDFD
 #define SO_PEERPIDFD 77
@@ -32,9 +35,16 @@ constexpr PeerConnection::ID kFirstConnection = 3;
 
 // Many frames a system call; what is held back of it stays small.
 constexpr std::size_t kReadBytes = 64 * 1024;
-constexpr int kMostEvents = 64;
+constexpr int kMostEvents = 1024;
 
-constexpr int kMostAccepted = 64;
+// In nanoseconds, as `limits::kTurnWork`: what accepting and ending one were seen to
+// take.
+constexpr std::uint64_t kWorkOfAccepting = 25'000;
+constexpr std::uint64_t kWorkOfEnding = 40'000;
+constexpr std::uint64_t kWorkOfSessionsEnd = 2000;
+
+// Few are given up at once: what waits for a thread of lower priority keeps its memory.
+constexpr std::size_t kManySessions = 500;
 
 bool watchDescriptor(int epoll, int descriptor, std::uint64_t id) {
   epoll_event event{};
@@ -107,25 +117,12 @@ UnixSocketIPCListener::~UnixSocketIPCListener() = default;
 
 void UnixSocketIPCListener::resume() {
   buffer_.resize(kReadBytes);
+  setNiceness(kInteractiveNiceness);  // What this thread serves is of that class.
+  events_.resize(kMostEvents);
   notifySystemd("READY=1");
-  std::array<epoll_event, kMostEvents> events;
   while (!isStopping_) {
-    const bool mayWait = waker_->beginWait();
-    const int count = ::epoll_wait(epoll_.get(), events.data(), kMostEvents,
-                                   mayWait ? millisecondsToWait() : 0);
-    waker_->endWait();
-    if (heap_ && count > 0) heap_->noteWork();
-    {
-      const ThreadPoolWorkQueues::Batch requests;
-      for (int i = 0; i < count; ++i) {
-        const epoll_event& event = events[static_cast<std::size_t>(i)];
-        handleEvent(event.data.u64, event.events);
-      }
-      if (hasDeadlines()) handleDeadlines(Clock::now());
-    }
-    // The requests have been served, and many replies are there.
-    const ThreadPoolWorkQueues::Batch requests;
-    handleWork();
+    look();
+    takeTurns();
   }
   notifySystemd("STOPPING=1");
   while (!connections_.empty()) {
@@ -133,12 +130,83 @@ void UnixSocketIPCListener::resume() {
     sendClosing(connection->socket(), "the service ends");
     end(*connection);
   }
+  giveUpEstates();
+}
+
+void UnixSocketIPCListener::look() {
+  const bool mayWait = line_.empty() && waker_->beginWait();
+  const int count = ::epoll_wait(epoll_.get(), events_.data(), kMostEvents,
+                                 mayWait ? millisecondsToWait() : 0);
+  waker_->endWait();
+  line_.setTime(static_cast<std::uint64_t>(
+      std::chrono::nanoseconds(Clock::now().time_since_epoch()).count()));
+  for (const auto& [id, user] : users_) {
+    if (user.account->adapt()) waker_->budgetEased();
+  }
+  if (heap_ && count > 0) heap_->noteWork();
+  const ThreadPoolWorkQueues::Batch requests;
+  for (int i = 0; i < count; ++i) {
+    const epoll_event& event = events_[static_cast<std::size_t>(i)];
+    handleEvent(event.data.u64, event.events);
+  }
+  if (firstDeadline_) handleDeadlines(Clock::now());
+}
+
+// Those that are cheap have their requests served together, which wakes the threads of
+// sessions once.
+void UnixSocketIPCListener::takeTurns() {
+  std::optional<Clock::time_point> end;
+  for (;;) {
+    {
+      const ThreadPoolWorkQueues::Batch requests;
+      std::uint64_t work = 0;
+      while (const auto next = line_.take()) {
+        work += takeTurn(*next);
+        if (work >= limits_.turnWork || line_.empty()) break;
+        // Where the estimate is wrong.
+        const Clock::time_point now = Clock::now();
+        if (!end) end = now + limits::kTurnsBetweenLooks;
+        if (now >= *end) break;
+      }
+    }
+    {
+      // The requests have been served, and their replies are there.
+      const ThreadPoolWorkQueues::Batch requests;
+      handleWork();
+    }
+    giveUpEstates();
+    if (line_.empty() || isStopping_) return;
+    const Clock::time_point now = Clock::now();
+    if (!end) end = now + limits::kTurnsBetweenLooks;
+    if (now >= *end) return;
+  }
+}
+
+std::uint64_t UnixSocketIPCListener::takeTurn(std::uint64_t id) {
+  if (id == kSocketEvent) {
+    line_.leave(placeOfSocket_);
+    const std::uint64_t work = acceptSome();
+    line_.use(placeOfSocket_, work);
+    return work;
+  }
+  const auto found = connections_.find(id);
+  if (found == connections_.end()) return 0;
+  line_.leave(found->second.place);
+  const auto connection = found->second.connection;
+  std::uint64_t work = connection->takeTurn(buffer_);
+  if (connection->ending() != PeerConnection::Ending::kNone) {
+    work += kWorkOfEnding +
+            std::min(connection->sessions(), kManySessions) * kWorkOfSessionsEnd;
+  }
+  line_.use(found->second.place, work);
+  settle(*connection);
+  return work;
 }
 
 void UnixSocketIPCListener::handleEvent(std::uint64_t id, std::uint32_t events) {
   switch (id) {
     case kSocketEvent:
-      acceptAll();
+      line_.enter(id, placeOfSocket_);
       return;
     case kWakerEvent:
       waker_->clear();
@@ -151,9 +219,13 @@ void UnixSocketIPCListener::handleEvent(std::uint64_t id, std::uint32_t events) 
   }
   const auto found = connections_.find(id);
   if (found == connections_.end()) return;
+  if ((events & EPOLLOUT) == 0) {
+    line_.enter(id, found->second.place);
+    return;
+  }
   const auto connection = found->second.connection;
-  if ((events & EPOLLOUT) != 0) connection->write(Clock::now());
-  if ((events & ~EPOLLOUT) != 0 && connection->wantsToRead()) connection->read(buffer_);
+  if ((events & ~EPOLLOUT) != 0) line_.enter(id, found->second.place);
+  connection->write(Clock::now());
   settle(*connection);
 }
 
@@ -173,15 +245,15 @@ void UnixSocketIPCListener::handleWork() {
   for (const PeerConnection::ID id : waiting) {
     const auto found = connections_.find(id);
     if (found == connections_.end()) continue;
+    found->second.isListedHeldBack = false;
     const auto connection = found->second.connection;
-    connection->continueReading();
     settle(*connection);
   }
 }
 
 void UnixSocketIPCListener::settle(PeerConnection& connection) {
   // Replies that were read make room again for a client that was merely slow.
-  if (connection.isHeldBack()) connection.continueReading();
+  connection.goOn();
   if (connection.ending() != PeerConnection::Ending::kNone) {
     if (connection.ending() == PeerConnection::Ending::kBrokenRules) {
       cutOff(connection);
@@ -190,13 +262,15 @@ void UnixSocketIPCListener::settle(PeerConnection& connection) {
     }
     return;
   }
-  const auto addOnce = [&](std::vector<PeerConnection::ID>& list) {
-    if (std::find(list.begin(), list.end(), connection.id()) == list.end()) {
-      list.push_back(connection.id());
-    }
-  };
-  if (connection.isHeldBack()) addOnce(heldBack_);
-  if (connection.isImpatient()) addOnce(impatient_);
+  Watched& watched = connections_.at(connection.id());
+  if (connection.isUnfinished()) line_.enter(connection.id(), watched.place);
+  if (connection.isHeldBack() && !std::exchange(watched.isListedHeldBack, true)) {
+    heldBack_.push_back(connection.id());
+  }
+  if (connection.isImpatient() && !std::exchange(watched.isListedImpatient, true)) {
+    impatient_.push_back(connection.id());
+    noteDeadline(connection.patienceEnds());
+  }
   watch(connection);
   countHalfFrame(connection);
 }
@@ -212,10 +286,11 @@ void UnixSocketIPCListener::cutOff(PeerConnection& connection) {
 void UnixSocketIPCListener::countHalfFrame(PeerConnection& connection) {
   const auto watched = connections_.find(connection.id());
   if (watched == connections_.end()) return;
-  User& user = users_[connection.peer().user];
-  user.halfFrameBytes += connection.halfFrameBytes() - watched->second.halfFrameBytes;
-  watched->second.halfFrameBytes = connection.halfFrameBytes();
-  if (user.halfFrameBytes <= limits_.halfFrameBytesOfUser) return;
+  const std::size_t before =
+      std::exchange(watched->second.halfFrameBytes, connection.halfFrameBytes());
+  UserAccount& account = *users_.at(connection.peer().user).account;
+  account.changeHalfFrames(before, connection.halfFrameBytes());
+  if (!account.hasManyHalfFrames()) return;
   std::shared_ptr<PeerConnection> oldest;
   for (const auto& [id, each] : connections_) {
     const PeerConnection& candidate = *each.connection;
@@ -258,14 +333,25 @@ void UnixSocketIPCListener::end(PeerConnection& connection) {
   peers_->peerDisconnected(ended->peer().pid, ended->id());
   const auto user = users_.find(ended->peer().user);
   if (user != users_.end()) {
-    --user->second.connections;
-    user->second.halfFrameBytes -= halfFrameBytes;
+    user->second.account->setConnections(--user->second.connections);
+    user->second.account->changeHalfFrames(halfFrameBytes, /*now=*/0);
   }
-  ended->invalidate();
+  const bool isLarge = disposal_ != nullptr && ended->sessions() > kManySessions;
+  (isLarge ? largeEstates_ : estates_).push_back(ended->invalidate());
 }
 
-void UnixSocketIPCListener::acceptAll() {
-  for (int i = 0; i < kMostAccepted; ++i) {
+// Called when what clients asked for on their way out has been served, so that nobody
+// else holds their sessions any more.
+void UnixSocketIPCListener::giveUpEstates() {
+  estates_.clear();
+  if (largeEstates_.empty()) return;
+  disposal_->asyncAfter(std::chrono::nanoseconds(0),
+                        [estates = std::exchange(largeEstates_, {})] {});
+}
+
+std::uint64_t UnixSocketIPCListener::acceptSome() {
+  std::uint64_t work = 0;
+  for (; work < limits_.turnWork; work += kWorkOfAccepting) {
     FileDescriptor socket(
         ::accept4(socket_.descriptor(), nullptr, nullptr, SOCK_CLOEXEC | SOCK_NONBLOCK));
     if (socket) {
@@ -273,15 +359,17 @@ void UnixSocketIPCListener::acceptAll() {
       continue;
     }
     if (errno == EINTR || errno == ECONNABORTED) continue;
-    if (errno == EAGAIN) return;
+    if (errno == EAGAIN) break;
     // No descriptors or memory: those who wait are accepted later.
     OSTREL_LOG_ERROR(processLogScope, "no connection can be accepted now: error %i",
                      errno);
     ::epoll_ctl(epoll_.get(), EPOLL_CTL_DEL, socket_.descriptor(), nullptr);
     isBackedOff_ = true;
     acceptAgainAt_ = Clock::now() + limits::kAcceptBackOff;
-    return;
+    noteDeadline(acceptAgainAt_);
+    break;
   }
+  return work;
 }
 
 void UnixSocketIPCListener::accept(FileDescriptor socket) {
@@ -296,11 +384,13 @@ void UnixSocketIPCListener::accept(FileDescriptor socket) {
   auto channel = std::make_shared<PeerChannel>(
       id, waker_, user.account,
       PeerChannel::Limits{limits_.queuedBytes, limits_.unreadReplyBytes,
-                          limits_.reservedQueuedBytes});
+                          limits_.reservedQueuedBytes, limits_.mostReservedBytes});
   auto connection = std::make_shared<PeerConnection>(
       id, std::move(socket), peer, std::move(channel), limits_, *misuse_);
-  connections_[id] = {connection};
-  ++user.connections;
+  Watched& watched = connections_[id];
+  watched.connection = connection;
+  line_.introduce(watched.place);
+  user.account->setConnections(++user.connections);
   const bool isAccepted = delegate_ != nullptr &&
                           delegate_->listenerShouldAcceptNewConnection(*this, connection);
   if (!isAccepted || !connection->isResumed()) {
@@ -323,17 +413,24 @@ bool UnixSocketIPCListener::isWithinLimits(const PeerIdentity& peer, int socket)
   return false;
 }
 
+void UnixSocketIPCListener::noteDeadline(Clock::time_point deadline) {
+  if (!firstDeadline_ || deadline < *firstDeadline_) firstDeadline_ = deadline;
+}
+
 void UnixSocketIPCListener::handleDeadlines(Clock::time_point now) {
+  if (now < *firstDeadline_) return;
+  firstDeadline_.reset();
   if (isBackedOff_ && now >= acceptAgainAt_) {
     isBackedOff_ = !watchDescriptor(epoll_.get(), socket_.descriptor(), kSocketEvent);
     acceptAgainAt_ = now + limits::kAcceptBackOff;
   }
-  if (impatient_.empty()) return;
+  if (isBackedOff_) noteDeadline(acceptAgainAt_);
   std::vector<PeerConnection::ID> waiting;
   std::swap(waiting, impatient_);
   for (const PeerConnection::ID id : waiting) {
     const auto found = connections_.find(id);
     if (found == connections_.end()) continue;
+    found->second.isListedImpatient = false;
     const auto connection = found->second.connection;
     connection->checkPatience(now);
     settle(*connection);
@@ -342,16 +439,9 @@ void UnixSocketIPCListener::handleDeadlines(Clock::time_point now) {
 
 // -1, without end, unless somebody's time runs.
 int UnixSocketIPCListener::millisecondsToWait() const {
-  if (!hasDeadlines()) return -1;
-  Clock::time_point first = Clock::time_point::max();
-  if (isBackedOff_) first = acceptAgainAt_;
-  for (const PeerConnection::ID id : impatient_) {
-    const auto found = connections_.find(id);
-    if (found == connections_.end()) continue;
-    first = std::min(first, found->second.connection->patienceEnds());
-  }
-  if (first == Clock::time_point::max()) return -1;
-  const auto left = std::chrono::ceil<std::chrono::milliseconds>(first - Clock::now());
+  if (!firstDeadline_) return -1;
+  const auto left =
+      std::chrono::ceil<std::chrono::milliseconds>(*firstDeadline_ - Clock::now());
   return static_cast<int>(std::max<std::int64_t>(left.count(), 0));
 }
 

@@ -1,14 +1,19 @@
 #pragma once
 
+#include <sys/epoll.h>
+
 #include <cstdint>
 #include <map>
 #include <memory>
+#include <optional>
 #include <string>
 #include <unordered_map>
 #include <vector>
 
 #include "platform/IPCListener.h"
 #include "platform/Outcome.h"
+#include "platform/WorkQueue.h"
+#include "platform/linux/FairLine.h"
 #include "platform/linux/FileDescriptor.h"
 #include "platform/linux/Heap.h"
 #include "platform/linux/LoopWaker.h"
@@ -36,6 +41,10 @@ class UnixSocketIPCListener final : public IPCListener {
       ListenerLimits limits = {}, std::shared_ptr<MisuseLog> misuse = nullptr);
   ~UnixSocketIPCListener() override;
 
+  /// Where the sessions of a client that left many are given up: whoever had 100,000
+  /// must not hold up the others by its end. Before `resume`; without it, where it is.
+  void setDisposal(ConcurrentQueue* queue) { disposal_ = queue; }
+
   /// Who is told of each round of requests; before `resume`.
   void setHeapKeeper(std::shared_ptr<HeapKeeper> heap) { heap_ = std::move(heap); }
 
@@ -53,20 +62,24 @@ class UnixSocketIPCListener final : public IPCListener {
   struct User {
     std::size_t connections = 0;
     std::shared_ptr<UserAccount> account;
-    std::size_t halfFrameBytes = 0;  // Of its connections.
   };
 
   UnixSocketIPCListener(ServiceSocket socket, std::shared_ptr<PeerRegistry> peers,
                         ListenerLimits limits, std::shared_ptr<MisuseLog> misuse);
 
-  void acceptAll();
+  void look();
+  void takeTurns();
+  /// Each returns the work that it took.
+  std::uint64_t takeTurn(PeerConnection::ID id);
+  std::uint64_t acceptSome();
   void accept(FileDescriptor socket);
   bool watchOwnDescriptors();
   bool isWithinLimits(const PeerIdentity& peer, int socket);
   void handleEvent(std::uint64_t id, std::uint32_t events);
   void handleWork();
+  void giveUpEstates();
+  void noteDeadline(Clock::time_point deadline);
   void handleDeadlines(Clock::time_point now);
-  bool hasDeadlines() const { return isBackedOff_ || !impatient_.empty(); }
   int millisecondsToWait() const;
 
   /// Brings the loop in line with what a connection wants now, or ends it.
@@ -90,6 +103,9 @@ class UnixSocketIPCListener final : public IPCListener {
     std::shared_ptr<PeerConnection> connection;
     std::size_t halfFrameBytes = 0;  // As its user's count has it.
     std::uint32_t events = 0;        // As epoll knows them; 0: not in it.
+    bool isListedHeldBack = false;   // In `heldBack_`.
+    bool isListedImpatient = false;  // In `impatient_`.
+    FairLine::Place place;
   };
   std::unordered_map<PeerConnection::ID, Watched> connections_;
   const std::shared_ptr<ServiceAccount> service_;
@@ -97,8 +113,17 @@ class UnixSocketIPCListener final : public IPCListener {
   std::vector<PeerConnection::ID> heldBack_;
   std::vector<PeerConnection::ID> impatient_;
   PeerConnection::ID nextID_;
+  FairLine line_;  // Of connections, and of the socket that accepts them.
+  FairLine::Place placeOfSocket_;
+  ConcurrentQueue* disposal_ = nullptr;
+  // Of clients that have gone, and of those among them that had many sessions.
+  std::vector<std::shared_ptr<void>> estates_;
+  std::vector<std::shared_ptr<void>> largeEstates_;
   LoopWaker::Work work_;
+  std::vector<epoll_event> events_;
   std::vector<std::uint8_t> buffer_;
+  // None, or not after, the first time at which `handleDeadlines` has something to do.
+  std::optional<Clock::time_point> firstDeadline_;
   Clock::time_point acceptAgainAt_{};  // Set while accepting is backed off.
   bool isBackedOff_ = false;
   bool isStopping_ = false;

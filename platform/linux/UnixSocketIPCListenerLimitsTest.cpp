@@ -123,7 +123,7 @@ TEST_F(UnixSocketListener, HoldsBackAClientThatFloodsRequestsWithoutPayload) {
 TEST_F(UnixSocketListener, CutsNobodyOffWhoIsMerelyHeldBack) {
   ListenerLimits limits;
   limits.ofUser.queuedBytes = 64 * 1024;
-  limits.halfFrameBytesOfUser = 64 * 1024;
+  limits.ofUser.halfFrameBytes = 64 * 1024;
   serveHolding(limits);
   constexpr std::size_t kClients = 8;
   constexpr std::size_t kMessages = 300;
@@ -210,7 +210,7 @@ TEST_F(UnixSocketListener, CutsOffAClientThatNeverReadsItsReplies) {
 
 TEST_F(UnixSocketListener, CutsOffWhoIsLongestInAFrameWhereAUserHasTooManyHalves) {
   ListenerLimits limits;
-  limits.halfFrameBytesOfUser = 90 * 1024;
+  limits.ofUser.halfFrameBytes = 90 * 1024;
   serve(limits);
   const std::string half =
       std::string("\x00\x00\x01\x00", 4) + std::string(30 * 1024 - 4, '\x81');
@@ -239,6 +239,7 @@ TEST_F(UnixSocketListener, ServesAClientWithLittleUnderWayHoweverMuchItsUserHas)
   ListenerLimits limits;
   limits.ofUser.queuedBytes = 1024;
   limits.reservedQueuedBytes = 2 * limits::kRequestBytes;
+  limits.ofUser.reservedQueuedBytes = 0;
   serveHolding(limits);
   RawClient greedy(path);
   greedy.send(messageRequest(1, std::string(4096, 'x')));
@@ -258,6 +259,7 @@ TEST_F(UnixSocketListener, LeavesWhatItCannotCarryOutInTheSocket) {
   ListenerLimits limits;
   limits.ofUser.queuedBytes = 1024;
   limits.reservedQueuedBytes = 0;
+  limits.ofUser.reservedQueuedBytes = 0;
   serveHolding(limits);
   RawClient first(path);
   first.send(messageRequest(1, std::string(4096, 'x')));

@@ -24,7 +24,7 @@
 namespace ostrel::testing_support {
 
 /// What the service is asked, in order. Replies at once unless told to hold.
-class RecordingService final : public OstrelReportingServiceProtocol {
+class RecordingService : public OstrelReportingServiceProtocol {
  public:
   void createReportingSession(ReporterID id, BoolReply reply) override {
     record(format("create %lli", id));

@@ -1,11 +1,13 @@
 #pragma once
 
+#include <algorithm>
 #include <atomic>
 #include <cstddef>
 #include <cstdint>
 #include <memory>
 #include <utility>
 
+#include "platform/Value.h"
 #include "platform/linux/Limits.h"
 #include "platform/linux/RequestBudget.h"
 #include "platform/linux/Share.h"
@@ -18,6 +20,33 @@ struct ServiceAccount {
   Share keptBytes;
 };
 
+/// Bears the user infos of sessions, which live as long as these. Any thread.
+class UserInfos final : public PayloadAccount,
+                        public std::enable_shared_from_this<UserInfos> {
+ public:
+  explicit UserInfos(std::size_t mostBytes) : mostBytes_(mostBytes) {}
+
+  void charge(std::size_t bytes) noexcept override { bytes_ += bytes; }
+  void relieve(std::size_t bytes) noexcept override { bytes_ -= bytes; }
+  /// They are no entries of lists.
+  bool keep(std::size_t) noexcept override { return true; }
+  void discard(std::size_t) noexcept override {}
+  /// For the copy that a telemetry session gets.
+  std::shared_ptr<PayloadAccount> accountOfMerged() noexcept override {
+    return shared_from_this();
+  }
+
+  bool hasRoomFor(std::size_t bytes) const noexcept {
+    const std::size_t used = bytes_.load();
+    return bytes <= mostBytes_ && used <= mostBytes_ - bytes;
+  }
+  std::size_t bytes() const { return bytes_.load(); }
+
+ private:
+  const std::size_t mostBytes_;
+  std::atomic<std::size_t> bytes_{0};
+};
+
 /// What one user's clients have under way and keep. Outlives the user's connections
 /// as long as a session's list or a request of theirs is left. Any thread.
 class UserAccount {
@@ -27,13 +56,18 @@ class UserAccount {
     std::size_t sessions;
     std::size_t keptBytes;
     std::size_t unreadBytes = limits::kUnreadReplyBytesOfUser;
+    std::size_t userInfoBytes = limits::kUserInfoBytesOfUser;
+    std::size_t halfFrameBytes = limits::kHalfFrameBytesOfUser;
+    std::size_t memory = limits::kMemoryOfUser;
+    std::size_t reservedQueuedBytes = limits::kReservedQueuedBytesOfUser;
   };
 
   UserAccount(std::uint32_t user, const Limits& limits,
               std::shared_ptr<ServiceAccount> service)
       : user_(user),
+        limits_(limits),
         queued_(limits.queuedBytes),
-        mostUnreadBytes_(limits.unreadBytes),
+        userInfos_(std::make_shared<UserInfos>(limits.userInfoBytes)),
         service_(std::move(service)),
         sessions_(limits.sessions),
         keptBytes_(limits.keptBytes) {}
@@ -42,6 +76,15 @@ class UserAccount {
 
   /// Bytes of requests that are accepted and not yet carried out.
   RequestBudget& queued() { return queued_; }
+
+  /// How many connections the user has, and what of that each of them may have when the
+  /// others have it all.
+  void setConnections(std::size_t count) noexcept { connections_ = count; }
+  std::size_t reservedQueuedBytes(std::size_t least, std::size_t most) const {
+    return std::clamp(
+        limits_.reservedQueuedBytes / std::max<std::size_t>(connections_, 1), least,
+        most);
+  }
 
   /// One more session. False: there are as many as the user or the service may have.
   bool takeSession() noexcept { return takeBoth(sessions_, service_->sessions, 1); }
@@ -61,13 +104,56 @@ class UserAccount {
   void changeUnread(std::size_t before, std::size_t now) noexcept {
     unreadBytes_ += now - before;
   }
-  bool hasManyUnread() const { return unreadBytes_ > mostUnreadBytes_; }
+  bool hasManyUnread() const {
+    return unreadBytes_ > limits_.unreadBytes ||
+           (isCrowded() && unreadBytes_ > limits_.unreadBytes / kPartWhenCrowded);
+  }
+
+  /// Bytes of frames that are not whole, likewise.
+  void changeHalfFrames(std::size_t before, std::size_t now) noexcept {
+    halfFrameBytes_ += now - before;
+  }
+  bool hasManyHalfFrames() const {
+    return halfFrameBytes_ > limits_.halfFrameBytes ||
+           (isCrowded() &&
+            halfFrameBytes_ > limits_.halfFrameBytes / kPartOfFramesWhenCrowded);
+  }
+
+  /// Whether a user info may grow by so much.
+  bool hasRoomForInfo(std::size_t bytes) const {
+    return userInfos_->hasRoomFor(bytes) &&
+           !(isCrowded() &&
+             userInfos_->bytes() + bytes > limits_.userInfoBytes / kPartWhenCrowded);
+  }
+
+  /// What all that takes in memory, roughly, and whether that is too much: then each
+  /// kind has only a part of its share until it is not.
+  std::size_t memory() const {
+    return queued_.used() + unreadBytes_ + halfFrameBytes_ + userInfos_->bytes() +
+           sessions_.used() * limits::kSessionBytes;
+  }
+  bool isCrowded() const { return memory() > limits_.memory; }
+
+  /// Brings the share of what is queued in line with that. True: somebody who waits for
+  /// it is to be told.
+  bool adapt() noexcept {
+    return queued_.limitTo(isCrowded() ? limits_.queuedBytes / kPartOfQueuedWhenCrowded
+                                       : limits_.queuedBytes);
+  }
+
+  /// Who bears the user infos of sessions.
+  std::shared_ptr<PayloadAccount> accountOfInfos() const { return userInfos_; }
 
   std::size_t sessions() const { return sessions_.used(); }
   std::size_t sessionsOfAll() const { return service_->sessions.used(); }
   std::size_t keptBytes() const { return keptBytes_.used(); }
 
  private:
+  static constexpr std::size_t kPartWhenCrowded = 8;
+  static constexpr std::size_t kPartOfQueuedWhenCrowded = 4;
+  // Whoever sends a large frame slowly is not to be taken for one who hoards them.
+  static constexpr std::size_t kPartOfFramesWhenCrowded = 2;
+
   static bool takeBoth(Share& own, Share& all, std::size_t amount) noexcept {
     if (!own.take(amount)) return false;
     if (all.take(amount)) return true;
@@ -80,9 +166,12 @@ class UserAccount {
   }
 
   const std::uint32_t user_;
+  const Limits limits_;
   RequestBudget queued_;
-  const std::size_t mostUnreadBytes_;
+  std::atomic<std::size_t> connections_{0};
   std::atomic<std::size_t> unreadBytes_{0};
+  std::atomic<std::size_t> halfFrameBytes_{0};
+  const std::shared_ptr<UserInfos> userInfos_;
   const std::shared_ptr<ServiceAccount> service_;
   // On a line of the cache of their own: sessions' threads write them, and the thread
   // that reads looks at the others with each message.

@@ -108,5 +108,57 @@ TEST(UserAccount, KeepsBytesUpToTheUsersShareAndTheServices) {
   EXPECT_TRUE(two.keep(500));
 }
 
+class CrowdedUser : public testing::Test {
+ protected:
+  static UserAccount::Limits limits() {
+    UserAccount::Limits limits{/*queuedBytes=*/800, /*sessions=*/10, /*keptBytes=*/0};
+    limits.unreadBytes = 800;
+    limits.userInfoBytes = 800;
+    limits.halfFrameBytes = 800;
+    limits.memory = 5 * limits::kSessionBytes;
+    return limits;
+  }
+  UserAccount user{1000, limits(), serviceWith(/*sessions=*/10, /*keptBytes=*/0)};
+};
+
+TEST_F(CrowdedUser, HasMoreThanItsMemory) {
+  for (int i = 0; i < 4; ++i) EXPECT_TRUE(user.takeSession());
+  user.changeUnread(0, limits::kSessionBytes - 1);
+  EXPECT_FALSE(user.isCrowded());
+  user.queued().take(1);
+  EXPECT_FALSE(user.isCrowded());
+  user.changeHalfFrames(0, 1);
+  EXPECT_TRUE(user.isCrowded());
+}
+
+TEST_F(CrowdedUser, HasPartOfEachShare) {
+  user.queued().take(201);
+  user.changeUnread(0, 101);
+  user.changeHalfFrames(0, 401);
+  user.adapt();
+  EXPECT_FALSE(user.queued().isExceeded());
+  EXPECT_FALSE(user.hasManyUnread());
+  EXPECT_FALSE(user.hasManyHalfFrames());
+  EXPECT_TRUE(user.hasRoomForInfo(101));
+
+  for (int i = 0; i < 5; ++i) EXPECT_TRUE(user.takeSession());
+  user.adapt();
+  EXPECT_TRUE(user.queued().isExceeded());
+  EXPECT_TRUE(user.hasManyUnread());
+  EXPECT_TRUE(user.hasManyHalfFrames());
+  EXPECT_FALSE(user.hasRoomForInfo(101));
+  EXPECT_TRUE(user.hasRoomForInfo(100));
+}
+
+TEST_F(CrowdedUser, TellsWhoWaitsWhenItIsNotAnyMore) {
+  for (int i = 0; i < 6; ++i) EXPECT_TRUE(user.takeSession());
+  user.queued().take(201);
+  user.adapt();
+  EXPECT_TRUE(user.queued().await());
+  user.giveSessions(6);
+  EXPECT_TRUE(user.adapt());
+  EXPECT_FALSE(user.adapt());
+}
+
 }  // namespace
 }  // namespace ostrel

@@ -1,6 +1,7 @@
 #include "platform/linux/store/Store.h"
 
 #include <algorithm>
+#include <utility>
 
 #include "platform/Logging.h"
 #include "platform/linux/Limits.h"
@@ -16,6 +17,10 @@ constexpr std::size_t kWriteAhead = 512;
 // one connection's (`limits::kQueuedBytes`) makes it worth committing early, so that
 // the other half is filled meanwhile.
 constexpr std::size_t kCommitBytes = limits::kQueuedBytes / 2;
+
+// While there are fewer operations they are a burden to nobody: a client need not wait
+// for the commit, only for one that is late.
+constexpr std::size_t kUnburdened = 4096;
 
 // Codes of errors that are not SQLite's, which are positive.
 constexpr int kQueueIsFull = -1;
@@ -165,6 +170,7 @@ bool Store::push(StoreOperation operation) {
                          std::holds_alternative<SessionEnd>(operation.what) ||
                          std::holds_alternative<StatusChange>(operation.what);
   const bool isEvent = std::holds_alternative<AnalyticsEvent>(operation.what);
+  BurdenShare burden = std::exchange(operation.burden, BurdenShare());
   bool mustWake;
   {
     const std::lock_guard lock(mutex_);
@@ -177,6 +183,7 @@ bool Store::push(StoreOperation operation) {
     mustWake = writerIsIdle_ || queue_.size() == kWriteAhead - 1;
     if (isEvent) ++queuedEvents_;
     if (!isOwnStep) counters_.accepted.fetch_add(1, std::memory_order_relaxed);
+    if (queue_.size() >= kUnburdened) operation.burden = std::move(burden);
     queue_.push(std::move(operation));
   }
   if (mustWake) wakeWriter();

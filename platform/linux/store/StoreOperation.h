@@ -13,6 +13,7 @@
 #include "platform/AnalyticsSink.h"
 #include "platform/TelemetryBackend.h"
 #include "platform/Value.h"
+#include "platform/linux/Burden.h"
 
 namespace ostrel {
 
@@ -79,6 +80,7 @@ struct StoreOperation {
   std::variant<SessionBegin, SessionMessage, SessionFlush, SessionEnd, LoneMessage,
                AnalyticsEvent, PowerEvent, StatusChange>
       what;
+  BurdenShare burden = BurdenShare::current();
 
   /// The memory of the payloads that it keeps; those of their clients bear it.
   std::size_t payloadBytes() const;

@@ -1,0 +1,118 @@
+#pragma once
+
+#include <algorithm>
+#include <cstdint>
+#include <functional>
+#include <optional>
+#include <queue>
+#include <vector>
+
+namespace ostrel {
+
+/// Who waits for a turn. Whoever asks for little goes before all that ask for much; of
+/// these, who has had least goes first, so that one that asks for very much waits until
+/// the others in line have had as much. (Start-time fair queueing.)
+///
+/// Work and time are in nanoseconds. An allowance of 5 % of the time, saved up to a
+/// millisecond, is little.
+class FairLine {
+ public:
+  using ID = std::uint64_t;
+
+  static constexpr std::uint64_t kTimeForWork = 20;  // Of which one part is little.
+  static constexpr std::uint64_t kSavedWork =
+      1'000'000;  // That may be asked for at once.
+  /// Of one that is new: a tenth of a second.
+  static constexpr std::uint64_t kDebtOfNew = 5'000'000;
+  /// So many that ask for little may go before one that does not.
+  static constexpr int kLightInARow = 16;
+
+  /// What the line knows of one that comes again and again. Its owner keeps it.
+  class Place {
+   public:
+    bool isInLine() const { return isInLine_; }
+
+   private:
+    friend class FairLine;
+    std::uint64_t next_ = 0;
+    std::uint64_t debt_ = 0;  // At `asOf_`.
+    std::uint64_t asOf_ = 0;
+    bool isInLine_ = false;
+  };
+
+  bool empty() const { return light_.empty() && others_.empty(); }
+
+  /// Time goes on.
+  void setTime(std::uint64_t now) { time_ = now; }
+
+  /// One that is new asks for much until it has been there for a while: those that are
+  /// there and ask for little go before any number of those.
+  void introduce(Place& place) {
+    place.next_ = now_;
+    place.debt_ = kSavedWork + kDebtOfNew;
+    place.asOf_ = time_;
+  }
+
+  /// Nothing when it stands in line already.
+  void enter(ID id, Place& place) {
+    if (place.isInLine_) return;
+    place.isInLine_ = true;
+    payOff(place);
+    if (place.debt_ <= kSavedWork) {
+      light_.push(id);
+    } else {
+      others_.push({std::max(place.next_, now_), entered_++, id});
+    }
+  }
+
+  /// The next, which is out of line then: `leave` says so to its place.
+  std::optional<ID> take() {
+    if (empty()) return std::nullopt;
+    if (!light_.empty() && (others_.empty() || lightInARow_ < kLightInARow)) {
+      ++lightInARow_;
+      const ID first = light_.front();
+      light_.pop();
+      return first;
+    }
+    lightInARow_ = 0;
+    const Waiting first = others_.top();
+    others_.pop();
+    now_ = first.start;
+    return first.id;
+  }
+
+  /// Of whom `take` gave. Those that have gone meanwhile need not say anything.
+  void leave(Place& place) { place.isInLine_ = false; }
+
+  /// So much was done for one that is not in line.
+  void use(Place& place, std::uint64_t work) {
+    payOff(place);
+    place.debt_ += work;
+    place.next_ = std::max(place.next_, now_) + work;
+  }
+
+ private:
+  struct Waiting {
+    std::uint64_t start;
+    std::uint64_t order;  // Of those with one start, who came first.
+    ID id;
+    friend bool operator>(const Waiting& a, const Waiting& b) {
+      return a.start != b.start ? a.start > b.start : a.order > b.order;
+    }
+  };
+
+  void payOff(Place& place) const {
+    const std::uint64_t paid = (time_ - place.asOf_) / kTimeForWork;
+    place.debt_ -= std::min(place.debt_, paid);
+    place.asOf_ = time_;
+  }
+
+  std::queue<ID> light_;
+  std::priority_queue<Waiting, std::vector<Waiting>, std::greater<>> others_;
+  int lightInARow_ = 0;
+  std::uint64_t time_ = 0;
+  std::uint64_t now_ = 0;  // In work: the place of who was taken last.
+  std::uint64_t entered_ = 0;
+};
+
+}  // namespace ostrel

@@ -1,0 +1,313 @@
+// How the listener shares itself and its memory out among clients.
+#include <gtest/gtest.h>
+#include <sys/socket.h>
+
+#include <array>
+
+#include "platform/linux/FairLine.h"
+#include "platform/linux/QueuedSteps.h"
+#include "platform/linux/RequestDispatch.h"
+#include "platform/linux/UnixSocketIPCListenerTestSupport.h"
+
+namespace ostrel {
+namespace {
+
+using testing_support::RecordingService;
+
+class FairLineTest : public testing::Test {
+ protected:
+  static constexpr std::size_t kClients = 40;
+
+  void enter(std::size_t client) { line.enter(client, places[client]); }
+  std::optional<std::size_t> serveNext(std::uint64_t work) {
+    const auto next = line.take();
+    if (!next) return std::nullopt;
+    line.leave(places[*next]);
+    line.use(places[*next], work);
+    return next;
+  }
+  void makeBusy(std::size_t client) { line.introduce(places[client]); }
+
+  FairLine line;
+  std::array<FairLine::Place, kClients> places;
+};
+
+using FairLineOrder = FairLineTest;
+
+TEST_F(FairLineOrder, LetsWhoAsksForLittleGoFirst) {
+  makeBusy(1);
+  makeBusy(2);
+  enter(1);
+  enter(2);
+  enter(3);
+  EXPECT_EQ(serveNext(1000), 3u);
+  EXPECT_EQ(serveNext(1000), 1u);
+}
+
+TEST_F(FairLineOrder, TellsLittleFromMuchByWhatWasSaved) {
+  for (const std::uint64_t work :
+       {FairLine::kSavedWork - 1, FairLine::kSavedWork, FairLine::kSavedWork + 1}) {
+    FairLine fresh;
+    FairLine::Place asking;
+    FairLine::Place busy;
+    fresh.use(asking, work);
+    fresh.introduce(busy);
+    fresh.enter(1, busy);
+    fresh.enter(2, asking);
+    EXPECT_EQ(fresh.take(), work <= FairLine::kSavedWork ? 2u : 1u) << work;
+  }
+}
+
+TEST_F(FairLineOrder, ForgetsWhatWasAskedForInTime) {
+  line.use(places[1], FairLine::kSavedWork + 100);
+  makeBusy(2);
+  line.setTime(100 * FairLine::kTimeForWork);
+  enter(2);
+  enter(1);
+  EXPECT_EQ(serveNext(0), 1u);
+}
+
+TEST_F(FairLineOrder, LetsWhoHadLeastGoFirstOfThoseThatAskForMuch) {
+  makeBusy(1);
+  makeBusy(2);
+  enter(1);
+  enter(2);
+  EXPECT_EQ(serveNext(1000), 1u);
+  EXPECT_EQ(serveNext(300), 2u);
+  std::string order;
+  for (int i = 0; i < 5; ++i) {
+    enter(1);
+    enter(2);
+    order += std::to_string(*serveNext(300));
+  }
+  EXPECT_EQ(order, "22212") << "until both had as much";
+}
+
+TEST_F(FairLineOrder, LeavesNobodyWithoutATurn) {
+  makeBusy(0);
+  enter(0);
+  std::size_t turns = 0;
+  do {
+    ++turns;
+    ASSERT_LE(turns, kClients);
+    enter(turns);
+  } while (serveNext(0) != 0u);
+  EXPECT_EQ(turns, static_cast<std::size_t>(FairLine::kLightInARow) + 1);
+}
+
+TEST_F(FairLineOrder, HasEachInItOnce) {
+  enter(1);
+  enter(1);
+  EXPECT_EQ(serveNext(0), 1u);
+  EXPECT_TRUE(line.empty());
+}
+
+/// A client's connection without a loop.
+class PeerConnectionTurn : public testing::Test {
+ protected:
+  PeerConnectionTurn() {
+    int sockets[2];
+    EXPECT_EQ(::socketpair(AF_UNIX, SOCK_STREAM, 0, sockets), 0);
+    client = FileDescriptor(sockets[0]);
+    ours = FileDescriptor(sockets[1]);
+  }
+
+  std::unique_ptr<PeerConnection> connect(const ListenerLimits& limits) {
+    auto connection = std::make_unique<PeerConnection>(1, std::move(ours), PeerIdentity(),
+                                                       channel, limits, misuse);
+    connection->setExportedObject(service);
+    return connection;
+  }
+  void send(std::size_t creations) const {
+    std::string bytes;
+    wire::Request request;
+    request.operation = wire::Operation::kCreateReportingSession;
+    for (std::size_t i = 0; i < creations; ++i) {
+      request.reporterID = ReporterID{static_cast<std::int64_t>(i % 20 + 1)};
+      wire::appendRequest(bytes, request);
+    }
+    ASSERT_EQ(::send(client.get(), bytes.data(), bytes.size(), 0),
+              static_cast<ssize_t>(bytes.size()));
+  }
+
+  FileDescriptor client;
+  FileDescriptor ours;
+  const std::shared_ptr<UserAccount> user = std::make_shared<UserAccount>(
+      1000, ListenerLimits().ofUser,
+      std::shared_ptr<ServiceAccount>(new ServiceAccount{Share(1000), Share(1000)}));
+  const std::shared_ptr<PeerChannel> channel = std::make_shared<PeerChannel>(
+      1, std::make_shared<LoopWaker>(), user,
+      PeerChannel::Limits{limits::kQueuedBytes, limits::kUnreadReplyBytes});
+  MisuseLog misuse;
+  const std::shared_ptr<RecordingService> service = std::make_shared<RecordingService>();
+  std::vector<std::uint8_t> buffer = std::vector<std::uint8_t>(64 * 1024);
+};
+
+TEST_F(PeerConnectionTurn, EndsWhenItsWorkIsDone) {
+  ListenerLimits limits;
+  limits.turnWork = 20'000;  // Of requests that take two to three thousand each.
+  const auto connection = connect(limits);
+  send(/*creations=*/50);
+  std::size_t turns = 0;
+  std::size_t before = 0;
+  do {
+    const std::uint64_t work = connection->takeTurn(buffer);
+    EXPECT_LT(work, limits.turnWork + 5'000);
+    const std::size_t calls = service->calls().size();
+    EXPECT_GT(calls, before);
+    EXPECT_LE(calls, before + 10);
+    before = calls;
+    ++turns;
+  } while (connection->isUnfinished());
+  EXPECT_EQ(before, 50u);
+  EXPECT_GT(turns, 4u);
+}
+
+TEST_F(PeerConnectionTurn, EndsJustAtTheWorkOfItsLimit) {
+  // What so many requests take.
+  ListenerLimits limits;
+  const auto connection = connect(limits);
+  send(/*creations=*/10);
+  const std::uint64_t work = connection->takeTurn(buffer);
+  for (const std::uint64_t most : {work - 1, work, work + 1}) {
+    int sockets[2];
+    ASSERT_EQ(::socketpair(AF_UNIX, SOCK_STREAM, 0, sockets), 0);
+    client = FileDescriptor(sockets[0]);
+    ours = FileDescriptor(sockets[1]);
+    ListenerLimits same;
+    same.turnWork = most;
+    const auto again = connect(same);
+    send(/*creations=*/11);
+    again->takeTurn(buffer);
+    EXPECT_EQ(again->isUnfinished(), most <= work) << most;
+  }
+}
+
+TEST_F(PeerConnectionTurn, TellsOfAConfigurationThatWasCut) {
+  ListenerLimits limits;
+  const auto connection = connect(limits);
+  EXPECT_FALSE(channel->mayMerge({limits::kUserInfoEntries + 1, 1, 1}));
+  connection->takeTurn(buffer);
+  connection->takeTurn(buffer);
+  EXPECT_EQ(misuse.counts()[static_cast<std::size_t>(MisuseLog::Kind::kUserInfoRefused)],
+            1u);
+}
+
+/// What configurations of one client make of a session's user info.
+class UserInfo : public PeerConnectionTurn {
+ protected:
+  Dictionary configuration(std::string_view key, const Value& value) const {
+    return DictionaryBuilder(channel).set(key, value).build();
+  }
+  static Dictionary merged(const Dictionary& info, const Dictionary& configuration) {
+    return DictionaryBuilder(info).merge(configuration).build();
+  }
+};
+
+TEST_F(UserInfo, TakesEntriesUpToTheLimit) {
+  Dictionary info;
+  for (std::size_t i = 0; i < limits::kUserInfoEntries; ++i) {
+    info = merged(info, configuration("k" + std::to_string(i), 1));
+    EXPECT_EQ(info.size(), i + 1);
+  }
+  EXPECT_FALSE(channel->takeRefusedMerge());
+  info = merged(info, configuration("more", 1));
+  EXPECT_EQ(info.size(), limits::kUserInfoEntries);
+  EXPECT_TRUE(channel->takeRefusedMerge());
+  info = merged(info, configuration("k7", 2));
+  EXPECT_EQ(info.find("k7")->signedInteger(), 2) << "what is there may change";
+}
+
+TEST_F(UserInfo, TakesBytesUpToTheLimit) {
+  constexpr std::size_t kKeyAndHead = 5;
+  for (const std::size_t bytes :
+       {limits::kUserInfoBytes - 1, limits::kUserInfoBytes, limits::kUserInfoBytes + 1}) {
+    const std::string text(bytes - kKeyAndHead, 'x');
+    const Dictionary info = merged(Dictionary(), configuration("k", text));
+    EXPECT_EQ(info.size(), bytes <= limits::kUserInfoBytes ? 1u : 0u) << bytes;
+  }
+}
+
+TEST_F(UserInfo, OfAllSessionsOfAUserTakesBytesUpToTheLimit) {
+  UserInfos infos(/*mostBytes=*/1000);
+  infos.charge(900);
+  EXPECT_TRUE(infos.hasRoomFor(99));
+  EXPECT_TRUE(infos.hasRoomFor(100));
+  EXPECT_FALSE(infos.hasRoomFor(101));
+}
+
+TEST_F(UserInfo, IsChargedToItsUserUntilItEnds) {
+  const std::size_t before = user->memory();
+  {
+    const Dictionary info =
+        merged(Dictionary(), configuration("k", std::string(1000, 'x')));
+    EXPECT_GE(user->memory(), before + 1000);
+    EXPECT_EQ(user->queued().used(), 0u) << "a client need not wait for its end";
+    // A telemetry session's copy.
+    const Dictionary copy = DictionaryBuilder().set("a", 1).merge(info).build();
+    EXPECT_GE(user->memory(), before + 2000);
+  }
+  EXPECT_EQ(user->memory(), before);
+}
+
+/// A service whose sessions have a queue.
+class QueueingService final : public RecordingService {
+ public:
+  void startReportingSessionForID(ReporterID id, BoolReply reply) override {
+    RecordingService::startReportingSessionForID(id, std::move(reply));
+    queue();
+  }
+  void stopReportingSessionForID(ReporterID id, BoolReply reply) override {
+    RecordingService::stopReportingSessionForID(id, std::move(reply));
+    queue();
+  }
+
+  // A step that queues another.
+  StepList steps;
+
+ private:
+  void queue() {
+    steps.append(QueuedStep::make([this] { steps.append(QueuedStep::make([] {})); }));
+  }
+};
+
+class RequestBurden : public PeerConnectionTurn {
+ protected:
+  void dispatch(wire::Operation operation) {
+    wire::Request request;
+    request.operation = operation;
+    request.reporterID = ReporterID{7};
+    dispatchRequest(queueing, channel, request);
+  }
+  void expectBurden(wire::Operation operation, std::size_t bytes) {
+    dispatch(operation);
+    // The request itself is charged until its callback goes, or a later one is called.
+    const std::size_t before = user->queued().used();
+    EXPECT_GE(before, bytes);
+    queueing.steps.runFirst();
+    EXPECT_EQ(user->queued().used(), before) << "a step that came of it waits";
+    queueing.steps.runFirst();
+    EXPECT_EQ(user->queued().used(), before - bytes);
+    EXPECT_EQ(Burden::current(), nullptr);
+  }
+
+  QueueingService queueing;
+};
+
+TEST_F(RequestBurden, OfAStartLastsUntilItsLastStepHasRun) {
+  expectBurden(wire::Operation::kStartReportingSessionForID, limits::kStartBytes);
+}
+
+TEST_F(RequestBurden, OfAStopLastsUntilItsLastStepHasRun) {
+  expectBurden(wire::Operation::kStopReportingSessionForID, limits::kSessionStepBytes);
+}
+
+TEST_F(RequestBurden, EndsWithStepsThatAreDropped) {
+  dispatch(wire::Operation::kStartReportingSessionForID);
+  const std::size_t before = user->queued().used();
+  queueing.steps.dropFirst();
+  EXPECT_EQ(user->queued().used(), before - limits::kStartBytes);
+}
+
+}  // namespace
+}  // namespace ostrel
