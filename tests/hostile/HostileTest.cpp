@@ -30,9 +30,12 @@ constexpr bool kMemoryIsBounded = false;
 #else
 constexpr bool kMemoryIsBounded = true;
 #endif
-// The aim is 96 MiB. On a machine that is busy with other work too, where the service's
-// threads of low priority lag behind, up to 111 were seen.
-constexpr std::size_t kMostResidentKiB = 128 * 1024;
+constexpr std::size_t kMostResidentKiB = 96 * 1024;
+// With all at once, and with sessions that start as fast as a client can make them. That
+// it is 96 MiB here too is the aim. On a machine that is busy with other work too, where
+// the service's threads of low priority lag behind, up to 111 were seen.
+constexpr std::size_t kMostResidentOfBusyMachineKiB = 128 * 1024;
+constexpr std::string_view kMakesStarts = "leaves-while-starting";
 
 // Those of the pools are made when they are first needed and stay.
 #ifdef OSTREL_THREAD_SANITIZED
@@ -267,6 +270,11 @@ class HostileBehaviour : public testing::TestWithParam<hostile::Behaviour> {
     service_->forgetPeak();
   }
 
+  void TearDown() override {
+    // What it left behind is not the next one's.
+    if (GetParam().name == kMakesStarts) service_ = std::make_unique<AttackedService>();
+  }
+
   static inline std::unique_ptr<AttackedService> service_;
 };
 
@@ -284,7 +292,9 @@ TEST_P(HostileBehaviour, AloneHarmsNobody) {
   std::cout << result << "; peak of resident memory "
             << service_->usage().peakResidentKiB / 1024 << " MiB\n";
   if (kMemoryIsBounded) {
-    EXPECT_LT(service_->usage().peakResidentKiB, kMostResidentKiB);
+    EXPECT_LT(service_->usage().peakResidentKiB, GetParam().name == kMakesStarts
+                                                     ? kMostResidentOfBusyMachineKiB
+                                                     : kMostResidentKiB);
   }
 }
 
@@ -319,7 +329,7 @@ TEST(HostileBehaviours, AllAtOnceHarmNobody) {
   EXPECT_LT(result.quantile(1), std::chrono::milliseconds(kLongestReply).count());
   service.expectItIsAsItWas();
   if (kMemoryIsBounded) {
-    EXPECT_LT(service.usage().peakResidentKiB, kMostResidentKiB);
+    EXPECT_LT(service.usage().peakResidentKiB, kMostResidentOfBusyMachineKiB);
   }
   service.expectAnHonestLog();
   EXPECT_EQ(service.terminate(), 0);
