@@ -6,18 +6,20 @@
 namespace ostrel {
 namespace {
 
-std::string_view sentenceOf(MisuseLog::Kind kind) {
-  switch (kind) {
-    case MisuseLog::Kind::kCutOff:
-      return "is cut off";
-    case MisuseLog::Kind::kConnectionRefused:
-      return "is not let in";
-    case MisuseLog::Kind::kSessionRefused:
-      return "gets no session";
-    case MisuseLog::Kind::kUserInfoRefused:
-      return "has no room for entries of a configuration";
-  }
-  return "";
+struct Wording {
+  std::string_view key;  // Of the service's status.
+  std::string_view sentence;
+};
+
+constexpr std::array<Wording, MisuseLog::kKinds> kWordings{{
+    {"clients_cut_off", "is cut off"},
+    {"connections_refused", "is not let in"},
+    {"sessions_refused", "gets no session"},
+    {"configurations_cut", "has no room for entries of a configuration"},
+}};
+
+const Wording& wordingOf(MisuseLog::Kind kind) {
+  return kWordings[static_cast<std::size_t>(kind)];
 }
 
 }  // namespace
@@ -34,7 +36,7 @@ void MisuseLog::note(std::uint32_t user, Kind kind, std::string_view reason,
   }
   if (mayLog) {
     OSTREL_LOG_ERROR(processLogScope, "a client of user %u %@: %@", user,
-                     sentenceOf(kind), reason);
+                     wordingOf(kind).sentence, reason);
   }
   if (counted_) counted_();
 }
@@ -44,18 +46,6 @@ MisuseLog::Counts MisuseLog::counts() const {
   return counts_;
 }
 
-std::string_view MisuseLog::keyOf(Kind kind) {
-  switch (kind) {
-    case Kind::kCutOff:
-      return "clients_cut_off";
-    case Kind::kConnectionRefused:
-      return "connections_refused";
-    case Kind::kSessionRefused:
-      return "sessions_refused";
-    case Kind::kUserInfoRefused:
-      return "configurations_cut";
-  }
-  return "";
-}
+std::string_view MisuseLog::keyOf(Kind kind) { return wordingOf(kind).key; }
 
 }  // namespace ostrel
