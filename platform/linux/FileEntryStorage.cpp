@@ -19,6 +19,7 @@
 #include "platform/KeptBytes.h"
 #include "platform/Logging.h"
 #include "platform/linux/Limits.h"
+#include "platform/linux/Share.h"
 
 namespace ostrel {
 namespace {
@@ -39,21 +40,12 @@ using Bytes = StoredEntries::Bytes;
 struct FileEntryStorage::State {
   State(std::string directory, const Limits& given, const SpillCalls& calls)
       : limits(given),
-        bytesOfLists(given.bytesInMemory - given.bytesOfFile),
+        memory(given.bytesInMemory - given.bytesOfFile),
         file(std::move(directory), given.pauseOfFile, given.bytesOfFile, calls) {}
 
-  bool takeMemory(std::size_t bytes) {
-    std::size_t used = bytesInMemory.load(std::memory_order_relaxed);
-    do {
-      if (bytes > bytesOfLists || used > bytesOfLists - bytes) return false;
-    } while (!bytesInMemory.compare_exchange_weak(used, used + bytes));
-    return true;
-  }
-
   const Limits limits;
-  const std::size_t bytesOfLists;
+  Share memory;  // Of the lists.
   SpillFile file;
-  std::atomic<std::size_t> bytesInMemory{0};
   std::atomic<std::uint64_t> refused{0};
 };
 
@@ -64,7 +56,7 @@ class FileEntryStorage::Memory {
       : state_(std::move(state)), size_(size), bytes_(new std::uint8_t[size]) {}
   Memory(const Memory&) = delete;
   Memory& operator=(const Memory&) = delete;
-  ~Memory() { state_->bytesInMemory -= size_; }
+  ~Memory() { state_->memory.give(size_); }
 
   std::size_t size() const { return size_; }
   std::uint8_t* data() { return bytes_.get(); }
@@ -238,8 +230,8 @@ class FileEntryStorage::Entries final : public StoredEntries {
   bool takeChunk(std::size_t size) {
     const bool isFirst = chunks_.empty() && size <= kFirstChunk;
     if (isFirst) {
-      state_->bytesInMemory += size;
-    } else if (!state_->takeMemory(size)) {
+      state_->memory.takeAnyway(size);
+    } else if (!state_->memory.take(size)) {
       return false;
     }
     chunks_.push_back({std::make_shared<Memory>(state_, size)});
@@ -330,7 +322,7 @@ std::unique_ptr<StoredEntries> FileEntryStorage::makeEntries(ReporterID session)
 std::uint64_t FileEntryStorage::refusedEntries() const { return state_->refused; }
 
 std::size_t FileEntryStorage::bytesInMemory() const {
-  return state_->bytesInMemory + state_->file.bytesInMemory();
+  return state_->memory.used() + state_->file.bytesInMemory();
 }
 
 bool FileEntryStorage::hasFile() const { return state_->file.isOpen(); }

@@ -68,6 +68,11 @@ inline constexpr std::size_t kReservedQueuedBytesOfUser =
     kConnectionsOfUser * kReservedQueuedBytes;
 inline constexpr std::size_t kMostReservedBytes = 64 * 1024;
 
+/// Bytes of frames that are not whole yet, of all connections of one user: some 25 of
+/// the largest. Beyond it the connection that is in one longest is cut off.
+/// [UnixSocketListener.CutsOffWhoIsLongestInAFrameWhereAUserHasTooManyHalves]
+inline constexpr std::size_t kHalfFrameBytesOfUser = 8 * 1024 * 1024;
+
 /// Sessions in all, and of one user. Room for the 16,384 that are promised and for
 /// load tests of 100,000 by one user; an idle session costs some 500 bytes.
 /// [UserAccount.TakesSessionsUpToTheUsersShareAndTheServices,
@@ -85,7 +90,7 @@ inline constexpr std::size_t kSessionBytes = 512;
 /// service stays within 96 MiB though the shares are more together.
 /// [CrowdedUser.HasMoreThanItsMemory,
 /// CrowdedUser.HasPartOfEachShare]
-inline constexpr std::size_t kMemoryOfUser = 20 * 1024 * 1024;
+inline constexpr std::size_t kMemoryBytesOfUser = 20 * 1024 * 1024;
 
 /// Bytes of the entries that sessions keep for their summaries, in all, and of the
 /// messages of one user's clients. Room for a session of a million messages with its
@@ -161,7 +166,7 @@ inline constexpr std::size_t kUnreadReplyBytes = 1024 * 1024;
 /// [UnixSocketListener.SendsALargeReplyToAClientThatReadsSlowly]
 inline constexpr std::size_t kUnreadReplyBytesToPause = kUnreadReplyBytes / 4;
 
-/// The same of all connections of one user: enough for the largest reply on some of
+/// What all connections of one user have unread: enough for the largest reply on some of
 /// them. Beyond it each may have `kUnreadReplyBytesInNeed`, so that many connections
 /// do not make many times the memory.
 /// [UnreadReplies.OfOthersLeaveAClientItsRoomUpToTheLimitOfTheirUser]
@@ -171,12 +176,8 @@ inline constexpr std::size_t kUnreadReplyBytesOfUser = 8 * 1024 * 1024;
 /// [UnreadReplies.BeyondItAreFewForEachClient]
 inline constexpr std::size_t kUnreadReplyBytesInNeed = 16 * 1024;
 
-/// Bytes of frames that are not whole yet, of all connections of one user: some 25 of
-/// the largest. Beyond it the connection that is in one longest is cut off.
-/// [UnixSocketListener.CutsOffWhoIsLongestInAFrameWhereAUserHasTooManyHalves]
-inline constexpr std::size_t kHalfFrameBytesOfUser = 8 * 1024 * 1024;
-
-/// How long such a client may read nothing at all before it is cut off.
+/// How long a client with more than `kUnreadReplyBytesToPause` unread may read nothing at
+/// all before it is cut off.
 /// [UnixSocketListener.CutsOffAClientThatNeverReadsItsReplies]
 inline constexpr std::chrono::seconds kUnreadPatience{3};
 

@@ -133,7 +133,7 @@ class PeerConnectionTurn : public testing::Test {
   FileDescriptor client;
   FileDescriptor ours;
   const std::shared_ptr<UserAccount> user = std::make_shared<UserAccount>(
-      1000, ListenerLimits().ofUser,
+      ListenerLimits().ofUser,
       std::shared_ptr<ServiceAccount>(new ServiceAccount{Share(1000), Share(1000)}));
   const std::shared_ptr<PeerChannel> channel = std::make_shared<PeerChannel>(
       1, std::make_shared<LoopWaker>(), user,

@@ -65,9 +65,7 @@ bool PeerChannel::mayMerge(const Merged& then) noexcept {
   return false;
 }
 
-void PeerChannel::relieve(std::size_t bytes) noexcept { give(bytes); }
-
-void PeerChannel::give(std::size_t bytes) noexcept {
+void PeerChannel::relieve(std::size_t bytes) noexcept {
   const bool hasOwnEased = own_.give(bytes);
   const bool hasUserEased = user_->queued().give(bytes);
   const bool hasReserve =
@@ -76,8 +74,7 @@ void PeerChannel::give(std::size_t bytes) noexcept {
 }
 
 std::uint64_t PeerChannel::chargeRequest(std::size_t bytes) {
-  own_.take(bytes);
-  user_->queued().take(bytes);
+  charge(bytes);
   return chargedMark_ += bytes;
 }
 
@@ -85,7 +82,7 @@ void PeerChannel::requestsRan(std::uint64_t mark) noexcept {
   std::uint64_t ran = ranMark_.load(std::memory_order_relaxed);
   while (ran < mark && !ranMark_.compare_exchange_weak(ran, mark)) {
   }
-  if (ran < mark) give(mark - ran);
+  if (ran < mark) relieve(mark - ran);
 }
 
 bool PeerChannel::awaitBudget() {

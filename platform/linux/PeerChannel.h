@@ -95,7 +95,6 @@ class PeerChannel final : public PayloadAccount {
   std::size_t idsReplyBytes() const { return idsReplyBytes_.load(); }
 
  private:
-  void give(std::size_t bytes) noexcept;
   bool isBeyondReserve() const {
     const std::size_t used = own_.used();
     return used > reservedQueuedBytes_ &&

@@ -81,7 +81,7 @@ TEST_F(PeerChannelBudget, IsThatOfAllConnectionsOfTheUserToo) {
 TEST_F(PeerChannelBudget, ReservesMoreWhereConnectionsAreFew) {
   UserAccount::Limits limits{/*queuedBytes=*/100, /*sessions=*/10, /*keptBytes=*/500};
   limits.reservedQueuedBytes = 40;
-  const auto user = std::make_shared<UserAccount>(1000, limits, service_);
+  const auto user = std::make_shared<UserAccount>(limits, service_);
   user->queued().take(101);
   const auto mayHave = [&](std::size_t connections, std::size_t bytes) {
     user->setConnections(connections);

@@ -20,7 +20,7 @@ class ChannelsOfAUser : public testing::Test {
   explicit ChannelsOfAUser(std::size_t unreadBytes)
       : ChannelsOfAUser(unreadBytes, kLimitsOfUser) {}
   ChannelsOfAUser(std::size_t unreadBytes, const UserAccount::Limits& ofUser)
-      : user_(std::make_shared<UserAccount>(1000, ofUser, service_)),
+      : user_(std::make_shared<UserAccount>(ofUser, service_)),
         limits_{/*queuedBytes=*/60, unreadBytes} {}
 
   PeerChannel makeChannel(LoopWaker::ConnectionID id) const {

@@ -15,9 +15,6 @@
 namespace ostrel {
 namespace {
 
-// A frame that is not whole grows by as much as comes, not by what it claims.
-constexpr std::size_t kMostGrowth = 64 * 1024;
-
 // Read at a time: at first and at most.
 constexpr std::size_t kFirstReadBytes = 16 * 1024;
 constexpr std::size_t kLeastReadBytes = 4 * 1024;
@@ -141,19 +138,18 @@ std::uint64_t PeerConnection::takeTurn(std::span<std::uint8_t> buffer) {
 }
 
 // What is pending is a frame that is not whole. A little is put before what comes
-// next, so that a burst costs one call to the system; to more the rest is read
-// directly, so that a frame costs one copy however small its pieces are.
+// next, so that a burst costs one call to the system; to more the rest is appended,
+// so that a frame is copied twice however small its pieces are.
 void PeerConnection::read(std::span<std::uint8_t> buffer) {
   // What cannot be carried out now stays in the socket.
   if (holdBackIfFull()) return;
   if (pending_.size() > kMostJoined) {
-    const std::size_t before = pending_.size();
-    const std::size_t wanted = std::min(missingBytes(), kMostGrowth);
-    pending_.resize(before + wanted);
-    auto* at = reinterpret_cast<std::uint8_t*>(pending_.data()) + before;
-    const ssize_t count = receive({at, wanted});
-    pending_.resize(before + static_cast<std::size_t>(std::max<ssize_t>(count, 0)));
-    if (count > 0) processPending();
+    const auto room = buffer.first(std::min(missingBytes(), buffer.size()));
+    const ssize_t count = receive(room);
+    if (count <= 0) return;
+    pending_.append(reinterpret_cast<const char*>(room.data()),
+                    static_cast<std::size_t>(count));
+    processPending();
     return;
   }
   std::copy(pending_.begin(), pending_.end(), buffer.begin());

@@ -4,10 +4,8 @@
 #include <deque>
 #include <map>
 #include <mutex>
-#include <optional>
 
 #include "platform/IPCListener.h"
-#include "platform/ThreadAnnotations.h"
 #include "platform/linux/FileDescriptor.h"
 
 namespace ostrel {

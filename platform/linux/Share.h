@@ -22,6 +22,9 @@ class Share {
     return true;
   }
 
+  /// Though less is left: for what cannot be refused.
+  void takeAnyway(std::size_t amount) noexcept { used_ += amount; }
+
   void give(std::size_t amount) noexcept { used_ -= amount; }
 
   std::size_t used() const { return used_.load(); }

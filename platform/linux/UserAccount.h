@@ -58,21 +58,17 @@ class UserAccount {
     std::size_t unreadBytes = limits::kUnreadReplyBytesOfUser;
     std::size_t userInfoBytes = limits::kUserInfoBytesOfUser;
     std::size_t halfFrameBytes = limits::kHalfFrameBytesOfUser;
-    std::size_t memory = limits::kMemoryOfUser;
+    std::size_t memory = limits::kMemoryBytesOfUser;
     std::size_t reservedQueuedBytes = limits::kReservedQueuedBytesOfUser;
   };
 
-  UserAccount(std::uint32_t user, const Limits& limits,
-              std::shared_ptr<ServiceAccount> service)
-      : user_(user),
-        limits_(limits),
+  UserAccount(const Limits& limits, std::shared_ptr<ServiceAccount> service)
+      : limits_(limits),
         queued_(limits.queuedBytes),
         userInfos_(std::make_shared<UserInfos>(limits.userInfoBytes)),
         service_(std::move(service)),
         sessions_(limits.sessions),
         keptBytes_(limits.keptBytes) {}
-
-  std::uint32_t user() const { return user_; }
 
   /// Bytes of requests that are accepted and not yet carried out.
   RequestBudget& queued() { return queued_; }
@@ -165,7 +161,6 @@ class UserAccount {
     all.give(amount);
   }
 
-  const std::uint32_t user_;
   const Limits limits_;
   RequestBudget queued_;
   std::atomic<std::size_t> connections_{0};

@@ -77,8 +77,8 @@ TEST(RequestBudget, DoesNotLetWaitWhenHalfIsFreeAlready) {
 TEST(UserAccount, TakesSessionsUpToTheUsersShareAndTheServices) {
   const auto service = serviceWith(/*sessions=*/5, /*keptBytes=*/0);
   const UserAccount::Limits limits{/*queuedBytes=*/0, /*sessions=*/3, /*keptBytes=*/0};
-  UserAccount one(1000, limits, service);
-  UserAccount two(1001, limits, service);
+  UserAccount one(limits, service);
+  UserAccount two(limits, service);
   EXPECT_TRUE(one.takeSession());
   EXPECT_TRUE(one.takeSession());
   EXPECT_TRUE(one.takeSession());
@@ -95,8 +95,8 @@ TEST(UserAccount, TakesSessionsUpToTheUsersShareAndTheServices) {
 TEST(UserAccount, KeepsBytesUpToTheUsersShareAndTheServices) {
   const auto service = serviceWith(/*sessions=*/0, /*keptBytes=*/1500);
   const UserAccount::Limits limits{/*queuedBytes=*/0, /*sessions=*/0, /*keptBytes=*/1000};
-  UserAccount one(1000, limits, service);
-  UserAccount two(1001, limits, service);
+  UserAccount one(limits, service);
+  UserAccount two(limits, service);
   EXPECT_TRUE(one.keep(999));
   EXPECT_TRUE(one.keep(1));
   EXPECT_FALSE(one.keep(1));
@@ -118,7 +118,7 @@ class CrowdedUser : public testing::Test {
     limits.memory = 5 * limits::kSessionBytes;
     return limits;
   }
-  UserAccount user{1000, limits(), serviceWith(/*sessions=*/10, /*keptBytes=*/0)};
+  UserAccount user{limits(), serviceWith(/*sessions=*/10, /*keptBytes=*/0)};
 };
 
 TEST_F(CrowdedUser, HasMoreThanItsMemory) {
