@@ -27,6 +27,13 @@ class FairLineTest : public testing::Test {
     return next;
   }
   void makeBusy(std::size_t client) { line.introduce(places[client]); }
+  /// Clients 1 and 2.
+  void lineUpBusyOnes() {
+    for (const std::size_t client : {1u, 2u}) {
+      makeBusy(client);
+      enter(client);
+    }
+  }
 
   FairLine line;
   std::array<FairLine::Place, kClients> places;
@@ -35,10 +42,7 @@ class FairLineTest : public testing::Test {
 using FairLineOrder = FairLineTest;
 
 TEST_F(FairLineOrder, LetsWhoAsksForLittleGoFirst) {
-  makeBusy(1);
-  makeBusy(2);
-  enter(1);
-  enter(2);
+  lineUpBusyOnes();
   enter(3);
   EXPECT_EQ(serveNext(1000), 3u);
   EXPECT_EQ(serveNext(1000), 1u);
@@ -68,10 +72,7 @@ TEST_F(FairLineOrder, ForgetsWhatWasAskedForInTime) {
 }
 
 TEST_F(FairLineOrder, LetsWhoHadLeastGoFirstOfThoseThatAskForMuch) {
-  makeBusy(1);
-  makeBusy(2);
-  enter(1);
-  enter(2);
+  lineUpBusyOnes();
   EXPECT_EQ(serveNext(1000), 1u);
   EXPECT_EQ(serveNext(300), 2u);
   std::string order;

@@ -235,12 +235,17 @@ TEST_F(UnixSocketListener, CutsOffWhoIsLongestInAFrameWhereAUserHasTooManyHalves
   EXPECT_EQ(misuse->counts()[static_cast<std::size_t>(MisuseLog::Kind::kCutOff)], 1u);
 }
 
-TEST_F(UnixSocketListener, ServesAClientWithLittleUnderWayHoweverMuchItsUserHas) {
+// A kilobyte under way for all connections of a user, and the reserve for each.
+ListenerLimits limitsWithReserve(std::size_t bytes) {
   ListenerLimits limits;
   limits.ofUser.queuedBytes = 1024;
-  limits.reservedQueuedBytes = 2 * limits::kRequestBytes;
+  limits.reservedQueuedBytes = bytes;
   limits.ofUser.reservedQueuedBytes = 0;
-  serveHolding(limits);
+  return limits;
+}
+
+TEST_F(UnixSocketListener, ServesAClientWithLittleUnderWayHoweverMuchItsUserHas) {
+  serveHolding(limitsWithReserve(2 * limits::kRequestBytes));
   RawClient greedy(path);
   greedy.send(messageRequest(1, std::string(4096, 'x')));
   ASSERT_TRUE(service->waitForCalls(1));
@@ -256,11 +261,7 @@ TEST_F(UnixSocketListener, ServesAClientWithLittleUnderWayHoweverMuchItsUserHas)
 }
 
 TEST_F(UnixSocketListener, LeavesWhatItCannotCarryOutInTheSocket) {
-  ListenerLimits limits;
-  limits.ofUser.queuedBytes = 1024;
-  limits.reservedQueuedBytes = 0;
-  limits.ofUser.reservedQueuedBytes = 0;
-  serveHolding(limits);
+  serveHolding(limitsWithReserve(0));
   RawClient first(path);
   first.send(messageRequest(1, std::string(4096, 'x')));
   ASSERT_TRUE(service->waitForCalls(1));
