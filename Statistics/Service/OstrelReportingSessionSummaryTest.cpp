@@ -190,21 +190,21 @@ class StorageThatChanges final : public EntryStorage {
   }
 };
 
-TEST_F(OstrelReportingSessionSummary, HasBlanksWhereAListReadsShorterTheSecondTime) {
+Dictionary summaryOfAListThatReads(int first, int second) {
   StorageThatChanges storage;
   OstrelReportingAggregatedPayloads list(storage, ReporterID{42});
-  list.append("a", {{"x", 1000}});
-  list.append("a", {{"x", 1}});
-  EXPECT_EQ(summaryEvent(ServiceType{3}, list.snapshot()),
+  list.append("a", {{"x", first}});
+  list.append("a", {{"x", second}});
+  return summaryEvent(ServiceType{3}, list.snapshot());
+}
+
+TEST_F(OstrelReportingSessionSummary, HasBlanksWhereAListReadsShorterTheSecondTime) {
+  EXPECT_EQ(summaryOfAListThatReads(1000, 1),
             (Dictionary{{"Ostrel_Session_Summary_Event", "3"}, {"a", "{x: 1}   "}}));
 }
 
 TEST_F(OstrelReportingSessionSummary, HasNoMoreThanItsPlaceOfAListThatReadsLonger) {
-  StorageThatChanges storage;
-  OstrelReportingAggregatedPayloads list(storage, ReporterID{42});
-  list.append("a", {{"x", 1}});
-  list.append("a", {{"x", 1000}});
-  EXPECT_EQ(summaryEvent(ServiceType{3}, list.snapshot()),
+  EXPECT_EQ(summaryOfAListThatReads(1, 1000),
             (Dictionary{{"Ostrel_Session_Summary_Event", "3"}, {"a", "{x: 10"}}));
 }
 
