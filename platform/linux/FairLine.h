@@ -20,8 +20,8 @@ class FairLine {
   using ID = std::uint64_t;
 
   static constexpr std::uint64_t kTimeForWork = 20;  // Of which one part is little.
-  static constexpr std::uint64_t kSavedWork =
-      1'000'000;  // That may be asked for at once.
+  /// That may be asked for at once.
+  static constexpr std::uint64_t kSavedWork = 1'000'000;
   /// Of one that is new: a tenth of a second.
   static constexpr std::uint64_t kDebtOfNew = 5'000'000;
   /// So many that ask for little may go before one that does not.

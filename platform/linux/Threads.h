@@ -15,8 +15,7 @@ bool setNiceness(int niceness);
 
 /// Starts a thread that runs `body`. No signal is delivered to it. `name` is cut
 /// to 15 bytes. Where the system does not allow `niceness`, the thread keeps that of its
-/// maker. Throws std::system_error when
-/// no thread can be made.
+/// maker. Throws std::system_error when no thread can be made.
 std::thread startThread(const std::string& name, int niceness,
                         std::function<void()> body);
 

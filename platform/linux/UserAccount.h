@@ -7,7 +7,7 @@
 #include <memory>
 #include <utility>
 
-#include "platform/Value.h"
+#include "platform/ValueBuffer.h"
 #include "platform/linux/Limits.h"
 #include "platform/linux/RequestBudget.h"
 #include "platform/linux/Share.h"
