@@ -2,22 +2,31 @@
 
 #include <cstddef>
 #include <cstdint>
+#include <string_view>
+#include <type_traits>
 
 namespace ostrel {
 
-/// A hash of the IDs that clients choose, for tables that look them up: in each process
-/// another one, so that nobody can choose IDs that all meet in one place of a table and
-/// make every look-up a walk over them. All of its bits are good. Any thread.
+/// A hash of the IDs and the keys that clients choose, for tables that look them up: in
+/// each process another one, so that nobody can choose some that all meet in one place of
+/// a table and make every look-up a walk over them. All of its bits are good. Any thread.
 class SpreadHash {
  public:
-  /// `ID` is an integer, or an enumeration of integers.
   template <typename ID>
-  std::size_t operator()(ID id) const noexcept {
+  requires(std::is_integral_v<ID> || std::is_enum_v<ID>) std::size_t operator()(
+      ID id) const noexcept {
     std::uint64_t hash = static_cast<std::uint64_t>(id) ^ kSeed;
     hash = (hash ^ (hash >> 32)) * kFactor;
     hash = (hash ^ (hash >> 32)) * kFactor;
     return static_cast<std::size_t>(hash ^ (hash >> 32));
   }
+  std::size_t operator()(std::string_view text) const noexcept {
+    return static_cast<std::size_t>(ofText(text, kSeed));
+  }
+
+  /// Of a text in a process with this seed: texts that meet under one seed do not under
+  /// others. (SipHash with one round a block and three at the end.)
+  static std::uint64_t ofText(std::string_view text, std::uint64_t seed) noexcept;
 
  private:
   static constexpr std::uint64_t kFactor = 0xD6E8FEB86659FD93;

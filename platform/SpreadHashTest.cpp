@@ -5,6 +5,11 @@
 #include <algorithm>
 #include <array>
 #include <cstdint>
+#include <functional>
+#include <string>
+#include <vector>
+
+#include "platform/SpreadHashTesting.h"
 
 namespace ostrel {
 namespace {
@@ -42,6 +47,58 @@ TEST(SpreadHash, SpreadsIDsThatAreChosenToMeet) {
         std::uint64_t{0xF1DE83E19937733D}}) {
     EXPECT_LT(mostInASlot(step, /*shift=*/0), 200u) << step;
     EXPECT_LT(mostInASlot(step, /*shift=*/54), 200u) << step;
+  }
+}
+
+// How many of `count` hashes meet in one slot at most.
+template <typename Hash>
+std::size_t mostInASlot(std::size_t count, const Hash& hashOf) {
+  std::array<std::size_t, kSlots> slots{};
+  for (std::size_t i = 0; i < count; ++i) ++slots[hashOf(i) % kSlots];
+  return *std::max_element(slots.begin(), slots.end());
+}
+
+TEST(SpreadHash, SpreadsIDsThatMeetWithoutASeed) {
+  EXPECT_LT(mostInASlot(kIDs,
+                        [](std::size_t i) {
+                          return SpreadHash()(
+                              testing_support::meetingID(static_cast<std::uint32_t>(i)));
+                        }),
+            200u);
+}
+
+TEST(SpreadHash, SpreadsKeysThatMeetWithoutASeed) {
+  const std::vector<std::string> keys = testing_support::meetingKeys(4096);
+  const auto unseeded = std::hash<std::string>();
+  for (const std::string& key : keys) ASSERT_EQ(unseeded(key), unseeded(keys.front()));
+  EXPECT_LT(
+      mostInASlot(keys.size(), [&](std::size_t i) { return SpreadHash()(keys[i]); }), 30u)
+      << "four on average";
+}
+
+TEST(SpreadHash, LetsOtherTextsMeetUnderEachSeed) {
+  std::vector<std::string> met;
+  for (int i = 0; met.size() < 100; ++i) {
+    std::string text = "key" + std::to_string(i);
+    if (SpreadHash::ofText(text, /*seed=*/1) % kSlots == 0) met.push_back(text);
+  }
+  EXPECT_LT(
+      mostInASlot(met.size(),
+                  [&](std::size_t i) { return SpreadHash::ofText(met[i], /*seed=*/2); }),
+      10u);
+}
+
+TEST(SpreadHash, TellsTextsApartThatDifferInOneBitOrInLength) {
+  for (std::size_t size = 0; size < 20; ++size) {
+    const std::string text(size, '\0');
+    const std::size_t hash = SpreadHash()(text);
+    EXPECT_EQ(hash, SpreadHash()(std::string_view(text)));
+    EXPECT_NE(hash, SpreadHash()(text + '\0'));
+    for (std::size_t bit = 0; bit < 8 * size; ++bit) {
+      std::string other = text;
+      other[bit / 8] = static_cast<char>(1 << bit % 8);
+      EXPECT_NE(hash, SpreadHash()(other)) << size << " bytes, bit " << bit;
+    }
   }
 }
 

@@ -2,7 +2,6 @@
 
 #include <algorithm>
 #include <cstdint>
-#include <functional>
 #include <string>
 #include <string_view>
 #include <utility>
@@ -10,6 +9,7 @@
 
 #include "Statistics/OstrelReportingUtility.h"
 #include "Statistics/Service/OstrelReportingPayloadSurvey.h"
+#include "platform/SpreadHash.h"
 
 namespace ostrel {
 namespace {
@@ -111,7 +111,7 @@ class Summary {
   std::size_t groupOf(ValueView key) {
     if (2 * groups_.size() >= slots_.size()) growSlots();
     const std::string_view name = nameOf(key);
-    const std::size_t hash = std::hash<std::string_view>()(name);
+    const std::size_t hash = SpreadHash()(name);
     std::size_t at = hash;
     while (true) {
       Slot& slot = slots_[at++ & (slots_.size() - 1)];

@@ -7,6 +7,7 @@
 #include <string_view>
 #include <unordered_map>
 
+#include "platform/SpreadHash.h"
 #include "platform/linux/AlsaChannels.h"
 #include "platform/linux/ChannelFile.h"
 #include "platform/linux/SmallFile.h"
@@ -128,7 +129,7 @@ Outcome<Dictionary> sample(const Sources& sources, const Dictionary& subscribed)
   return {samples.build(), std::nullopt};
 }
 
-using Counters = std::unordered_map<std::string_view, std::int64_t>;
+using Counters = std::unordered_map<std::string_view, std::int64_t, SpreadHash>;
 
 // None when `samples` are not of this service.
 std::optional<std::map<std::string_view, Counters>> countersOf(
