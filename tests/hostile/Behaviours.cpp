@@ -51,6 +51,7 @@ constexpr Behaviour kBehaviours[] = {
     {"leaves-while-starting", "starts sessions and is gone before they are",
      leaveWhileStarting},
     {"squatted-ids", "takes others' IDs, and stops and changes their sessions", squatIDs},
+    {"chosen-ids", "chooses IDs and keys that meet in tables", chooseIDs},
     {"mixed-operations", "calls the operations at random", mixOperations},
     {"forged-log-lines", "sends text that looks like the log's", forgeLogLines},
     {"planted-logs", "plants links and pipes where session logs are written",

@@ -72,6 +72,7 @@ void delayAlarms(Attack& attack);
 void sendLargeMessages(Attack& attack);
 void leaveWhileStarting(Attack& attack);
 void squatIDs(Attack& attack);
+void chooseIDs(Attack& attack);
 void mixOperations(Attack& attack);
 void forgeLogLines(Attack& attack);
 void plantInTheLogDirectory(Attack& attack);

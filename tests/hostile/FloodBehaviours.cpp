@@ -8,6 +8,7 @@
 #include <ctime>
 #include <filesystem>
 
+#include "platform/SpreadHashTesting.h"
 #include "platform/linux/Limits.h"
 #include "tests/hostile/Behaviours.h"
 
@@ -233,6 +234,43 @@ void squatIDs(Attack& attack) {
       attack.rest(milliseconds(20));
       attack.step();
     }
+  }
+}
+
+// Whatever these meet in, each look-up there takes as long as all before it.
+void chooseIDs(Attack& attack) {
+  constexpr std::uint32_t kChosen = 4000;
+  constexpr std::uint32_t kAtOnce = 500;
+  const std::vector<std::string> keys = testing_support::meetingKeys(1000);
+  std::string payload = head(Major::kMap, keys.size());
+  for (const std::string& key : keys) payload += key + integer(1);
+  while (!attack.isOver()) {
+    Peer peer = attack.admitted();
+    bool isOpen = true;
+    for (std::uint32_t first = 0; isOpen && first < kChosen; first += kAtOnce) {
+      std::string frames;
+      std::string ids = head(Major::kArray, kAtOnce);
+      for (std::uint32_t number = first; number < first + kAtOnce; ++number) {
+        // Also such as are multiples of a power of two.
+        const std::int64_t id = number % 2 == 0 ? testing_support::meetingID(number)
+                                                : static_cast<std::int64_t>(number) << 40;
+        frames += create(id) +
+                  configure(id, keys[number % keys.size()].substr(1), integer(number));
+        ids += integer(id);
+      }
+      frames += start(testing_support::meetingID(first)) + send(payload, ids);
+      for (std::uint32_t number = first; number < first + kAtOnce; number += 20) {
+        frames += request(Operation::kReporterIDValid, /*number=*/1,
+                          {integer(testing_support::meetingID(number))});
+      }
+      isOpen = peer.sendAndDrain(frames, attack.end());
+      attack.step();
+    }
+    std::string frames;
+    for (std::uint32_t number = 0; number < kChosen; number += 2) {
+      frames += destroy(testing_support::meetingID(number));
+    }
+    if (isOpen && peer.sendAndDrain(frames, attack.end())) expectAnswer(attack, peer);
   }
 }
 
