@@ -18,19 +18,23 @@ inline constexpr std::size_t kFrameBytes = 320 * 1024;
 
 /// Arrays and dictionaries within one another in a payload. Deeper ones are no
 /// reports; walks stay short.
-/// [PayloadCheck.TakesNestingUpToTheLimit]
+/// [PayloadCheck.TakesNestingUpToTheLimit,
+/// ListenerRequests.AreTakenUpToTheirLimit]
 inline constexpr std::size_t kNesting = 32;
 
 /// Values in one payload, keys included: bounds the work that one frame causes.
-/// [PayloadCheck.TakesValuesUpToTheLimit]
+/// [PayloadCheck.TakesValuesUpToTheLimit,
+/// ListenerRequests.AreTakenUpToTheirLimit]
 inline constexpr std::size_t kNodes = 65536;
 
 /// Of one text key.
-/// [PayloadCheck.TakesKeysUpToTheLimit]
+/// [PayloadCheck.TakesKeysUpToTheLimit,
+/// ListenerRequests.AreTakenUpToTheirLimit]
 inline constexpr std::size_t kKeyBytes = 1024;
 
 /// IDs in one request: each is one delivery.
-/// [RequestFrame.TakesIDsUpToTheLimit]
+/// [RequestFrame.TakesIDsUpToTheLimit,
+/// ListenerRequests.AreTakenUpToTheirLimit]
 inline constexpr std::size_t kReporterIDs = 1024;
 
 // What the clients of a user may have and have under way
@@ -52,7 +56,8 @@ inline constexpr std::size_t kQueuedBytes = 4 * 1024 * 1024;
 /// The same of all connections of one user, so that many connections do not make
 /// many times the memory.
 /// [RequestBudget.IsExceededBeyondItsBytes,
-/// PeerChannelBudget.IsThatOfAllConnectionsOfTheUserToo]
+/// PeerChannelBudget.IsThatOfAllConnectionsOfTheUserToo,
+/// ListenerSharesUnderWay.AreThoseOfAllConnectionsOfTheUser]
 inline constexpr std::size_t kQueuedBytesOfUser = 16 * 1024 * 1024;
 
 /// What a connection may have of that when the user's other connections have it all: a
@@ -89,13 +94,17 @@ inline constexpr std::size_t kSessionBytes = 512;
 /// share, an eighth or, of requests, a quarter and, of frames, a half; so that the
 /// service stays within 96 MiB though the shares are more together.
 /// [CrowdedUser.HasMoreThanItsMemory,
-/// CrowdedUser.HasPartOfEachShare]
+/// CrowdedUser.HasPartOfEachShare,
+/// ListenerShares.OfACrowdedUserAreLessForUserInfos,
+/// ListenerShares.OfACrowdedUserAreLessForHalvesOfFrames,
+/// ListenerSharesUnderWay.AreAQuarterForACrowdedUser]
 inline constexpr std::size_t kMemoryBytesOfUser = 20 * 1024 * 1024;
 
 /// Bytes of the entries that sessions keep for their summaries, in all, and of the
 /// messages of one user's clients. Room for a session of a million messages with its
 /// summary, twice. What is beyond a small budget in memory is in files.
-/// [UserAccount.KeepsBytesUpToTheUsersShareAndTheServices]
+/// [UserAccount.KeepsBytesUpToTheUsersShareAndTheServices,
+/// ListenerShares.OfAUserAreTheBytesThatItsSessionsKeep]
 inline constexpr std::size_t kKeptBytes = std::size_t{2} * 1024 * 1024 * 1024;
 inline constexpr std::size_t kKeptBytesOfUser = std::size_t{1} * 1024 * 1024 * 1024;
 
@@ -142,16 +151,19 @@ inline constexpr std::chrono::milliseconds kTurnsBetweenLooks{1};
 
 /// Of one session's user info, which configurations add to and nothing takes from. An
 /// entry beyond it is left out. A few dozen entries are usual, of a kilobyte or two.
-/// [UserInfo.TakesBytesUpToTheLimit]
+/// [UserInfo.TakesBytesUpToTheLimit,
+/// ListenerShares.OfAUserInfoAreItsBytes]
 inline constexpr std::size_t kUserInfoBytes = 64 * 1024;
 
 /// Its entries: each configuration looks at all of them.
-/// [UserInfo.TakesEntriesUpToTheLimit]
+/// [UserInfo.TakesEntriesUpToTheLimit,
+/// ListenerShares.OfAUserInfoAreItsEntries]
 inline constexpr std::size_t kUserInfoEntries = 512;
 
 /// The bytes of all that one user's clients gave, the copies that live telemetry sessions
 /// have among them: a kilobyte for each of 16,384 sessions.
-/// [UserInfo.OfAllSessionsOfAUserTakesBytesUpToTheLimit]
+/// [UserInfo.OfAllSessionsOfAUserTakesBytesUpToTheLimit,
+/// ListenerShares.OfAUserAreTheUserInfosOfAllItsSessions]
 inline constexpr std::size_t kUserInfoBytesOfUser = 16 * 1024 * 1024;
 
 // Replies

@@ -67,6 +67,8 @@ class RawClient {
     return error ? std::string(*error) : reply.closingReason;
   }
 
+  /// Whether the service has ended the stream, as far as was read.
+  bool isCutOff() const { return hasEnded_; }
   /// Whether the service ended the stream, which it does soon.
   bool isEnded() {
     std::string rest;

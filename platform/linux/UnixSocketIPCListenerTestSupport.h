@@ -98,9 +98,9 @@ class RecordingService : public OstrelReportingServiceProtocol {
     const std::lock_guard lock(mutex_);
     return calls_;
   }
-  bool waitForCalls(std::size_t count) const {
+  bool waitForCalls(std::size_t count, std::chrono::milliseconds patience = kSoon) const {
     std::unique_lock lock(mutex_);
-    return changed_.wait_for(lock, kSoon, [&] { return calls_.size() >= count; });
+    return changed_.wait_for(lock, patience, [&] { return calls_.size() >= count; });
   }
 
  private:
