@@ -10,6 +10,7 @@
 #include <span>
 
 #include "client/RequestFrame.h"
+#include "platform/Bytes.h"
 #include "platform/Value.h"
 #include "platform/linux/Limits.h"
 #include "platform/linux/wire/PayloadDecoder.h"
@@ -26,10 +27,6 @@ constexpr std::size_t kWideSize = 9;
 
 // Beyond it, keys are kept in a set of their own.
 constexpr std::size_t kFewKeys = 32;
-
-std::span<const std::uint8_t> asBytes(std::string_view text) {
-  return {reinterpret_cast<const std::uint8_t*>(text.data()), text.size()};
-}
 
 ValueView viewOf(std::string_view encoded) { return ValueView(asBytes(encoded).data()); }
 

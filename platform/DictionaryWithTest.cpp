@@ -4,6 +4,7 @@
 #include <string>
 #include <vector>
 
+#include "platform/Bytes.h"
 #include "platform/Value.h"
 #include "platform/fake/CountingAccount.h"
 
@@ -11,8 +12,7 @@ namespace ostrel {
 namespace {
 
 std::string encoded(const Dictionary& dictionary) {
-  const auto bytes = dictionary.value().bytes();
-  return {reinterpret_cast<const char*>(bytes.data()), bytes.size()};
+  return std::string(asText(dictionary.value().bytes()));
 }
 
 Dictionary built(const Dictionary& start, std::string_view key, const Value& value) {
@@ -43,6 +43,19 @@ TEST(DictionaryWith, TellsATextKeyFromAnIntegerKey) {
   const Dictionary start =
       DictionaryBuilder().set(five.view(), Value("integer").view()).build();
   EXPECT_EQ(encoded(start.with("5", "text")), encoded(built(start, "5", "text")));
+}
+
+// As a builder writes them: what is asked for both ways is the same afterwards.
+TEST(DictionaryWith, WritesKeysShortThatTheirSenderWroteAtLength) {
+  const std::vector<std::uint8_t> bytes{0xA2, 0x78, 0x01, 'a', 0x01, 0x18, 0x05, 0x02};
+  const ValueBuffer buffer = ValueBuffer::copyOf(bytes);
+  const Dictionary start(buffer, buffer.data());
+  for (const char* key : {"a", "b", "5"}) {
+    const std::string result = encoded(start.with(key, 3));
+    EXPECT_EQ(result, encoded(built(start, key, 3))) << key;
+    EXPECT_EQ(result.find('\x78'), std::string::npos) << key;
+    EXPECT_EQ(result.find('\x18'), std::string::npos) << key;
+  }
 }
 
 TEST(DictionaryWith, IsOneBufferOfTheSameAccount) {

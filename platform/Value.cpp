@@ -9,6 +9,8 @@
 #include <cstring>
 #include <limits>
 
+#include "platform/Bytes.h"
+
 namespace ostrel {
 namespace {
 
@@ -153,10 +155,6 @@ double integerAsDouble(const Head& head) {
                                      : -static_cast<double>(head.argument + 1);
 }
 
-std::string_view asText(std::span<const std::uint8_t> bytes) {
-  return {reinterpret_cast<const char*>(bytes.data()), bytes.size()};
-}
-
 // The same key always has the same bytes here, however its sender wrote it.
 std::string canonicalKey(ValueView key) {
   std::string bytes;
@@ -228,10 +226,6 @@ std::string encoded(Encode encode) {
   ValueEncoder encoder(bytes);
   encode(encoder);
   return bytes;
-}
-
-std::span<const std::uint8_t> asBytes(std::string_view text) {
-  return {reinterpret_cast<const std::uint8_t*>(text.data()), text.size()};
 }
 
 Dictionary joined(std::initializer_list<std::span<const std::uint8_t>> parts,

@@ -3,6 +3,8 @@
 #include <array>
 #include <cstdint>
 
+#include "platform/Bytes.h"
+
 namespace ostrel {
 namespace {
 
@@ -10,10 +12,6 @@ namespace {
 // it is a summary, which is dropped with the list soon; to copy it would take as much
 // memory again.
 constexpr std::size_t kLargePayload = 64 * 1024;
-
-StoredEntries::Bytes asBytes(std::string_view text) {
-  return {reinterpret_cast<const std::uint8_t*>(text.data()), text.size()};
-}
 
 }  // namespace
 

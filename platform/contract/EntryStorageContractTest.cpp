@@ -1,6 +1,7 @@
 // What sessions collect until they stop.
 #include <thread>
 
+#include "platform/Bytes.h"
 #include "platform/fake/CountingAccount.h"
 #include "platform/fake/FakeEntryStorage.h"
 #include "platform/linux/FileEntryStorage.h"
@@ -32,7 +33,6 @@ struct EntriesInFile {
 };
 
 using testing_support::append;
-using testing_support::asBytes;
 using testing_support::bytesOf;
 
 std::string entryOf(std::size_t number, std::size_t size) {

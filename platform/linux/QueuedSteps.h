@@ -116,8 +116,7 @@ class StepList {
 
   /// Runs the first step and ends it before the next is looked at.
   void runFirst() {
-    QueuedStep* const step = first_;
-    first_ = step->next;
+    QueuedStep* const step = takeFirst();
     if (first_ != nullptr) first_->fetchAhead();
     step->run();
     QueuedStep::takeBack(step);
@@ -125,13 +124,14 @@ class StepList {
 
   /// Ends the first step unrun.
   void dropFirst() {
-    QueuedStep* const step = first_;
-    first_ = step->next;
+    QueuedStep* const step = takeFirst();
     step->end();
     QueuedStep::takeBack(step);
   }
 
  private:
+  QueuedStep* takeFirst() { return std::exchange(first_, first_->next); }
+
   QueuedStep* first_ = nullptr;
   QueuedStep* last_ = nullptr;  // Of any use only while there is a first.
 };

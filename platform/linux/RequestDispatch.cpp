@@ -47,6 +47,13 @@ class RequestTicket {
   const std::uint64_t mark_;
 };
 
+// One for a request that was charged so much; none for nothing.
+std::shared_ptr<RequestTicket> ticketFor(const std::shared_ptr<PeerChannel>& channel,
+                                         wire::RequestNumber number, std::size_t cost) {
+  if (cost == 0) return nullptr;
+  return std::make_shared<RequestTicket>(channel, number, channel->chargeRequest(cost));
+}
+
 class SessionStepBurden final : public Burden {
  public:
   SessionStepBurden(std::shared_ptr<PeerChannel> channel, std::size_t bytes)
@@ -182,12 +189,7 @@ static_assert(rowsStandInOrder(), "handlers and operations are one table");
 void dispatchRequest(OstrelReportingServiceProtocol& object,
                      const std::shared_ptr<PeerChannel>& channel,
                      wire::Request& request) {
-  std::shared_ptr<RequestTicket> ticket;
-  const std::size_t cost = costOf(request, *channel);
-  if (cost != 0) {
-    ticket = std::make_shared<RequestTicket>(channel, request.number,
-                                             channel->chargeRequest(cost));
-  }
+  auto ticket = ticketFor(channel, request.number, costOf(request, *channel));
   BurdenShare burden;
   if (const std::size_t bytes = burdenOf(request.operation); bytes != 0) {
     burden = BurdenShare(new SessionStepBurden(channel, bytes));
@@ -203,8 +205,7 @@ void dispatchRefusedSession(OstrelReportingServiceProtocol& object,
                             const wire::Request& request) {
   object.setConfiguration(
       /*configuration=*/std::nullopt, kNoReporter,
-      Reply(std::make_shared<RequestTicket>(
-          channel, request.number, channel->chargeRequest(costOf(request, *channel)))));
+      Reply(ticketFor(channel, request.number, costOf(request, *channel))));
 }
 
 bool keepsReply(wire::Operation operation) {
@@ -219,8 +220,7 @@ bool onlyAsks(wire::Operation operation) {
 
 void dispatchProbe(OstrelReportingServiceProtocol& object,
                    const std::shared_ptr<PeerChannel>& channel) {
-  object.getAllReporters(Reply(std::make_shared<RequestTicket>(
-      channel, /*number=*/0, channel->chargeRequest(limits::kRequestBytes))));
+  object.getAllReporters(Reply(ticketFor(channel, /*number=*/0, limits::kRequestBytes)));
 }
 
 }  // namespace ostrel

@@ -14,6 +14,7 @@
 #include <utility>
 #include <vector>
 
+#include "platform/Bytes.h"
 #include "platform/linux/SpillFaults.h"
 #include "platform/linux/TestSupport.h"
 
@@ -32,10 +33,6 @@ std::string bytesOf(std::size_t seed, std::size_t size) {
     bytes[i] = static_cast<char>((seed * 31 + i * 7 + i / 256) & 0xFF);
   }
   return bytes;
-}
-
-SpillFile::Bytes asBytes(const std::string& text) {
-  return {reinterpret_cast<const std::uint8_t*>(text.data()), text.size()};
 }
 
 /// What was written, and where.

@@ -8,13 +8,10 @@
 #include <string>
 #include <string_view>
 
+#include "platform/Bytes.h"
 #include "platform/EntryStorage.h"
 
 namespace ostrel::testing_support {
-
-inline StoredEntries::Bytes asBytes(std::string_view text) {
-  return {reinterpret_cast<const std::uint8_t*>(text.data()), text.size()};
-}
 
 inline bool append(StoredEntries& entries, std::string_view text,
                    const std::shared_ptr<PayloadAccount>& account) {
