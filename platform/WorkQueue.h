@@ -14,6 +14,20 @@ namespace ostrel {
 /// run it.
 enum class QualityOfService { kUserInteractive, kUtility, kBackground };
 
+/// What the steps of a queue work on, and what may be far away in memory.
+class Subject {
+ public:
+  static constexpr int kStages = 3;
+
+  /// Asks for part of the memory that the next step will look at, and does not wait for
+  /// it: the subject itself, then, once that had time to come, what it points to, and
+  /// so on, `stage` from 0 to `kStages` - 1. No step of the queue runs meanwhile.
+  virtual void fetchAhead(int stage) const noexcept = 0;
+
+ protected:
+  ~Subject() = default;
+};
+
 /// A serial queue: its steps run one at a time, in the order in which they were
 /// queued, on any thread of the platform's. A queue costs no thread.
 ///
@@ -21,6 +35,9 @@ enum class QualityOfService { kUserInteractive, kUtility, kBackground };
 class OSTREL_CAPABILITY("work queue") WorkQueue {
  public:
   virtual ~WorkQueue() = default;
+
+  /// What its steps work on, each of which keeps it alive. Before the first step.
+  virtual void setSubject(const Subject& /*subject*/) {}
 
   /// Queues `step`. Any thread; never blocks, never runs the step inline.
   virtual void async(Task step) = 0;

@@ -102,7 +102,9 @@ OstrelReportingSession::OstrelReportingSession(Passkey, ReporterID reporterID,
       sessionReportingQueue_(platform.workQueues->makeSerialQueue(
           "com.orbisk.ostrel.reporting.session", QualityOfService::kUtility,
           /*relativePriority=*/0)),
-      processIdentifiers_(std::move(processIdentifiers)) {}
+      processIdentifiers_(std::move(processIdentifiers)) {
+  sessionReportingQueue_->setSubject(*this);
+}
 
 OstrelReportingSession::~OstrelReportingSession() {
   platform_.kernelTrace->trace(TraceCode::kSessionTeardown);
@@ -338,6 +340,22 @@ void OstrelReportingSession::deliverStep(const Dictionary& message,
   }
   OSTREL_LOG_DEBUG(logScope, "session not started, will send as a single message");
   sendSingleMessage(platform_, payload, category, type, serviceType(), userInfo, reply);
+}
+
+// What a delivery looks at.
+void OstrelReportingSession::fetchAhead(int stage) const noexcept {
+  if (stage == 0) {
+    fetchToRead(this, sizeof *this);
+    return;
+  }
+  const Details* const made = details_.get();
+  if (made == nullptr) return;
+  if (stage == 1) {
+    fetchToWrite(made, Details::kBytesOfDelivery);
+  } else {
+    fetchToRead(made->reportingSession.get(), sizeof(TelemetrySession));
+    fetchToWrite(made->aggregatedPayloadData.get(), sizeof(AggregatedPayloadData));
+  }
 }
 
 OstrelReportingSession::Delivery OstrelReportingSession::takeDelivery() const {

@@ -14,6 +14,7 @@
 #include "Statistics/Support/MadeOnce.h"
 #include "Statistics/Support/MutableDictionary.h"
 #include "platform/Condition.h"
+#include "platform/FetchAhead.h"
 #include "platform/OrientationService.h"
 #include "platform/OstrelReportingPlatform.h"
 #include "platform/SmallMutex.h"
@@ -39,7 +40,8 @@ namespace ostrel {
 /// Releasing a started session does not stop it: its summary and its flush are
 /// then lost.
 class OstrelReportingSession final
-    : public std::enable_shared_from_this<OstrelReportingSession> {
+    : public Subject,
+      public std::enable_shared_from_this<OstrelReportingSession> {
   using Details = OstrelReportingSessionDetails;
 
  public:
@@ -106,6 +108,13 @@ class OstrelReportingSession final
   /// Whether orientation changes belong into this session's record.
   bool shouldReportOrientation() const;
 
+  /// Asks for the memory that queueing a message will look at: first of the session,
+  /// then, once that is there, of its queue.
+  void fetchSelfAhead() const { fetchToWrite(countsOf(this), kBytesOfQueueing); }
+  void fetchQueueAhead() const {
+    fetchToWrite(countsOf(sessionReportingQueue_.get()), kBytesOfQueue);
+  }
+
   bool started() const { return started_.load(std::memory_order_acquire); }
   void setStarted(bool started) { started_.store(started, std::memory_order_release); }
   ServiceType serviceType() const { return serviceType_.load(std::memory_order_acquire); }
@@ -160,6 +169,15 @@ class OstrelReportingSession final
  private:
   struct Passkey {};
 
+  // `std::make_shared` puts the counts of references before the object.
+  static constexpr std::size_t kCountsBytes = 16;
+  static const void* countsOf(const void* object) {
+    return static_cast<const char*>(object) - kCountsBytes;
+  }
+  // The counts, and what stands first or is about as large on all platforms.
+  static constexpr std::size_t kBytesOfQueueing = 64;
+  static constexpr std::size_t kBytesOfQueue = 128;
+
  public:
   OstrelReportingSession(Passkey, ReporterID reporterID,
                          std::vector<ProcessID> processIdentifiers,
@@ -191,6 +209,8 @@ class OstrelReportingSession final
   };
   Delivery takeDelivery() const OSTREL_ON_QUEUE(*sessionReportingQueue_);
   std::shared_ptr<MutableDictionary> mutableUserInfo();
+
+  void fetchAhead(int stage) const noexcept override;
 
   void setServiceTypeStep(ServiceType serviceType, ServiceType before)
       OSTREL_ON_QUEUE(*sessionReportingQueue_);

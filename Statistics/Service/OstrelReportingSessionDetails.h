@@ -24,6 +24,8 @@ struct OstrelReportingSessionDetails {
   std::shared_ptr<TelemetrySession> reportingSession;
   // Carries its own monitor: orientation callbacks append from their own thread.
   std::shared_ptr<AggregatedPayloadData> aggregatedPayloadData;
+  static constexpr std::size_t kBytesOfDelivery =
+      sizeof messageTypeCounts + sizeof reportingSession + sizeof aggregatedPayloadData;
 
   std::shared_ptr<const DriverSnapShot> driverSnapShot;
   BoolReply transactionCompleteBlock;

@@ -3,6 +3,7 @@
 #include <memory>
 #include <utility>
 
+#include "platform/FetchAhead.h"
 #include "platform/Task.h"
 #include "platform/linux/Burden.h"
 
@@ -26,13 +27,7 @@ class QueuedStep {
 
   /// Asks for its memory, which another thread wrote last, before it is needed: each
   /// line takes some 70 ns to come from another core. Only the address is used.
-  void fetchAhead() const {
-    const auto* const bytes = reinterpret_cast<const char*>(this);
-    for (std::size_t at = 0; at < sizeof(QueuedStep); at += kLine) {
-      __builtin_prefetch(bytes + at, /*rw=*/1);
-    }
-    __builtin_prefetch(bytes + sizeof(QueuedStep) - 1, /*rw=*/1);
-  }
+  void fetchAhead() const { fetchToWrite(this, sizeof(QueuedStep)); }
 
   /// Runs the task and ends it.
   void run() {
@@ -54,9 +49,6 @@ class QueuedStep {
   Task task;
   QueuedStep* next = nullptr;
   BurdenShare burden;
-
- private:
-  static constexpr std::size_t kLine = 64;
 };
 
 /// Steps in a row. Owns them; what is left at its end is dropped unrun.

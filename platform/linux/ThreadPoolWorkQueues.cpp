@@ -17,10 +17,17 @@
 // each of many sessions this is the difference between a lock that two threads always
 // meet at and one that they rarely do.
 //
-// No lock is taken under another, and no step or destructor of a step runs under one.
+// Where many strands wait, a thread takes several at once from the line, into its hand:
+// the lock is taken once for them, and what the next ones need is fetched from memory
+// while one runs. What is in a hand is nobody's yet: a thread that finds nothing else, or
+// that sees another get no further, takes the other's hand over.
+//
+// No lock is taken under another but a hand's under its pool's, and no step or destructor
+// of a step runs under one.
 #include "platform/linux/ThreadPoolWorkQueues.h"
 
 #include <algorithm>
+#include <array>
 #include <atomic>
 #include <condition_variable>
 #include <cstdint>
@@ -29,12 +36,14 @@
 #include <deque>
 #include <mutex>
 #include <set>
+#include <span>
 #include <string>
 #include <system_error>
 #include <thread>
 #include <utility>
 #include <vector>
 
+#include "platform/FetchAhead.h"
 #include "platform/SmallMutex.h"
 #include "platform/linux/QueuedSteps.h"
 #include "platform/linux/Threads.h"
@@ -45,9 +54,15 @@ namespace {
 /// After so many steps a strand lets the others in line go first.
 constexpr int kStepsOfTurn = 128;
 /// A batch that has gathered so many strands hands them over.
-constexpr std::int64_t kStrandsOfBatch = 64;
+constexpr std::size_t kStrandsOfBatch = 64;
 /// So many steps for a strand wait for more.
 constexpr int kStepsHeld = 64;
+/// So many strands a thread takes at once, where there are more than that for each.
+constexpr std::size_t kStrandsInHand = 32;
+constexpr std::size_t kMostThreads =
+    std::max({ThreadPoolWorkQueues::kMostInteractiveThreads,
+              ThreadPoolWorkQueues::kMostUtilityThreads,
+              ThreadPoolWorkQueues::kMostBackgroundThreads});
 
 constexpr std::chrono::milliseconds kThreadRetry{100};
 constexpr std::chrono::seconds kLastWait{2};
@@ -56,6 +71,8 @@ thread_local const WorkQueue* currentQueue = nullptr;
 thread_local bool isPoolThread = false;
 
 }  // namespace
+
+thread_local ThreadPoolWorkQueues::Hand* ThreadPoolWorkQueues::ownHand_ = nullptr;
 
 /// What the pools have in common. Outlives the factory while a queue lives.
 struct ThreadPoolWorkQueues::Shared {
@@ -82,26 +99,10 @@ struct ThreadPoolWorkQueues::QueueKind {
   const bool isLow;
 };
 
-/// Strands one after the other, which it holds.
-class ThreadPoolWorkQueues::Line {
- public:
-  bool empty() const { return first_ == nullptr; }
-  void append(std::shared_ptr<Strand> strand);
-  void append(Line&& other);
-  /// None when it is empty.
-  std::shared_ptr<Strand> take();
-
- private:
-  std::shared_ptr<Strand> first_;
-  Strand* last_ = nullptr;  // Of any use only while there is a first.
-};
-
 /// Lines of strands on their way to a pool.
 struct ThreadPoolWorkQueues::Gathered {
   std::shared_ptr<Pool> pool;
-  Line line;
-  Line lowLine;
-  std::int64_t count = 0;
+  std::vector<std::shared_ptr<Strand>> strands;
 };
 
 /// The threads of one quality of service and the line of what waits for them.
@@ -116,8 +117,7 @@ class ThreadPoolWorkQueues::Pool : public std::enable_shared_from_this<Pool> {
   enum class Placed { kDropped, kQuiet, kWakes };
 
   Pool(const Kind& kind, std::shared_ptr<Shared> shared,
-       std::shared_ptr<TimerThread> timers)
-      : kind_(kind), shared_(std::move(shared)), timers_(std::move(timers)) {}
+       std::shared_ptr<TimerThread> timers);
 
   /// Puts a strand into line. After `kWakes` the caller calls `wakeOne`. The strand
   /// is not taken when it is dropped.
@@ -135,17 +135,21 @@ class ThreadPoolWorkQueues::Pool : public std::enable_shared_from_this<Pool> {
 
   void async(Task step);
 
-  bool othersWait() const { return waiting_.load(std::memory_order_relaxed) > 0; }
+  /// Whether other strands wait for the calling thread.
+  bool othersWait() const;
   std::size_t threadCount() const;
   /// Returns when every thread has run out of work.
   void end();
 
  private:
   bool hasEnded() const { return isEnding_ && liveThreads_ == 0; }
-  std::shared_ptr<Strand> takeStrand();
+  void append(std::shared_ptr<Strand>&& strand);
+  std::shared_ptr<Strand> takeStrand(Hand& hand);
+  bool isAnyInHand() const;
+  std::shared_ptr<Strand> takeOver(Hand& hand, bool onlyStuck);
   Placed callThread();
   void addThread();
-  void work();
+  void work(Hand& hand);
   void sleep(std::unique_lock<SmallMutex>& lock);
   /// True when the strand is in line again; else it is finished.
   bool runStrand(std::shared_ptr<Strand> strand);
@@ -155,8 +159,9 @@ class ThreadPoolWorkQueues::Pool : public std::enable_shared_from_this<Pool> {
   const std::shared_ptr<Shared> shared_;
   const std::shared_ptr<TimerThread> timers_;
 
-  std::atomic<std::int64_t> waiting_{0};  // In line. Written under the lock.
-  mutable SmallMutex mutex_;              // Of what follows.
+  std::atomic<std::int64_t> waiting_{0};      // In line. Written under the lock.
+  std::vector<std::unique_ptr<Hand>> hands_;  // One for each thread that there may be.
+  mutable SmallMutex mutex_;                  // Of what follows.
   Line line_;
   Line lowLine_;  // Of the queues with a priority below 0.
   std::deque<Task> loose_;
@@ -178,6 +183,7 @@ class ThreadPoolWorkQueues::Strand final : public WorkQueue,
  public:
   explicit Strand(std::shared_ptr<const QueueKind> kind) : kind_(std::move(kind)) {}
 
+  void setSubject(const Subject& subject) override { subject_ = &subject; }
   void async(Task task) override;
   bool tryEnter() override;
   void leave() override;
@@ -188,9 +194,17 @@ class ThreadPoolWorkQueues::Strand final : public WorkQueue,
 
   bool isLow() const { return kind_->isLow; }
 
-  void fetchAhead() const {
-    __builtin_prefetch(this, /*rw=*/1);
-    __builtin_prefetch(reinterpret_cast<const char*>(this + 1) - 1, /*rw=*/1);
+  void fetchAhead() const { fetchToWrite(this, sizeof *this); }
+  /// The same in stages, by who alone may run it: first itself, then what it will run and
+  /// the stages of its subject.
+  static constexpr int kStages = 1 + Subject::kStages;
+  void fetchAhead(int stage) {
+    if (stage == 0) {
+      fetchAhead();
+      return;
+    }
+    if (stage == 1 && !waiting_.empty()) waiting_.first().fetchAhead();
+    if (subject_ != nullptr) subject_->fetchAhead(stage - 1);
   }
 
   /// Runs steps on the calling thread. True when there are more and others wait
@@ -204,14 +218,13 @@ class ThreadPoolWorkQueues::Strand final : public WorkQueue,
   void drop();
 
  private:
-  friend class Line;
   friend class Batch;
 
   bool runSteps();
   static void place(std::shared_ptr<Strand> strand);
 
-  std::shared_ptr<Strand> next_;  // The line's.
   const std::shared_ptr<const QueueKind> kind_;
+  const Subject* subject_ = nullptr;
   SmallMutex mutex_;               // Of what follows but `suspendWasCalled_`.
   bool suspendWasCalled_ = false;  // The thread's that runs the strand.
   bool isPlaced_ = false;
@@ -223,29 +236,65 @@ class ThreadPoolWorkQueues::Strand final : public WorkQueue,
   StepList firsts_;  // Of `resume` while the strand runs; the last goes first.
 };
 
-void ThreadPoolWorkQueues::Line::append(std::shared_ptr<Strand> strand) {
-  Strand* const added = strand.get();
-  if (first_ == nullptr) {
-    first_ = std::move(strand);
-  } else {
-    last_->next_ = std::move(strand);
+/// Strands that one thread is to run next. Any thread may take them over.
+class alignas(64) ThreadPoolWorkQueues::Hand {
+ public:
+  /// While it is empty.
+  void fill(std::span<std::shared_ptr<Strand>> strands) {
+    const std::lock_guard lock(mutex_);
+    next_ = 0;
+    count_ = strands.size();
+    std::move(strands.begin(), strands.end(), strands_.begin());
+    isEmpty_.store(strands.empty(), std::memory_order_relaxed);
   }
-  last_ = added;
-}
 
-void ThreadPoolWorkQueues::Line::append(Line&& other) {
-  if (other.empty()) return;
-  Strand* const last = other.last_;
-  append(std::move(other.first_));
-  last_ = last;
-}
+  /// The thread's own. None when it is empty.
+  std::shared_ptr<Strand> take() {
+    turns_.store(turns_.load(std::memory_order_relaxed) + 1, std::memory_order_relaxed);
+    if (isEmpty()) return nullptr;
+    const std::lock_guard lock(mutex_);
+    if (next_ == count_) return nullptr;
+    std::shared_ptr<Strand> strand = std::move(strands_[next_++]);
+    if (next_ == count_) isEmpty_.store(true, std::memory_order_relaxed);
+    int stage = Strand::kStages;
+    for (std::size_t i = next_; i < count_ && stage > 0; ++i) {
+      strands_[i]->fetchAhead(--stage);
+    }
+    return strand;
+  }
 
-std::shared_ptr<ThreadPoolWorkQueues::Strand> ThreadPoolWorkQueues::Line::take() {
-  std::shared_ptr<Strand> strand = std::move(first_);
-  if (strand != nullptr) first_ = std::move(strand->next_);
-  // Who takes the next one needs it, and another thread wrote it last.
-  if (first_ != nullptr) first_->fetchAhead();
-  return strand;
+  /// Moves all to `strands`, which has room for `kStrandsInHand`. How many.
+  std::size_t takeAll(std::span<std::shared_ptr<Strand>> strands) {
+    const std::lock_guard lock(mutex_);
+    const std::size_t count = count_ - next_;
+    std::move(&strands_[next_], &strands_[count_], strands.begin());
+    next_ = count_;
+    isEmpty_.store(true, std::memory_order_relaxed);
+    return count;
+  }
+
+  bool isEmpty() const { return isEmpty_.load(std::memory_order_relaxed); }
+  /// Changes when the thread gets on to another strand.
+  std::uint32_t turns() const { return turns_.load(std::memory_order_relaxed); }
+
+  /// Those of other threads when this one last looked; the thread's own.
+  std::array<std::uint32_t, kMostThreads> seenTurns{};
+
+ private:
+  SmallMutex mutex_;
+  std::atomic<bool> isEmpty_{true};
+  std::atomic<std::uint32_t> turns_{0};
+  std::size_t next_ = 0;
+  std::size_t count_ = 0;
+  std::array<std::shared_ptr<Strand>, kStrandsInHand> strands_;
+};
+
+ThreadPoolWorkQueues::Pool::Pool(const Kind& kind, std::shared_ptr<Shared> shared,
+                                 std::shared_ptr<TimerThread> timers)
+    : kind_(kind), shared_(std::move(shared)), timers_(std::move(timers)) {
+  for (std::size_t i = 0; i < kind.mostThreads; ++i) {
+    hands_.push_back(std::make_unique<Hand>());
+  }
 }
 
 void ThreadPoolWorkQueues::Strand::async(Task task) {
@@ -408,32 +457,34 @@ ThreadPoolWorkQueues::Pool::Placed ThreadPoolWorkQueues::Pool::place(
   const std::lock_guard lock(mutex_);
   if (hasEnded()) return Placed::kDropped;
   shared_->begin(/*count=*/1);
-  Line& line = strand->isLow() ? lowLine_ : line_;
-  line.append(std::move(strand));
-  waiting_.fetch_add(1, std::memory_order_relaxed);
+  append(std::move(strand));
   return callThread();
+}
+
+void ThreadPoolWorkQueues::Pool::append(std::shared_ptr<Strand>&& strand) {
+  (strand->isLow() ? lowLine_ : line_).push_back(std::move(strand));
+  waiting_.fetch_add(1, std::memory_order_relaxed);
 }
 
 void ThreadPoolWorkQueues::Pool::place(Gathered& gathered) {
   std::size_t wakes = 0;
+  // Ends of steps may gather anew.
+  std::vector<std::shared_ptr<Strand>> strands;
+  strands.swap(gathered.strands);
   {
     const std::lock_guard lock(mutex_);
     if (!hasEnded()) {
-      shared_->begin(gathered.count);
-      line_.append(std::move(gathered.line));
-      lowLine_.append(std::move(gathered.lowLine));
-      waiting_.fetch_add(gathered.count, std::memory_order_relaxed);
-      const auto most = static_cast<std::int64_t>(kind_.mostThreads);
-      for (auto threads = std::min(gathered.count, most); threads != 0; --threads) {
+      shared_->begin(static_cast<std::int64_t>(strands.size()));
+      for (auto threads = std::min(strands.size(), kind_.mostThreads); threads != 0;
+           --threads) {
         if (callThread() == Placed::kWakes) ++wakes;
       }
+      for (auto& strand : strands) append(std::move(strand));
+      strands.clear();
     }
   }
-  // What is left has nobody to run it. Ends of steps may gather anew.
-  gathered.count = 0;
-  Line dropped = std::move(gathered.line);
-  dropped.append(std::move(gathered.lowLine));
-  while (const auto strand = dropped.take()) strand->drop();
+  // What is left has nobody to run it.
+  for (const auto& strand : strands) strand->drop();
   for (; wakes != 0; --wakes) wakeOne();
 }
 
@@ -470,8 +521,9 @@ ThreadPoolWorkQueues::Pool::Placed ThreadPoolWorkQueues::Pool::callThread() {
 void ThreadPoolWorkQueues::Pool::addThread() {
   const std::string name = kind_.name + std::to_string(threads_.size() + 1);
   try {
-    threads_.push_back(
-        startThread(name, kind_.niceness, [self = shared_from_this()] { self->work(); }));
+    Hand& hand = *hands_[threads_.size()];
+    threads_.push_back(startThread(
+        name, kind_.niceness, [self = shared_from_this(), &hand] { self->work(hand); }));
     ++liveThreads_;
   } catch (const std::system_error&) {
     // The threads that there are go on. Without any, another try comes later.
@@ -485,33 +537,87 @@ void ThreadPoolWorkQueues::Pool::addThread() {
   }
 }
 
-std::shared_ptr<ThreadPoolWorkQueues::Strand> ThreadPoolWorkQueues::Pool::takeStrand() {
-  std::shared_ptr<Strand> strand = (line_.empty() ? lowLine_ : line_).take();
-  if (strand != nullptr) waiting_.fetch_sub(1, std::memory_order_relaxed);
+bool ThreadPoolWorkQueues::Pool::othersWait() const {
+  return waiting_.load(std::memory_order_relaxed) > 0 ||
+         (ownHand_ != nullptr && !ownHand_->isEmpty());
+}
+
+// With the lock. The others that the thread takes with the first are in its hand.
+std::shared_ptr<ThreadPoolWorkQueues::Strand> ThreadPoolWorkQueues::Pool::takeStrand(
+    Hand& hand) {
+  Line& line = line_.empty() ? lowLine_ : line_;
+  if (line.empty()) return nullptr;
+  std::shared_ptr<Strand> strand = std::move(line.front());
+  line.pop_front();
+  // Of those of low priority others might have to go first soon.
+  const std::size_t others =
+      std::min(line_.size() / (2 * kind_.mostThreads), kStrandsInHand);
+  if (others != 0) {
+    std::array<std::shared_ptr<Strand>, kStrandsInHand> taken;
+    for (std::size_t i = 0; i < others; ++i) {
+      taken[i] = std::move(line_.front());
+      line_.pop_front();
+    }
+    hand.fill({taken.data(), others});
+  }
+  waiting_.fetch_sub(static_cast<std::int64_t>(1 + others), std::memory_order_relaxed);
   return strand;
 }
 
-void ThreadPoolWorkQueues::Pool::work() {
+bool ThreadPoolWorkQueues::Pool::isAnyInHand() const {
+  return std::any_of(hands_.begin(), hands_.end(),
+                     [](const auto& hand) { return !hand->isEmpty(); });
+}
+
+// Without the lock. What another thread has in its hand comes into this one's, but for
+// the first; `onlyStuck`: of a thread that has got no further since the last call.
+std::shared_ptr<ThreadPoolWorkQueues::Strand> ThreadPoolWorkQueues::Pool::takeOver(
+    Hand& hand, bool onlyStuck) {
+  for (std::size_t i = 0; i < hands_.size(); ++i) {
+    Hand& other = *hands_[i];
+    if (&other == &hand || other.isEmpty()) continue;
+    const std::uint32_t turns = other.turns();
+    if (std::exchange(hand.seenTurns[i], turns) != turns && onlyStuck) continue;
+    std::array<std::shared_ptr<Strand>, kStrandsInHand> taken;
+    const std::size_t count = other.takeAll(taken);
+    if (count == 0) continue;
+    hand.fill({&taken[1], count - 1});
+    return std::move(taken[0]);
+  }
+  return nullptr;
+}
+
+void ThreadPoolWorkQueues::Pool::work(Hand& hand) {
   isPoolThread = true;
+  ownHand_ = &hand;
   std::int64_t finished = 0;
   bool isLooseNext = false;  // Strands and loose steps take turns.
-  std::unique_lock lock(mutex_);
+  const auto run = [&](std::shared_ptr<Strand> strand) {
+    if (!runStrand(std::move(strand))) ++finished;
+  };
   for (;;) {
+    while (auto strand = hand.take()) run(std::move(strand));
+    if (auto strand = takeOver(hand, /*onlyStuck=*/true)) {
+      run(std::move(strand));
+      continue;
+    }
+    std::unique_lock lock(mutex_);
     isLooseNext = !isLooseNext;
     if (!loose_.empty() && isLooseNext) {
       runLoose(lock);
       ++finished;
-    } else if (auto strand = takeStrand()) {
+    } else if (auto strand = takeStrand(hand)) {
       lock.unlock();
-      if (!runStrand(std::move(strand))) ++finished;
-      lock.lock();
+      run(std::move(strand));
     } else if (!loose_.empty()) {
       runLoose(lock);
       ++finished;
+    } else if (isAnyInHand()) {
+      lock.unlock();
+      if (auto other = takeOver(hand, /*onlyStuck=*/false)) run(std::move(other));
     } else if (finished != 0) {
       lock.unlock();
       shared_->finish(std::exchange(finished, 0));
-      lock.lock();
     } else if (isEnding_) {
       --liveThreads_;
       return;
@@ -549,9 +655,7 @@ void ThreadPoolWorkQueues::Pool::wakeOne() {
 bool ThreadPoolWorkQueues::Pool::runStrand(std::shared_ptr<Strand> strand) {
   if (!strand->runTurn()) return false;  // With the reference perhaps its end.
   const std::lock_guard lock(mutex_);
-  Line& line = strand->isLow() ? lowLine_ : line_;
-  line.append(std::move(strand));
-  waiting_.fetch_add(1, std::memory_order_relaxed);
+  append(std::move(strand));
   return true;
 }
 
@@ -661,14 +765,13 @@ void ThreadPoolWorkQueues::Batch::gather(std::shared_ptr<Strand> strand) {
                            ? **found
                            : *gathered_.emplace_back(std::make_unique<Gathered>());
   if (gathered.pool == nullptr) gathered.pool = pool;
-  if (gathered.count == 0) pool->shared().begin(/*count=*/1);
-  Line& line = strand->isLow() ? gathered.lowLine : gathered.line;
-  line.append(std::move(strand));
-  if (++gathered.count == kStrandsOfBatch) handOver(gathered);
+  if (gathered.strands.empty()) pool->shared().begin(/*count=*/1);
+  gathered.strands.push_back(std::move(strand));
+  if (gathered.strands.size() == kStrandsOfBatch) handOver(gathered);
 }
 
 void ThreadPoolWorkQueues::Batch::handOver(Gathered& gathered) {
-  if (gathered.count == 0) return;
+  if (gathered.strands.empty()) return;
   gathered.pool->place(gathered);
   gathered.pool->shared().finish(/*count=*/1);
 }

@@ -3,6 +3,7 @@
 #include <array>
 #include <chrono>
 #include <cstddef>
+#include <deque>
 #include <memory>
 #include <mutex>
 #include <utility>
@@ -61,11 +62,13 @@ class ThreadPoolWorkQueues final : public WorkQueueFactory {
   struct QueueKind;
   struct Gathered;
   class Background;
-  class Line;
+  class Hand;
   class Pool;
   class Strand;
+  using Line = std::deque<std::shared_ptr<Strand>>;
 
   static thread_local Batch* currentBatch_;
+  static thread_local Hand* ownHand_;
 
   const std::shared_ptr<Shared> shared_;
   const std::array<std::shared_ptr<Pool>, 3> pools_;  // By quality of service.

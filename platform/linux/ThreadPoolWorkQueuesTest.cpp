@@ -656,6 +656,76 @@ long sleepsOfThisThread() {
   return -1;
 }
 
+// A thread takes several queues from a long line at once. None of them waits for the
+// first of these as long as there is another thread.
+TEST_F(ThreadPoolWorkQueuesTest, TakesOverWhatAThreadThatIsHeldUpTookAhead) {
+  constexpr int kOthers = 200;
+  Gate gate;
+  std::vector<std::shared_ptr<WorkQueue>> all;
+  for (std::size_t i = 0; i < ThreadPoolWorkQueues::kMostUtilityThreads; ++i) {
+    all.push_back(makeQueue());
+    all.back()->async(gate.holdingStep());
+    gate.waitUntilHolding();
+  }
+  std::atomic<int> count{0};
+  std::binary_semaphore othersRan{0};
+  std::atomic<bool> wasInTime{false};
+  all.push_back(makeQueue());
+  all.back()->async(
+      [&] { wasInTime = othersRan.try_acquire_for(std::chrono::seconds(20)); });
+  for (int i = 0; i < kOthers; ++i) {
+    all.push_back(makeQueue());
+    all.back()->async([&] {
+      if (++count == kOthers) othersRan.release();
+    });
+  }
+  for (std::size_t i = 0; i < ThreadPoolWorkQueues::kMostUtilityThreads; ++i) gate.open();
+
+  ASSERT_TRUE(drain());
+  EXPECT_TRUE(wasInTime);
+}
+
+// As long as more and more comes, too.
+TEST_F(ThreadPoolWorkQueuesTest, TakesOverWhatIsHeldUpThoughTheLineIsNeverEmpty) {
+  constexpr int kOthers = 200;
+  Gate gate;
+  std::vector<std::shared_ptr<WorkQueue>> all;
+  for (std::size_t i = 0; i < ThreadPoolWorkQueues::kMostUtilityThreads; ++i) {
+    all.push_back(makeQueue());
+    all.back()->async(gate.holdingStep());
+    gate.waitUntilHolding();
+  }
+  std::atomic<int> count{0};
+  std::binary_semaphore othersRan{0};
+  std::atomic<bool> wasInTime{false};
+  std::atomic<bool> isOver{false};
+  all.push_back(makeQueue());
+  all.back()->async([&] {
+    wasInTime = othersRan.try_acquire_for(std::chrono::seconds(20));
+    isOver = true;
+  });
+  for (int i = 0; i < kOthers; ++i) {
+    all.push_back(makeQueue());
+    all.back()->async([&] {
+      if (++count == kOthers) othersRan.release();
+    });
+  }
+  // Queues that never have enough.
+  std::function<void(WorkQueue&)> goOn = [&](WorkQueue& queue) {
+    queue.async([&] {
+      if (!isOver) goOn(queue);
+    });
+  };
+  for (int i = 0; i < kOthers; ++i) {
+    all.push_back(makeQueue());
+    goOn(*all.back());
+  }
+  for (std::size_t i = 0; i < ThreadPoolWorkQueues::kMostUtilityThreads; ++i) gate.open();
+
+  ASSERT_TRUE(drain());
+  EXPECT_TRUE(wasInTime);
+}
+
 TEST_F(ThreadPoolWorkQueuesTest, WakesNobodyForStepsOfAQueueThatRunsAlready) {
   Gate gate;
   const auto queue = makeQueue();
