@@ -47,6 +47,12 @@ class KeptBytes {
     account->discard(bytes);
   }
 
+  /// The least that is taken from an account, as long as that has it.
+  static constexpr std::size_t kUnit = 1024;
+  static constexpr std::size_t inUnits(std::size_t bytes) {
+    return (bytes + kUnit - 1) / kUnit * kUnit;
+  }
+
  private:
   struct Sum {
     std::size_t used = 0;
@@ -54,9 +60,8 @@ class KeptBytes {
   };
   using Sums = std::unordered_map<std::shared_ptr<PayloadAccount>, Sum>;
 
-  // A long list takes a little ahead: the account is one for all threads, and asking it
-  // for each entry costs 40 ns. What is ahead is at most a 64th of what is used.
-  static constexpr std::size_t kLongList = 64 * 1024;
+  // A list takes a little ahead, a 64th of what it uses, in whole units: the account is
+  // one for all threads, and asking it for each entry costs 40 ns.
   static constexpr std::size_t kShareAhead = 64;
   static constexpr std::size_t kMostAhead = 64 * 1024;
 
@@ -68,8 +73,9 @@ class KeptBytes {
 
   static bool takeMore(PayloadAccount& account, Sum& sum, std::size_t bytes) {
     const std::size_t missing = bytes - (sum.taken - sum.used);
-    const std::size_t ahead =
-        sum.used < kLongList ? 0 : std::min(sum.used / kShareAhead, kMostAhead);
+    const std::size_t wanted =
+        sum.taken + missing + std::min(sum.used / kShareAhead, kMostAhead);
+    const std::size_t ahead = inUnits(wanted) - (sum.taken + missing);
     if (account.keep(missing + ahead)) {
       sum.taken += missing + ahead;
       return true;

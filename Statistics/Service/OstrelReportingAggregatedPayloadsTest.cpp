@@ -8,6 +8,7 @@
 #include <vector>
 
 #include "Statistics/CoreTestFixture.h"
+#include "platform/KeptBytes.h"
 #include "platform/fake/CountingAccount.h"
 
 namespace ostrel {
@@ -204,12 +205,12 @@ TEST_F(OstrelReportingAggregatedPayloadsTest, ChargesTheClientForWhatItKeeps) {
     const Dictionary small{{"a", 1}};
     list.append("id", chargedTo(client, small));
     const std::size_t entry = 1 + 3 + small.value().bytes().size();
-    EXPECT_EQ(client->kept(), entry);
+    EXPECT_EQ(client->kept(), KeptBytes::inUnits(entry));
     const Dictionary large = payloadOf(100'000);
     list.append("id", chargedTo(client, large));  // Copied: it is the client's.
-    EXPECT_EQ(client->kept(), entry + 1 + 3 + 100'000);
+    EXPECT_EQ(client->kept(), KeptBytes::inUnits(entry + 1 + 3 + 100'000));
     list.append("id", small);
-    EXPECT_EQ(client->kept(), entry + 1 + 3 + 100'000);
+    EXPECT_EQ(client->kept(), KeptBytes::inUnits(entry + 1 + 3 + 100'000));
     EXPECT_EQ(list.size(), 3u);
   }
   EXPECT_EQ(client->kept(), 0u);

@@ -2,6 +2,7 @@
 #include <thread>
 
 #include "platform/Bytes.h"
+#include "platform/KeptBytes.h"
 #include "platform/fake/CountingAccount.h"
 #include "platform/fake/FakeEntryStorage.h"
 #include "platform/linux/FileEntryStorage.h"
@@ -154,8 +155,8 @@ TYPED_TEST(EntryStorageContract, GivesEachAccountItsBytesBackAtTheEndOfTheList) 
     append(*entries, std::string(30, 'a'), first);
     append(*entries, std::string(50, 'b'), second);
   }
-  EXPECT_EQ(first->kept(), 300u);
-  EXPECT_EQ(second->kept(), 500u);
+  EXPECT_EQ(first->kept(), KeptBytes::inUnits(300));
+  EXPECT_EQ(second->kept(), KeptBytes::inUnits(500));
   entries.reset();
   EXPECT_EQ(first->kept(), 0u);
   EXPECT_EQ(second->kept(), 0u);

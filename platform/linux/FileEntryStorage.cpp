@@ -4,7 +4,8 @@
 // and again. So the file has a list's entries in large pieces, of which a reader has
 // one in memory at a time, and what is in the chunks always comes after what is in
 // the file. An entry lies in one chunk, or in one extent of its own, and is never
-// split.
+// split. Where the memory of all lists is used up, a short list has no chunk: each of its
+// entries is an extent.
 //
 // A snapshot copies the places, not the entries. Chunks are never written before
 // their `used`, and not used again once a snapshot has seen them; extents are
@@ -28,6 +29,10 @@ namespace {
 // wastes little at the end of its last.
 constexpr std::size_t kFirstChunk = 1024;
 constexpr std::size_t kLargestChunk = 128 * 1024;
+
+// A list is short as long as to know where its entries are takes no more than a chunk.
+constexpr std::size_t kExtentsOfShortList = kFirstChunk / sizeof(SpillFile::Extent);
+constexpr std::size_t kFirstExtents = 16;
 
 // What readers have in memory, but for an entry that is larger alone.
 constexpr std::size_t kLargestExtent = 2 * kLargestChunk;
@@ -70,7 +75,9 @@ class FileEntryStorage::Memory {
 /// A list's part of the file.
 class FileEntryStorage::Spilled {
  public:
-  explicit Spilled(std::shared_ptr<State> state) : state_(std::move(state)) {}
+  explicit Spilled(std::shared_ptr<State> state) : state_(std::move(state)) {
+    extents_.reserve(kFirstExtents);
+  }
   Spilled(const Spilled&) = delete;
   Spilled& operator=(const Spilled&) = delete;
   ~Spilled() { state_->file.release(extents_); }
@@ -190,13 +197,22 @@ class FileEntryStorage::Entries final : public StoredEntries {
   }
 
   Placed findRoom(std::span<const Bytes> parts, std::size_t size) {
+    if (addChunk(size, Share::kOfList)) return Placed::kThere;
+    if (isShort() && writeToFile(parts)) return Placed::kInFile;
     if (makeRoom(size)) return Placed::kThere;
     if (isMemoryEmpty() && writeToFile(parts)) return Placed::kInFile;
     return addChunk(size, Share::kOfAll) ? Placed::kThere : Placed::kNowhere;
   }
 
+  // Where memory is short, a short list takes none: its entries go into the file's group
+  // at once, which is at hand, and not first into a chunk of its own, which is far away
+  // among those of a hundred thousand lists.
+  bool isShort() const {
+    return chunks_.empty() &&
+           (!spilled_ || spilled_->extents().size() < kExtentsOfShortList);
+  }
+
   bool makeRoom(std::size_t bytes) {
-    if (addChunk(bytes, Share::kOfList)) return true;
     if (!spill()) return false;
     if (chunks_.empty() && bytes <= kLargestChunk) beginChunk();
     return hasRoom(bytes);
@@ -224,7 +240,10 @@ class FileEntryStorage::Entries final : public StoredEntries {
         chunks_.empty() ? kFirstChunk
                         : std::min(2 * chunks_.back().memory->size(), kLargestChunk);
     const std::size_t size = std::max(wanted, bytes);
-    return taken + size <= state_->limits.listBytesInMemory && takeChunk(size);
+    if (taken + size > state_->limits.listBytesInMemory) return false;
+    if (!state_->memory.take(size)) return false;
+    pushChunk(size);
+    return true;
   }
 
   bool takeChunk(std::size_t size) {
@@ -234,8 +253,12 @@ class FileEntryStorage::Entries final : public StoredEntries {
     } else if (!state_->memory.take(size)) {
       return false;
     }
-    chunks_.push_back({std::make_shared<Memory>(state_, size)});
+    pushChunk(size);
     return true;
+  }
+
+  void pushChunk(std::size_t size) {
+    chunks_.push_back({std::make_shared<Memory>(state_, size)});
   }
 
   // Moves everything from memory to the file. False: that cannot be written, and

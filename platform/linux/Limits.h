@@ -212,8 +212,9 @@ inline constexpr std::chrono::seconds kMisuseLogInterval{60};
 inline constexpr std::size_t kListBytesInMemory = 256 * 1024;
 
 /// The same of all sessions together: some dozens of long ones at a time, and a small
-/// part of what the service may have. Each session begins with 1 KiB whatever the others
-/// have. [FileEntryStorageTest.RefusesWhatFitsNeitherDiskNorMemory]
+/// part of what the service may have. Beyond it short lists are in the file alone, and
+/// each longer one has 1 KiB whatever the others have.
+/// [FileEntryStorageTest.RefusesWhatFitsNeitherDiskNorMemory]
 inline constexpr std::size_t kListsBytesInMemory = 12 * 1024 * 1024;
 
 /// Of that, what waits for more of other sessions so that it is written to the file

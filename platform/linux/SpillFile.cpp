@@ -15,6 +15,7 @@
 
 #include <algorithm>
 #include <array>
+#include <atomic>
 #include <cerrno>
 #include <utility>
 #include <vector>
@@ -28,35 +29,6 @@ constexpr std::uint64_t kPage = 4096;
 constexpr mode_t kFileMode = 0600;
 
 std::uint64_t roomOf(std::size_t size) { return (size + kPage - 1) / kPage * kPage; }
-
-// The places in the file that nothing is in any more. Neighbours make one hole.
-class Holes {
- public:
-  explicit Holes(int file) : file_(file) {}
-  Holes(const Holes&) = delete;
-  Holes& operator=(const Holes&) = delete;
-  ~Holes() { punch(); }
-
-  void add(std::uint64_t begin, std::uint64_t size) {
-    if (begin != end_) {
-      punch();
-      begin_ = begin;
-    }
-    end_ = begin + size;
-  }
-
- private:
-  void punch() const {
-    if (begin_ == end_) return;
-    // Where there are no holes, the room comes back with the file.
-    ::fallocate(file_, FALLOC_FL_PUNCH_HOLE | FALLOC_FL_KEEP_SIZE,
-                static_cast<off_t>(begin_), static_cast<off_t>(end_ - begin_));
-  }
-
-  const int file_;
-  std::uint64_t begin_ = 0;
-  std::uint64_t end_ = 0;
-};
 
 // 0, or the error.
 int writeAll(int file, std::span<iovec> parts, std::uint64_t begin,
@@ -90,23 +62,58 @@ SpillCalls SpillCalls::system() {
       ::mkostemp, ::pwritev, ::pread};
 }
 
-/// Pieces that are written together.
-struct SpillFile::Group {
+/// The places in the file that nothing is in any more. Neighbours make one hole.
+class SpillFile::Holes {
+ public:
+  void add(std::uint64_t begin, std::uint64_t size) {
+    if (holes_.empty() || begin != holes_.back().end) holes_.push_back({begin, begin});
+    holes_.back().end = begin + size;
+  }
+  bool empty() const { return holes_.empty(); }
+
+  // Where the file system knows no holes, the room comes back with the file.
+  void punch(int file) const {
+    for (const Hole& hole : holes_) {
+      ::fallocate(file, FALLOC_FL_PUNCH_HOLE | FALLOC_FL_KEEP_SIZE,
+                  static_cast<off_t>(hole.begin),
+                  static_cast<off_t>(hole.end - hole.begin));
+    }
+  }
+
+ private:
+  struct Hole {
+    std::uint64_t begin;
+    std::uint64_t end;
+  };
+  std::vector<Hole> holes_;
+};
+
+/// Pieces that are written together. What a piece changes is one line of the cache.
+struct alignas(64) SpillFile::Group {
   explicit Group(std::uint64_t at) : begin(at), bytes(new std::uint8_t[kGroupBytes]) {}
 
   bool hasRoom(std::size_t size) const { return kGroupBytes - used >= size; }
 
-  Extent add(std::span<const Bytes> parts, std::size_t size) {
-    std::uint8_t* at = bytes.get() + used;
-    for (const Bytes part : parts) at = std::copy(part.begin(), part.end(), at);
+  /// A place for a piece that `fill` is called for next, by the same thread.
+  Extent add(std::size_t size) {
     const Extent extent{begin + used, size};
-    used += size;
+    used += static_cast<std::uint32_t>(size);
     ++extents;
     for (std::size_t page = pageOf(extent.begin); page <= lastPageOf(extent); ++page) {
       ++extentsOfPage[page];
     }
+    unfilled.fetch_add(1, std::memory_order_relaxed);
     return extent;
   }
+
+  /// Without the lock: the piece comes from memory that nobody has looked at lately, and
+  /// threads that waited for that slept at the lock, 150 ns a message.
+  void fill(const Extent& extent, std::span<const Bytes> parts) {
+    std::uint8_t* at = bytes.get() + (extent.begin - begin);
+    for (const Bytes part : parts) at = std::copy(part.begin(), part.end(), at);
+    unfilled.fetch_sub(1, std::memory_order_release);
+  }
+  bool isFilled() const { return unfilled.load(std::memory_order_acquire) == 0; }
 
   /// Pages that are free by it are added to `holes` if the group is in the file.
   void release(Extent extent, Holes& holes) {
@@ -127,8 +134,9 @@ struct SpillFile::Group {
 
   const std::uint64_t begin;
   std::unique_ptr<std::uint8_t[]> bytes;  // None once they are in the file.
-  std::size_t used = 0;
-  std::size_t extents = 0;
+  std::uint32_t used = 0;
+  std::uint32_t extents = 0;
+  std::atomic<std::uint32_t> unfilled{0};  // Places whose pieces are still copied.
   bool isBeingWritten = false;
 
  private:
@@ -164,18 +172,20 @@ std::optional<SpillFile::Extent> SpillFile::gather(std::span<const Bytes> parts,
   for (;;) {
     if (!isReady()) return std::nullopt;
     const bool hasRoom = !filling_ || filling_->hasRoom(size);
-    const bool isWriting = full_ && full_->isBeingWritten;
-    if (isWriting && !hasRoom) break;
-    if (!isWriting) {
-      if (!hasRoom && !full_) full_ = std::move(filling_);
-      if (full_) {
-        if (!writeFullGroup(lock)) return std::nullopt;
-        continue;
-      }
+    if (!hasRoom && !full_) full_ = std::move(filling_);
+    const bool mustWait = full_ && (full_->isBeingWritten || !full_->isFilled());
+    if (mustWait && filling_ && !hasRoom) break;
+    if (full_ && !mustWait) {
+      if (!writeFullGroup(lock)) return std::nullopt;
+      continue;
     }
     if (!filling_) filling_ = beginGroup();
     ++extents_;
-    return filling_->add(parts, size);
+    Group* const group = filling_.get();
+    const Extent extent = group->add(size);
+    lock.unlock();
+    group->fill(extent, parts);
+    return extent;
   }
   // Nobody waits for the disk because of what others write.
   lock.unlock();
@@ -241,8 +251,8 @@ std::shared_ptr<SpillFile::Group> SpillFile::beginGroup() {
   return group;
 }
 
-// Lets the lock go meanwhile. False: it cannot be written, and stays.
-bool SpillFile::writeFullGroup(std::unique_lock<std::mutex>& lock) {
+// Lets the lock go meanwhile, and takes it again. False: it cannot be written, and stays.
+bool SpillFile::writeFullGroup(std::unique_lock<SmallMutex>& lock) {
   const std::shared_ptr<Group> group = full_;
   group->isBeingWritten = true;
   ++extents_;  // The file stays.
@@ -252,15 +262,17 @@ bool SpillFile::writeFullGroup(std::unique_lock<std::mutex>& lock) {
   const int error = writeAll(file, {&bytes, 1}, group->begin, calls_);
   lock.lock();
   group->isBeingWritten = false;
+  Holes holes;
   if (error != 0) {
     fail(error);
   } else {
     full_.reset();
-    Holes holes(file);
     group->becameWritten(holes);
   }
   dropIfUnused(group);
-  const FileDescriptor last = dropExtents(1);
+  lock.unlock();
+  leave(holes, /*extents=*/1);
+  lock.lock();
   return error == 0;
 }
 
@@ -315,22 +327,33 @@ std::optional<ErrorObject> SpillFile::read(Extent extent, std::uint8_t* to) {
 
 void SpillFile::release(std::span<const Extent> extents) {
   if (extents.empty()) return;
-  FileDescriptor last;  // Closed without the lock: a large file takes its time.
-  const std::lock_guard lock(mutex_);
-  if (extents.size() == extents_) {
-    last = dropExtents(extents.size());
-    return;
-  }
-  Holes holes(file_.get());
-  for (const Extent extent : extents) {
-    if (const auto group = groupOf(extent)) {
-      group->release(extent, holes);
-      dropIfUnused(group);
-    } else {
-      holes.add(extent.begin, roomOf(extent.size));
+  Holes holes;
+  {
+    FileDescriptor last;  // Closed without the lock: a large file takes its time.
+    const std::lock_guard lock(mutex_);
+    if (extents.size() == extents_) {
+      last = dropExtents(extents.size());
+      return;
+    }
+    for (const Extent extent : extents) {
+      if (const auto group = groupOf(extent)) {
+        group->release(extent, holes);
+        dropIfUnused(group);
+      } else {
+        holes.add(extent.begin, roomOf(extent.size));
+      }
     }
   }
-  dropExtents(extents.size());
+  leave(holes, extents.size());
+}
+
+// The extents, which kept the file open until now, are none any more. Without the lock,
+// as holes take their time too.
+void SpillFile::leave(const Holes& holes, std::size_t extents) {
+  if (!holes.empty()) holes.punch(file_.get());
+  FileDescriptor last;
+  const std::lock_guard lock(mutex_);
+  last = dropExtents(extents);
 }
 
 std::optional<ErrorObject> SpillFile::latestError() const {

@@ -14,6 +14,7 @@
 #include <unordered_map>
 
 #include "platform/ErrorObject.h"
+#include "platform/SmallMutex.h"
 #include "platform/linux/FileDescriptor.h"
 
 namespace ostrel {
@@ -78,15 +79,17 @@ class SpillFile {
 
  private:
   struct Group;
+  class Holes;
 
   std::optional<Extent> gather(std::span<const Bytes> parts, std::size_t size);
   std::optional<Extent> writeAlone(std::span<const Bytes> parts, std::size_t size);
+  void leave(const Holes& holes, std::size_t extents);
 
   // With the lock.
   bool isReady();
   int openFile();
   std::shared_ptr<Group> beginGroup();
-  bool writeFullGroup(std::unique_lock<std::mutex>& lock);
+  bool writeFullGroup(std::unique_lock<SmallMutex>& lock);
   std::shared_ptr<Group> groupOf(Extent extent) const;
   void dropIfUnused(const std::shared_ptr<Group>& group);
   FileDescriptor dropExtents(std::size_t count);
@@ -97,16 +100,18 @@ class SpillFile {
   const bool isGathering_;
   const SpillCalls calls_;
 
-  mutable std::mutex mutex_;
+  // What each piece needs, on one line of the cache: several threads write them in turn.
+  alignas(64) mutable SmallMutex mutex_;
   // Guarded by `mutex_`. The descriptor stays the same while there are extents.
   FileDescriptor file_;
-  std::uint64_t end_ = 0;
-  std::size_t extents_ = 0;
-  std::unordered_map<std::uint64_t, std::shared_ptr<Group>> groups_;  // By their place.
-  std::shared_ptr<Group> filling_;                                    // May be none.
-  std::shared_ptr<Group> full_;  // Until it is written. May be none.
   int error_ = 0;
+  std::size_t extents_ = 0;
+  std::shared_ptr<Group> filling_;  // May be none.
+  std::shared_ptr<Group> full_;     // Until it is written. May be none.
+
   std::chrono::steady_clock::time_point retryAt_;
+  std::uint64_t end_ = 0;
+  std::unordered_map<std::uint64_t, std::shared_ptr<Group>> groups_;  // By their place.
 };
 
 }  // namespace ostrel

@@ -17,7 +17,9 @@ namespace ostrel {
 /// What all users of the service may have together.
 struct ServiceAccount {
   Share sessions;
-  Share keptBytes;
+  // Sessions' threads write it, and the thread that reads looks at `sessions` with each
+  // request.
+  alignas(64) Share keptBytes;
 };
 
 /// Bears the user infos of sessions, which live as long as these. Any thread.
@@ -168,10 +170,10 @@ class UserAccount {
   std::atomic<std::size_t> halfFrameBytes_{0};
   const std::shared_ptr<UserInfos> userInfos_;
   const std::shared_ptr<ServiceAccount> service_;
-  // On a line of the cache of their own: sessions' threads write them, and the thread
-  // that reads looks at the others with each message.
-  alignas(64) Share sessions_;
-  Share keptBytes_;
+  Share sessions_;
+  // On a line of the cache of its own: sessions' threads write it, and the thread that
+  // reads looks at the others with each message.
+  alignas(64) Share keptBytes_;
 };
 
 }  // namespace ostrel
