@@ -454,6 +454,7 @@ void OstrelReportingServerInstance::sendMessage(Dictionary message,
   // taken out again at once, takes 50 ns a message.
   if (queue.tryEnter()) {
     assertOnServerQueue();
+    fetchAhead();
     sendMessageStep(std::move(message), category, type, reportingIDs, reply);
     queue.leave();
     return;
@@ -464,6 +465,25 @@ void OstrelReportingServerInstance::sendMessage(Dictionary message,
     assertOnServerQueue();
     self->sendMessageStep(std::move(message), category, type, reportingIDs, reply);
   });
+}
+
+void OstrelReportingServerInstance::expectMessage(ReporterID reporterID) {
+  expected_ = {expected_[1], expected_[2], reporterID};
+}
+
+// Of many sessions each is far away in memory: its place in the index, the session and
+// its queue one after the other, each of them found through the one before. Each message
+// asks for one of these for three others (150 ns a message with 100,000 sessions).
+void OstrelReportingServerInstance::fetchAhead() {
+  const auto [next, second, third] = expected_;
+  const OstrelReportingSessionIndex& index = master_->sessionIndex_;
+  if (next != kNoReporter) {
+    if (const auto* const session = index.find(next)) session->fetchQueueAhead();
+  }
+  if (second != kNoReporter) {
+    if (const auto* const session = index.find(second)) session->fetchSelfAhead();
+  }
+  if (third != kNoReporter) index.fetchAhead(third);
 }
 
 void OstrelReportingServerInstance::sendMessageStep(

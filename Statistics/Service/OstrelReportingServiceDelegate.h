@@ -1,5 +1,6 @@
 #pragma once
 
+#include <array>
 #include <atomic>
 #include <cstdint>
 #include <memory>
@@ -146,6 +147,7 @@ class OstrelReportingServerInstance final
   void startReportingSessionForID(ReporterID reporterID, BoolReply reply) override;
   void sendMessage(Dictionary message, MessageCategory category, MessageType type,
                    std::optional<ReporterIDs> reportingIDs, ErrorReply reply) override;
+  void expectMessage(ReporterID reporterID) override;
   void stopReportingSessionForID(ReporterID reporterID, BoolReply reply) override;
   void destroyReportingSession(ReporterID reporterID, BoolReply reply) override;
   void reporterIDValid(ReporterID reporterID, DictionaryReply reply) override;
@@ -196,6 +198,7 @@ class OstrelReportingServerInstance final
   void sendMessageStep(Dictionary message, MessageCategory category, MessageType type,
                        const std::optional<ReporterIDs>& reportingIDs,
                        const ErrorReply& reply) OSTREL_ON_QUEUE(serverQueueRole);
+  void fetchAhead() OSTREL_ON_QUEUE(serverQueueRole);
   void sendToActiveSessions(const Dictionary& message, MessageCategory category,
                             MessageType type) OSTREL_ON_QUEUE(serverQueueRole);
   void stopStep(ReporterID reporterID, const BoolReply& reply)
@@ -228,6 +231,10 @@ class OstrelReportingServerInstance final
   mutable std::vector<Entry> latestEntries_ OSTREL_GUARDED_BY(serverQueueRole);
   mutable bool isOrderKnown_ OSTREL_GUARDED_BY(serverQueueRole) = false;
   std::uint64_t registration_ OSTREL_GUARDED_BY(serverQueueRole) = 0;
+
+  // The thread's that sends messages: the sessions of the next ones, 0 for those of which
+  // nothing is to be fetched any more.
+  std::array<ReporterID, 3> expected_{};
 
   // Shared, each with its own lock.
   AtomicProperty<std::optional<Date>> clientStartDate_;

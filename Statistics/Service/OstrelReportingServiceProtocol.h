@@ -49,6 +49,11 @@ class OstrelReportingServiceProtocol {
   virtual void sendMessage(Dictionary message, MessageCategory category, MessageType type,
                            std::optional<ReporterIDs> reportingIDs, ErrorReply reply) = 0;
 
+  /// Says that a message to the session is read already and comes after the next two:
+  /// what it needs may be fetched from memory meanwhile. 0: it is something else. Only a
+  /// hint. On the thread that sends the messages.
+  virtual void expectMessage(ReporterID /*reporterID*/) {}
+
   /// Stops any client's session. Replies true, also when there is none; no
   /// reply for ID 0.
   virtual void stopReportingSessionForID(ReporterID reporterID, BoolReply reply) = 0;

@@ -6,6 +6,7 @@
 #include <vector>
 
 #include "Statistics/OstrelReportingTypes.h"
+#include "platform/FetchAhead.h"
 
 namespace ostrel {
 
@@ -38,6 +39,10 @@ class OstrelReportingSessionIndex {
   /// The session of the client that registered first; none without any.
   OstrelReportingSession* find(ReporterID reporterID) const {
     return slots_[slotOf(reporterID)].session;
+  }
+  /// Asks for the memory that `find` will look at.
+  void fetchAhead(ReporterID reporterID) const {
+    fetchToRead(&slots_[home(reporterID)], sizeof(Slot));
   }
   /// The client of what `find` finds.
   OstrelReportingServerInstance* clientOf(ReporterID reporterID) const {

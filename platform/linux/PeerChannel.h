@@ -66,9 +66,10 @@ class PeerChannel final : public PayloadAccount {
   /// All requests up to `mark` have run, since requests run in their order.
   void requestsRan(std::uint64_t mark) noexcept;
 
-  // The loop's.
-  bool isOverBudget() const {
-    return own_.isExceeded() || (isBeyondReserve() && user_->queued().isExceeded());
+  // The loop's. `uncharged`: what is to be charged soon.
+  bool isOverBudget(std::size_t uncharged = 0) const {
+    return own_.isExceededWith(uncharged) ||
+           (isBeyondReserve(uncharged) && user_->queued().isExceededWith(uncharged));
   }
   /// Whether the user's clients have all under way that they may.
   bool isUserOverBudget() const { return user_->queued().isExceeded(); }
@@ -95,8 +96,8 @@ class PeerChannel final : public PayloadAccount {
   std::size_t idsReplyBytes() const { return idsReplyBytes_.load(); }
 
  private:
-  bool isBeyondReserve() const {
-    const std::size_t used = own_.used();
+  bool isBeyondReserve(std::size_t uncharged = 0) const {
+    const std::size_t used = own_.used() + uncharged;
     return used > reservedQueuedBytes_ &&
            used > user_->reservedQueuedBytes(reservedQueuedBytes_, mostReservedBytes_);
   }

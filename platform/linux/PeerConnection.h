@@ -126,6 +126,8 @@ class PeerConnection final : public IPCConnection {
   std::size_t process(std::span<const std::uint8_t> bytes);
   bool isTurnOver() const { return work_ >= limits_.turnWork; }
   void processPending();
+  void chargeInput();
+  std::size_t announce(std::span<const std::uint8_t> frames);
   std::size_t carryOut(ValueBuffer& input, std::span<const std::uint8_t> item);
   bool countSession(const wire::Request& request);
   void checkNextFrame(std::span<const std::uint8_t> bytes);
@@ -151,9 +153,12 @@ class PeerConnection final : public IPCConnection {
   std::string reason_;
   Ending ending_ = Ending::kNone;
   bool isResumed_ = false;
-  std::uint64_t work_ = 0;     // Of this turn.
-  std::size_t readBytes_;      // As much as a turn gets done, as far as is known.
-  bool isUnfinished_ = false;  // Frames that are whole are pending.
+  ReporterID lastAnnounced_ = kNoReporter;
+  ValueBuffer* input_ = nullptr;  // While its requests are carried out.
+  std::size_t uncharged_ = 0;     // To it.
+  std::uint64_t work_ = 0;        // Of this turn.
+  std::size_t readBytes_;         // As much as a turn gets done, as far as is known.
+  bool isUnfinished_ = false;     // Frames that are whole are pending.
   bool isHeldBack_ = false;
   bool hasUnread_ = false;
   bool isDeaf_ = false;      // It will not read any more.

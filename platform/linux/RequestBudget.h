@@ -24,7 +24,11 @@ class RequestBudget {
     return used_.load() <= half() && takeWaiter();
   }
 
-  bool isExceeded() const { return used_.load() > most_.load(); }
+  bool isExceeded() const { return isExceededWith(0); }
+  bool isExceededWith(std::size_t more) const {
+    return used_.load() + more > most_.load();
+  }
+
   /// Begins to wait until at most half is used; false when that is so already.
   bool await() {
     isAwaited_ = true;

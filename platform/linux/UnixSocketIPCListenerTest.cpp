@@ -102,6 +102,30 @@ TEST_F(UnixSocketListener, TakesThousandsOfFramesAtOnce) {
   EXPECT_EQ(service->calls().size(), 20'001);
 }
 
+TEST_F(UnixSocketListener, SaysThreeMessagesAheadWhomTheyAreFor) {
+  serve();
+  RawClient client(path);
+  const auto messageTo = [](std::int64_t id) {
+    wire::Request request = messageRequest(0, "x");
+    request.reporterIDs = ReporterIDs{ReporterID{id}};
+    return request;
+  };
+  std::string frames;
+  for (const std::int64_t id : {100, 200, 200}) {
+    wire::appendRequest(frames, messageTo(id));
+  }
+  wire::appendRequest(frames, reportersRequest(0));
+  for (const std::int64_t id : {300, 400}) wire::appendRequest(frames, messageTo(id));
+  client.send(frames);
+  ASSERT_TRUE(service->waitForCalls(6));
+
+  using Expected = std::pair<ReporterID, std::size_t>;
+  const std::vector<Expected> expected = {{ReporterID{100}, 0}, {ReporterID{200}, 0},
+                                          {kNoReporter, 0},     {kNoReporter, 0},
+                                          {ReporterID{300}, 1}, {ReporterID{400}, 2}};
+  EXPECT_EQ(service->expected(), expected);
+}
+
 TEST_F(UnixSocketListener, JoinsTheBeginningOfAFrameWithItsRestAtEveryLength) {
   serve();
   RawClient client(path);

@@ -59,6 +59,10 @@ class RecordingService : public OstrelReportingServiceProtocol {
       if (reply) reply(std::nullopt);
     });
   }
+  void expectMessage(ReporterID id) override {
+    const std::lock_guard lock(mutex_);
+    expected_.emplace_back(id, calls_.size());
+  }
   void stopReportingSessionForID(ReporterID id, BoolReply reply) override {
     record(format("stop %lli", id));
     if (reply) reply(true);
@@ -94,6 +98,11 @@ class RecordingService : public OstrelReportingServiceProtocol {
   }
   void setReporters(ReporterIDs ids) { ids_ = std::move(ids); }
 
+  /// Whom messages were expected for, and after how many calls.
+  std::vector<std::pair<ReporterID, std::size_t>> expected() const {
+    const std::lock_guard lock(mutex_);
+    return expected_;
+  }
   std::vector<std::string> calls() const {
     const std::lock_guard lock(mutex_);
     return calls_;
@@ -123,6 +132,7 @@ class RecordingService : public OstrelReportingServiceProtocol {
   mutable std::mutex mutex_;
   mutable std::condition_variable changed_;
   std::vector<std::string> calls_;
+  std::vector<std::pair<ReporterID, std::size_t>> expected_;
   std::vector<std::function<void()>> held_;
   BoolReply startReply_;
   ReporterIDs ids_;

@@ -155,6 +155,30 @@ DecodeError takeArgument(ItemReader& reader, Argument argument,
   return kNotARequest;
 }
 
+}  // namespace
+
+ReporterID likelyReporterID(std::span<const std::uint8_t> item) {
+  constexpr Byte kOneElement = 0x81;
+  // The head of an integer of so many bytes, before it.
+  struct Width {
+    std::size_t bytes;
+    Byte head;
+  };
+  constexpr Width kWidths[] = {{8, 0x1b}, {4, 0x1a}, {2, 0x19}, {1, 0x18}};
+  const Byte* const end = item.data() + item.size();
+  for (const auto& [bytes, head] : kWidths) {
+    if (item.size() < bytes + 2) continue;
+    const Byte* at = end - bytes;
+    if (at[-1] != head || at[-2] != kOneElement) continue;
+    std::uint64_t id = 0;
+    for (; at != end; ++at) id = id << 8 | *at;
+    return ReporterID{static_cast<std::int64_t>(id)};
+  }
+  return kNoReporter;
+}
+
+namespace {
+
 // One frame in the making: its length is written when it ends.
 class FrameWriter : public ValueEncoder {
  public:

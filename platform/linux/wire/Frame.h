@@ -61,6 +61,10 @@ struct Request {
   std::optional<ReporterIDs> reporterIDs;
 };
 
+/// The session that a message goes to, by the frame's last bytes alone: a guess, for who
+/// wants to know before the frame is decoded. 0: to none, to several, or no message.
+ReporterID likelyReporterID(std::span<const std::uint8_t> item);
+
 /// Decodes the item of one frame (without its length). Anything but exactly one
 /// well-formed request with arguments in range is an error. When the item lies in
 /// `owner`, which may be none, a dictionary is left there; else it is copied.

@@ -424,5 +424,34 @@ TEST_F(FrameStream, RejectsAnEmptyFrame) {
   EXPECT_EQ(reader_.next(item_), FrameReader::Next::kEmpty);
 }
 
+TEST(RequestFrame, TellsWhomAMessageIsForByItsLastBytes) {
+  for (const std::int64_t id :
+       {std::int64_t{24}, std::int64_t{255}, std::int64_t{256}, std::int64_t{65'535},
+        std::int64_t{65'536}, std::int64_t{0xFFFFFFFF}, std::int64_t{0x100000000},
+        std::numeric_limits<std::int64_t>::max()}) {
+    Request request = sampleRequest(Operation::kSendMessage);
+    request.reporterIDs = ReporterIDs{ReporterID{id}};
+    std::string frame;
+    appendRequest(frame, request);
+    EXPECT_EQ(likelyReporterID(itemOf(frame)), ReporterID{id}) << id;
+  }
+}
+
+TEST(RequestFrame, DoesNotGuessWhereAMessageIsForNoneOrSeveral) {
+  const std::optional<ReporterIDs> kOthers[] = {
+      std::nullopt, ReporterIDs{}, ReporterIDs{ReporterID{1000}, ReporterID{1001}}};
+  for (const auto& ids : kOthers) {
+    Request request = sampleRequest(Operation::kSendMessage);
+    request.reporterIDs = ids;
+    std::string frame;
+    appendRequest(frame, request);
+    EXPECT_EQ(likelyReporterID(itemOf(frame)), kNoReporter);
+  }
+  for (std::size_t size = 0; size < 12; ++size) {
+    const std::string item(size, '\x18');
+    EXPECT_EQ(likelyReporterID(spanOf(item)), kNoReporter) << size;
+  }
+}
+
 }  // namespace
 }  // namespace ostrel::wire
