@@ -43,6 +43,11 @@ constexpr std::chrono::seconds kGoodConnection{5};
 // Calls closer together than this go through the thread.
 constexpr std::chrono::microseconds kCalm{10};
 
+// How long the thread that is woken for a request waits for more of them, so that a burst
+// goes with one call. Else the two took ten turns with each burst of 250 messages of one
+// of a thousand clients (500 ns a message).
+constexpr std::chrono::microseconds kBurst{20};
+
 // A ring that gave nothing so often in a row is looked into less often.
 constexpr unsigned kQuietDrains = 64;
 constexpr unsigned kMostRingPeriods = 8;
@@ -152,7 +157,10 @@ void ClientCore::afterQueueing(bool wasEmpty, PendingRequests::TimePoint deadlin
       lastDirectSend_ = now;
       sendDirectly();
     }
-    if (!queue_.empty()) wake();
+    if (!queue_.empty()) {
+      awaitsBurst_ = true;
+      wake();
+    }
   }
   if (deadline < sleepsUntil_) wake();
 }
@@ -304,10 +312,13 @@ bool ClientCore::takeTurn() {
     sleepsUntil_ = until;
   }
   waitUntil(until, /*wantsToWrite=*/written == Written::kBlocked);
+  bool awaitsBurst;
   {
     const std::lock_guard lock(mutex_);
     isAsleep_ = false;
+    awaitsBurst = std::exchange(awaitsBurst_, false);
   }
+  if (awaitsBurst) std::this_thread::sleep_for(kBurst);
   if (socket_) readReplies();
   return isOfThisProcess();
 }

@@ -136,8 +136,9 @@ class ClientCore final : public ForkAware,
   bool isFinished_ = false;
   std::thread thread_;
   std::thread::id threadID_;
-  bool isAsleep_ = false;   // The thread waits; `writing_` is empty.
-  bool isBlocked_ = false;  // The thread waits for room in the socket.
+  bool isAsleep_ = false;     // The thread waits; `writing_` is empty.
+  bool awaitsBurst_ = false;  // It is woken for a request, and others may follow.
+  bool isBlocked_ = false;    // The thread waits for room in the socket.
   Clock::time_point sleepsUntil_{};
   Clock::time_point lastDirectSend_{};
   Clock::time_point closeDeadline_ = Clock::time_point::max();
