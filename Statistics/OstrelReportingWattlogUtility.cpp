@@ -21,7 +21,7 @@ void OstrelReportingWattlogUtility::handleEvent(const OstrelReportingPlatform& p
   if (payload == nullptr) return;
   const std::optional<Value> engineOnTime = payload->get(kEngineOnTimeKey);
   if (!engineOnTime) return;
-  DictionaryBuilder event;
+  DictionaryBuilder event(payload->owner().account());
   event.set("EngineOnDuration", *engineOnTime);
   // There always is one: a session without an application has "Unknown".
   event.set("ApplicationName", HostApplicationID(userInfo));

@@ -14,7 +14,13 @@ namespace ostrel {
 /// made, relieved when its last reference goes.
 class PayloadAccount {
  public:
+  /// No user's.
+  static constexpr std::int64_t kNobody = -1;
+
   virtual ~PayloadAccount() = default;
+
+  /// The number of the user whom it is charged to in the end; `kNobody` without one.
+  virtual std::int64_t user() const noexcept { return kNobody; }
 
   virtual void charge(std::size_t bytes) noexcept = 0;
   /// Any thread. The account may end during the call.

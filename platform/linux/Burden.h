@@ -4,6 +4,8 @@
 #include <cstdint>
 #include <utility>
 
+#include "platform/ValueBuffer.h"
+
 namespace ostrel {
 
 /// What a request costs for as long as anything is under way that it caused. The thread
@@ -22,6 +24,11 @@ class Burden {
 
   /// The calling thread's, or none.
   static Burden* current() noexcept { return current_; }
+  /// The number of the user whose client caused what the calling thread does, if it bears
+  /// anything; else `PayloadAccount::kNobody`.
+  static std::int64_t currentUser() noexcept {
+    return current_ != nullptr ? current_->user_ : PayloadAccount::kNobody;
+  }
 
   /// The calling thread bears it until the scope ends, then what it bore before.
   class Scope {
@@ -36,12 +43,14 @@ class Burden {
   };
 
  protected:
-  Burden() = default;
+  /// `user` is the number of who caused it.
+  explicit Burden(std::int64_t user) : user_(user) {}
   virtual ~Burden() = default;
 
  private:
   static inline thread_local Burden* current_ = nullptr;
 
+  const std::int64_t user_;
   std::atomic<std::uint32_t> references_{0};
 };
 

@@ -57,7 +57,7 @@ std::shared_ptr<RequestTicket> ticketFor(const std::shared_ptr<PeerChannel>& cha
 class SessionStepBurden final : public Burden {
  public:
   SessionStepBurden(std::shared_ptr<PeerChannel> channel, std::size_t bytes)
-      : channel_(std::move(channel)), bytes_(bytes) {
+      : Burden(channel->user()), channel_(std::move(channel)), bytes_(bytes) {
     channel_->charge(bytes_);
   }
 

@@ -148,8 +148,8 @@ const State kStates[] = {
        alter(service, "CREATE TABLE songs (title TEXT)");
      }},
     {"StoreOfALaterVersion", Before::kUntouched, After::kRefused,
-     "the store has version 2, written by a later service",
-     [](const auto& service) { alter(service, "PRAGMA user_version = 2"); }},
+     "the store has version 3, written by a later service",
+     [](const auto& service) { alter(service, "PRAGMA user_version = 3"); }},
     {"LogOfNoise", Before::kKept, After::kStored, "",
      [](const auto& service) {
        replace(service, "state/reports.db-wal", noise(100'000));

@@ -95,6 +95,7 @@ StoreSession* Store::beginSession(const Dictionary& sessionInfo,
   session->sessionInfo = sessionInfo;
   session->userInfo = userInfo;
   session->startedAt = options_.now();
+  session->user = Burden::currentUser();
   push({session->startedAt, SessionBegin{session}});
   return session;
 }

@@ -3,7 +3,6 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
-#include <fstream>
 #include <random>
 #include <thread>
 
@@ -137,17 +136,6 @@ std::vector<FileEvent> recordWork(const std::string& path) {
   return vfs.stopRecording();
 }
 
-void writeFiles(const std::string& directory,
-                const std::map<std::string, std::string>& files) {
-  fs::remove_all(directory);
-  fs::create_directories(directory);
-  for (const auto& [name, content] : files) {
-    std::ofstream(directory + "/" + std::string(fs::path(name).filename()),
-                  std::ios::binary)
-        << content;
-  }
-}
-
 TEST(StoreCrash, KeepsWhatWasDurableThroughTwoThousandPowerCuts) {
   TemporaryDirectory directory(TemporaryDirectory::inMemory());
   const auto events = recordWork(directory.path() + "/state/reports.db");
@@ -166,7 +154,7 @@ TEST(StoreCrash, KeepsWhatWasDurableThroughTwoThousandPowerCuts) {
     power.apply(events[i]);
     if (events[i].kind == FileEvent::Kind::kMark) durable = events[i].offset;
     for (; cuts * events.size() < wanted * (i + 1); ++cuts) {
-      writeFiles(image, power.cut());
+      testing_support::writeFiles(image, power.cut());
       // The next life of the store: nothing is set aside, unless there was nothing.
       {
         const auto store = Store::open(path, options);

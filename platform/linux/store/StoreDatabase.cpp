@@ -11,6 +11,7 @@
 #include <fcntl.h>
 #include <sqlite3.h>
 #include <sys/stat.h>
+#include <sys/statvfs.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -26,13 +27,14 @@
 #include "platform/linux/FileDescriptor.h"
 #include "platform/linux/Limits.h"
 #include "platform/linux/store/StoreRowTables.h"
+#include "platform/linux/store/StoreStatement.h"
 
 namespace ostrel {
 namespace {
 
-constexpr std::int64_t kVersion = 1;
+constexpr std::int64_t kVersion = 2;
 constexpr const char* kSetVersion =
-    "PRAGMA application_id = 1330860620; PRAGMA user_version = 1";
+    "PRAGMA application_id = 1330860620; PRAGMA user_version = 2";
 
 constexpr const char* kSchema = R"(
 CREATE TABLE telemetry_sessions (
@@ -102,86 +104,28 @@ StoreFault newer(std::int64_t version) {
 
 }  // namespace
 
-// A prepared statement. Text given to it must live until the next step.
-class StoreDatabase::Statement {
- public:
-  Statement() = default;
-  Statement(const Statement&) = delete;
-  Statement& operator=(const Statement&) = delete;
-  ~Statement() { sqlite3_finalize(statement_); }
-
-  int prepare(sqlite3* connection, const char* sql) {
-    return sqlite3_prepare_v3(connection, sql, /*nByte=*/-1, SQLITE_PREPARE_PERSISTENT,
-                              &statement_, /*pzTail=*/nullptr);
-  }
-
-  // SQLITE_ROW, or SQLITE_OK at the end.
-  int step() {
-    const int code = sqlite3_step(statement_);
-    return code == SQLITE_DONE ? SQLITE_OK : code;
-  }
-  void reset() { sqlite3_reset(statement_); }
-
-  // With `values` for its parameters, in their order.
-  template <typename... Values>
-  int run(const Values&... values) {
-    int index = 0;
-    (bind(++index, values), ...);
-    const int code = step();
-    reset();
-    return code;
-  }
-
-  std::int64_t integer(int column) { return sqlite3_column_int64(statement_, column); }
-  std::string text(int column) {
-    const unsigned char* text = sqlite3_column_text(statement_, column);
-    if (text == nullptr) return {};
-    return {reinterpret_cast<const char*>(text),
-            static_cast<std::size_t>(sqlite3_column_bytes(statement_, column))};
-  }
-
- private:
-  void bind(int index, std::int64_t value) {
-    sqlite3_bind_int64(statement_, index, value);
-  }
-  void bind(int index, std::string_view text) {
-    sqlite3_bind_text64(statement_, index, text.data(), text.size(), SQLITE_STATIC,
-                        SQLITE_UTF8);
-  }
-  template <typename T>
-  void bind(int index, const std::optional<T>& value) {
-    if (value) {
-      bind(index, *value);
-    } else {
-      sqlite3_bind_null(statement_, index);
-    }
-  }
-
-  sqlite3_stmt* statement_ = nullptr;
-};
-
 struct StoreDatabase::Statements {
-  Statement begin;
-  Statement commit;
-  Statement insertSession;
-  Statement setFlushedAt;
-  Statement setEndedAt;
-  Statement insertMessages;
-  Statement insertAnalytics;
-  Statement insertPowerEvent;
-  Statement setStatus;
-  Statement dataVersion;
-  Statement interest;
-  Statement fingerprint;
-  Statement usedBytes;
-  Statement removeMessages;
-  Statement removeAnalytics;
-  Statement removePower;
-  Statement removeSessions;
-  Statement addToStatus;
+  StoreStatement begin;
+  StoreStatement commit;
+  StoreStatement insertSession;
+  StoreStatement setFlushedAt;
+  StoreStatement setEndedAt;
+  StoreStatement insertMessages;
+  StoreStatement insertAnalytics;
+  StoreStatement insertPowerEvent;
+  StoreStatement setStatus;
+  StoreStatement dataVersion;
+  StoreStatement interest;
+  StoreStatement fingerprint;
+  StoreStatement room;
+  StoreStatement removeMessages;
+  StoreStatement removeAnalytics;
+  StoreStatement removePower;
+  StoreStatement removeSessions;
+  StoreStatement addToStatus;
 
   struct Source {
-    Statement Statements::*statement;
+    StoreStatement Statements::*statement;
     const char* sql;
   };
   static const Source kSources[];
@@ -216,9 +160,9 @@ const StoreDatabase::Statements::Source StoreDatabase::Statements::kSources[] = 
      "ifnull((SELECT max(id) FROM telemetry_messages), 0) + "
      "ifnull((SELECT max(id) FROM analytics_events), 0) + "
      "ifnull((SELECT max(id) FROM power_events), 0)"},
-    {&Statements::usedBytes,
-     "SELECT (page_count - freelist_count) * page_size FROM pragma_page_count, "
-     "pragma_freelist_count, pragma_page_size"},
+    {&Statements::room,
+     "SELECT (page_count - freelist_count) * page_size, freelist_count * page_size FROM "
+     "pragma_page_count, pragma_freelist_count, pragma_page_size"},
     {&Statements::removeMessages,
      "DELETE FROM telemetry_messages WHERE "
      "id < (SELECT min(id) FROM telemetry_messages) + ?1 AND "
@@ -256,6 +200,7 @@ StoreDatabase::Result StoreDatabase::open() {
 
 void StoreDatabase::close() {
   statements_.reset();
+  owners_.release();
   sqlite3_close_v2(connection_);
   connection_ = nullptr;
 }
@@ -347,6 +292,9 @@ StoreDatabase::Result StoreDatabase::connect() {
   } else if (auto failed = checkContent()) {
     return failed;
   }
+  if (version != 0 && version < kVersion) {
+    if (auto failed = upgrade()) return failed;
+  }
   if (const int registered = registerRowTables(connection_, &rows_)) {
     return fault(registered, "prepare");
   }
@@ -376,14 +324,28 @@ StoreDatabase::Result StoreDatabase::checkVersion(std::int64_t& version) {
 
 StoreDatabase::Result StoreDatabase::makeSchema() {
   isAnother_ = true;
+  return runAtOnce({kSchema, StoreOwners::kSchema, kSetVersion});
+}
+
+// From version 1.
+StoreDatabase::Result StoreDatabase::upgrade() {
+  OSTREL_LOG_DEFAULT(processLogScope, "the store %@ is made one of version %lli", path_,
+                     kVersion);
+  return runAtOnce({StoreOwners::kSchema, StoreOwners::kDisownAll, kSetVersion});
+}
+
+// All of the steps or, after a fault or a crash, none.
+StoreDatabase::Result StoreDatabase::runAtOnce(std::initializer_list<const char*> steps) {
   if (auto failed = run("BEGIN IMMEDIATE")) return failed;
-  for (const char* sql : {kSchema, kSetVersion, "COMMIT"}) {
+  for (const char* sql : steps) {
     if (auto failed = run(sql)) {
       rollback();
       return failed;
     }
   }
-  return std::nullopt;
+  Result failed = run("COMMIT");
+  if (failed) rollback();
+  return failed;
 }
 
 StoreDatabase::Result StoreDatabase::checkContent() {
@@ -407,6 +369,11 @@ StoreDatabase::Result StoreDatabase::prepareStatements() {
                      sqlite3_errmsg(connection_));
     }
     if (code != SQLITE_OK) return fault(code, "prepare");
+  }
+  if (const int code = owners_.prepare(connection_)) {
+    return code == SQLITE_ERROR ? damaged(std::string("its tables are others: ") +
+                                          sqlite3_errmsg(connection_))
+                                : fault(code, "prepare");
   }
   statements_ = std::move(statements);
   dataVersion_ = -1;
@@ -477,6 +444,7 @@ StoreDatabase::Result StoreDatabase::commit() {
 }
 
 void StoreDatabase::rollback() {
+  owners_.forgetNoted();
   if (connection_ != nullptr && sqlite3_get_autocommit(connection_) == 0) {
     run("ROLLBACK");
   }
@@ -486,7 +454,11 @@ StoreDatabase::Result StoreDatabase::insertSession(const SessionRow& row,
                                                    std::int64_t& id) {
   const int code = statements_->insertSession.run(
       row.reporterID, row.hierarchyToken, row.sessionInfo, row.userInfo, row.startedAt);
-  if (code == SQLITE_OK) id = sqlite3_last_insert_rowid(connection_);
+  if (code == SQLITE_OK) {
+    id = sqlite3_last_insert_rowid(connection_);
+    owners_.note(RowKind::kSessions, id, row.user,
+                 row.sessionInfo.size() + row.userInfo.size());
+  }
   return resultOf(code, "insert a session");
 }
 
@@ -500,30 +472,75 @@ StoreDatabase::Result StoreDatabase::setEndedAt(std::int64_t session, std::int64
 }
 
 StoreDatabase::Result StoreDatabase::insertPowerEvent(const PowerRow& row) {
-  return resultOf(statements_->insertPowerEvent.run(row.clientID, row.name, row.event,
-                                                    row.attachment, row.createdAt),
-                  "insert a power event");
+  const int code = statements_->insertPowerEvent.run(row.clientID, row.name, row.event,
+                                                     row.attachment, row.createdAt);
+  if (code == SQLITE_OK) {
+    owners_.note(RowKind::kPower, sqlite3_last_insert_rowid(connection_), row.user,
+                 row.name.size() + row.event.size());
+  }
+  return resultOf(code, "insert a power event");
 }
 
 StoreDatabase::Result StoreDatabase::insertRows(const RowBatch& rows) {
   rows_ = &rows;
   int code = SQLITE_OK;
-  if (!rows.messages.empty()) code = statements_->insertMessages.run();
+  // There is one writer: the IDs of a statement follow each other.
+  const auto firstOf = [&](std::size_t inserted) {
+    return sqlite3_last_insert_rowid(connection_) + 1 -
+           static_cast<std::int64_t>(inserted);
+  };
+  if (!rows.messages.empty()) {
+    code = statements_->insertMessages.run();
+    std::int64_t id = firstOf(rows.messages.size());
+    for (const MessageRow& row : rows.messages) {
+      owners_.note(RowKind::kMessages, id++, row.user,
+                   row.sessionInfo.size + row.userInfo.size + row.payload.size);
+    }
+  }
   if (code == SQLITE_OK && !rows.analytics.empty()) {
     code = statements_->insertAnalytics.run();
+    std::int64_t id = firstOf(rows.analytics.size());
+    for (const AnalyticsRow& row : rows.analytics) {
+      owners_.note(RowKind::kAnalytics, id++, row.user, row.name.size + row.payload.size);
+    }
   }
   rows_ = nullptr;
   return resultOf(code, "insert rows");
 }
 
-StoreDatabase::Result StoreDatabase::readUsedBytes(std::int64_t& bytes) {
-  return readInteger(statements_->usedBytes, "read the size", bytes);
+StoreDatabase::Result StoreDatabase::noteOwners() {
+  return resultOf(owners_.write(), "note whose rows there are");
+}
+
+StoreDatabase::Result StoreDatabase::readRoom(Room& room) {
+  StoreStatement& statement = statements_->room;
+  const int code = statement.step();
+  if (code == SQLITE_ROW) {
+    room.used = statement.integer(0);
+    room.free = statement.integer(1);
+  }
+  statement.reset();
+  if (code != SQLITE_ROW) return fault(code, "read the size");
+  struct statvfs disk;
+  if (::statvfs(path_.c_str(), &disk) != 0) return systemFault(errno, "look at", path_);
+  room.diskAvailable = static_cast<std::int64_t>(disk.f_bavail * disk.f_frsize);
+  room.diskBytes = static_cast<std::int64_t>(disk.f_blocks * disk.f_frsize);
+  return std::nullopt;
+}
+
+StoreDatabase::Result StoreDatabase::removeOfLargestOwner(std::int64_t rows,
+                                                          std::int64_t& removed) {
+  return resultOf(owners_.removeOfLargest(rows, removed), "remove old rows");
+}
+
+StoreDatabase::Result StoreDatabase::forgetOwnersOfRemoved() {
+  return resultOf(owners_.forgetRemoved(), "note whose rows there are");
 }
 
 StoreDatabase::Result StoreDatabase::removeOldest(std::int64_t rows,
                                                   std::optional<std::int64_t> before,
                                                   std::int64_t& removed) {
-  for (Statement* statement :
+  for (StoreStatement* statement :
        {&statements_->removeMessages, &statements_->removeAnalytics,
         &statements_->removePower, &statements_->removeSessions}) {
     const int code =
@@ -556,7 +573,7 @@ StoreDatabase::Result StoreDatabase::readInterestIfChanged(
   }
   if (version == dataVersion_) return std::nullopt;
   std::vector<std::string> read;
-  Statement& interest = statements_->interest;
+  StoreStatement& interest = statements_->interest;
   int code;
   while ((code = interest.step()) == SQLITE_ROW) read.push_back(interest.text(0));
   interest.reset();
@@ -575,12 +592,12 @@ StoreDatabase::Result StoreDatabase::run(const char* sql) {
 }
 
 StoreDatabase::Result StoreDatabase::readInteger(const char* sql, std::int64_t& value) {
-  Statement statement;
+  StoreStatement statement;
   const int code = statement.prepare(connection_, sql);
   return code == SQLITE_OK ? readInteger(statement, "read", value) : fault(code, "read");
 }
 
-StoreDatabase::Result StoreDatabase::readInteger(Statement& statement,
+StoreDatabase::Result StoreDatabase::readInteger(StoreStatement& statement,
                                                  std::string_view action,
                                                  std::int64_t& value) {
   const int code = statement.step();
@@ -590,7 +607,7 @@ StoreDatabase::Result StoreDatabase::readInteger(Statement& statement,
 }
 
 StoreDatabase::Result StoreDatabase::readText(const char* sql, std::string& value) {
-  Statement statement;
+  StoreStatement statement;
   int code = statement.prepare(connection_, sql);
   if (code == SQLITE_OK) code = statement.step();
   if (code != SQLITE_ROW) return fault(code, "read");

@@ -3,16 +3,17 @@
 #include <sys/types.h>
 
 #include <cstdint>
+#include <initializer_list>
 #include <memory>
 #include <optional>
 #include <string>
 #include <string_view>
 #include <vector>
 
+#include "platform/linux/store/StoreOwners.h"
 #include "platform/linux/store/StoreRows.h"
 
 struct sqlite3;
-struct sqlite3_stmt;
 
 namespace ostrel {
 
@@ -67,6 +68,7 @@ class StoreDatabase {
     std::string_view sessionInfo;
     std::string_view userInfo;
     std::int64_t startedAt = 0;
+    std::int64_t user = PayloadAccount::kNobody;
   };
   Result insertSession(const SessionRow& row, std::int64_t& id);
   Result setFlushedAt(std::int64_t session, std::int64_t time);
@@ -78,19 +80,39 @@ class StoreDatabase {
     std::string_view event;
     std::optional<std::string_view> attachment;
     std::int64_t createdAt = 0;
+    std::int64_t user = PayloadAccount::kNobody;
   };
   Result insertPowerEvent(const PowerRow& row);
 
   Result insertRows(const RowBatch& rows);
 
-  /// The bytes of the file that hold something.
-  Result readUsedBytes(std::int64_t& bytes);
+  /// Notes whose the rows are that were inserted. The last before a commit.
+  Result noteOwners();
+
+  /// In bytes.
+  struct Room {
+    std::int64_t used = 0;  // Of the file: what holds something,
+    std::int64_t free = 0;  // and what does not any more.
+    std::int64_t diskAvailable = 0;
+    std::int64_t diskBytes = 0;
+  };
+  Result readRoom(Room& room);
+  /// Whether less than so much of a disk is available.
+  static bool isScarce(std::int64_t available, std::int64_t bytes, std::int64_t percent) {
+    return available < bytes / 100 * percent;
+  }
+
+  /// As StoreOwners::removeOfLargest.
+  Result removeOfLargestOwner(std::int64_t rows, std::int64_t& removed);
 
   /// Removes of each kind up to `rows` of the oldest rows, only those from before
   /// the time `before` if there is one; sessions, when nothing that is kept is older.
   /// The newest of each kind stays, so that no id is given twice. `removed` grows.
   Result removeOldest(std::int64_t rows, std::optional<std::int64_t> before,
                       std::int64_t& removed);
+
+  /// After `removeOldest`.
+  Result forgetOwnersOfRemoved();
 
   Result setStatus(std::string_view key, std::int64_t value);
   /// Adds to a value of the status that outlives the process.
@@ -107,7 +129,6 @@ class StoreDatabase {
   static bool matches(const std::string& pattern, const std::string& text);
 
  private:
-  class Statement;
   struct Statements;
 
   Result makeFile();
@@ -117,6 +138,8 @@ class StoreDatabase {
   void keepLogAtClose(bool isKept);
   Result checkVersion(std::int64_t& version);
   Result makeSchema();
+  Result upgrade();
+  Result runAtOnce(std::initializer_list<const char*> steps);
   Result checkContent();
   Result prepareStatements();
   std::string nameForSetAside() const;
@@ -124,7 +147,8 @@ class StoreDatabase {
 
   Result run(const char* sql);
   Result readInteger(const char* sql, std::int64_t& value);
-  Result readInteger(Statement& statement, std::string_view action, std::int64_t& value);
+  Result readInteger(StoreStatement& statement, std::string_view action,
+                     std::int64_t& value);
   Result readText(const char* sql, std::string& value);
   Result resultOf(int code, std::string_view action) const;
   StoreFault fault(int code, std::string_view action) const;
@@ -137,6 +161,7 @@ class StoreDatabase {
   ino_t inode_ = 0;
   const RowBatch* rows_ = nullptr;  // What the row tables show.
   std::int64_t dataVersion_ = -1;
+  StoreOwners owners_;
   std::unique_ptr<Statements> statements_;
 };
 

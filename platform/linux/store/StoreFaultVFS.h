@@ -3,6 +3,7 @@
 #pragma once
 
 #include <sqlite3.h>
+#include <unistd.h>
 
 #include <algorithm>
 #include <atomic>
@@ -10,7 +11,6 @@
 #include <cstring>
 #include <map>
 #include <mutex>
-#include <new>
 #include <random>
 #include <string>
 #include <vector>
@@ -25,7 +25,8 @@ struct FaultPlan {
   int code = SQLITE_IOERR;  // Of writes; others fail with their own kind of it.
   std::int64_t after = -1;  // Calls that succeed before; -1: none fails.
   bool isForEver = false;
-  std::int64_t second = 0;  // So many calls after the first one more fails; 0: none.
+  std::int64_t second = 0;   // So many calls after the first one more fails; 0: none.
+  bool endsProcess = false;  // In place of failing, with the status `FaultVFS::kEnded`.
 };
 
 /// One change of a file on its way to the disk.
@@ -42,6 +43,7 @@ struct FileEvent {
 class FaultVFS {
  public:
   static constexpr const char* kName = "ostrel-faults";
+  static constexpr int kEnded = 9;
 
   static FaultVFS& instance() {
     static FaultVFS vfs;
@@ -105,6 +107,7 @@ class FaultVFS {
     const bool isSecond = plan_.second > 0 && call == plan_.after + plan_.second;
     if (call < plan_.after) return false;
     if (call > plan_.after && !plan_.isForEver && !isSecond) return false;
+    if (plan_.endsProcess) ::_exit(kEnded);
     ++failed_;
     if (code != nullptr) *code = plan_.code;
     return true;

@@ -272,7 +272,7 @@ TEST_F(StoreFaults, StandsAForeignLog) {
 
 TEST_F(StoreFaults, LeavesAStoreOfALaterVersionUntouched) {
   makeSoundStore();
-  OtherConnection(path()).run("PRAGMA user_version = 2");
+  OtherConnection(path()).run("PRAGMA user_version = 3");
   std::ifstream before(path(), std::ios::binary);
   const std::string bytes((std::istreambuf_iterator<char>(before)), {});
   open();
@@ -280,13 +280,13 @@ TEST_F(StoreFaults, LeavesAStoreOfALaterVersionUntouched) {
   makeSession();
   const Success result = send(2);
   EXPECT_FALSE(result.succeeded);
-  EXPECT_THAT(result.error->description, ::testing::HasSubstr("version 2"));
+  EXPECT_THAT(result.error->description, ::testing::HasSubstr("version 3"));
   close();
   std::ifstream after(path(), std::ios::binary);
   EXPECT_TRUE(bytes == std::string((std::istreambuf_iterator<char>(after)), {}));
   EXPECT_EQ(log_->texts(LogLevel::kError).front(),
-            "the store cannot be used: the store has version 2, written by a later "
-            "service; this one knows 1");
+            "the store cannot be used: the store has version 3, written by a later "
+            "service; this one knows 2");
 }
 
 TEST_F(StoreFaults, KeepsOnlyTwoFilesSetAside) {

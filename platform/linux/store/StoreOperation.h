@@ -23,6 +23,7 @@ struct StoreSession {
   Dictionary sessionInfo;
   Dictionary userInfo;
   std::int64_t startedAt = 0;
+  std::int64_t user = PayloadAccount::kNobody;  // Whose client caused it.
 
   // The writer thread's. The row may be in a file that has been set aside since:
   // then the session gets a new one.
@@ -81,6 +82,8 @@ struct StoreOperation {
                AnalyticsEvent, PowerEvent, StatusChange>
       what;
   BurdenShare burden = BurdenShare::current();
+  /// Who caused it, unless its payload says so: `Burden::currentUser`.
+  std::int64_t user = Burden::currentUser();
 
   /// The memory of the payloads that it keeps; those of their clients bear it.
   std::size_t payloadBytes() const;

@@ -8,6 +8,8 @@
 #include <string_view>
 #include <vector>
 
+#include "platform/ValueBuffer.h"
+
 namespace ostrel {
 
 /// A piece of a batch's text. Not there: NULL.
@@ -17,6 +19,10 @@ struct RowText {
   bool isThere = false;
 };
 
+/// What rows are of; a number of the store.
+enum class RowKind : std::int64_t { kMessages, kAnalytics, kPower, kSessions };
+inline constexpr std::size_t kRowKinds = 4;
+
 struct MessageRow {
   std::optional<std::int64_t> session;
   RowText sessionInfo;
@@ -25,12 +31,14 @@ struct MessageRow {
   std::uint16_t type = 0;
   RowText payload;
   std::int64_t createdAt = 0;
+  std::int64_t user = PayloadAccount::kNobody;
 };
 
 struct AnalyticsRow {
   RowText name;
   RowText payload;
   std::int64_t createdAt = 0;
+  std::int64_t user = PayloadAccount::kNobody;
 };
 
 /// Rows that share one growing text.

@@ -466,7 +466,7 @@ TEST_F(StoreTest, SaysItsVersionAndItsJournal) {
   open();
   settle();
   OtherConnection reader(path());
-  EXPECT_EQ(reader.one("PRAGMA user_version"), "1");
+  EXPECT_EQ(reader.one("PRAGMA user_version"), "2");
   EXPECT_EQ(reader.one("PRAGMA journal_mode"), "wal");
   EXPECT_EQ(reader.one("SELECT pattern FROM analytics_interest"), "*");
 }

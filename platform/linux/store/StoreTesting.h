@@ -6,6 +6,9 @@
 
 #include <chrono>
 #include <condition_variable>
+#include <filesystem>
+#include <fstream>
+#include <map>
 #include <mutex>
 #include <optional>
 #include <string>
@@ -93,6 +96,22 @@ class Awaited {
   std::optional<T> value_;
   int times_ = 0;
 };
+
+namespace testing_support {
+
+/// Makes `directory` one with these files alone, whatever their paths were.
+inline void writeFiles(const std::string& directory,
+                       const std::map<std::string, std::string>& files) {
+  std::filesystem::remove_all(directory);
+  std::filesystem::create_directories(directory);
+  for (const auto& [name, content] : files) {
+    std::ofstream(directory + "/" + std::string(std::filesystem::path(name).filename()),
+                  std::ios::binary)
+        << content;
+  }
+}
+
+}  // namespace testing_support
 
 /// The result of a flush, waited for.
 inline std::optional<ErrorObject> flushed(TelemetrySession& session) {

@@ -40,6 +40,13 @@ bool isRow(const StoreOperation& operation) {
          std::holds_alternative<PowerEvent>(operation.what);
 }
 
+// Whose client brought the payload, or caused what brought it.
+std::int64_t userOf(const StoreOperation& operation, const Dictionary& payload) {
+  const auto& account = payload.owner().account();
+  const std::int64_t user = account ? account->user() : PayloadAccount::kNobody;
+  return user != PayloadAccount::kNobody ? user : operation.user;
+}
+
 std::size_t payloadBytesOf(const StoreBatch& batch) {
   std::size_t bytes = 0;
   for (const StoreOperation& operation : batch) bytes += operation.payloadBytes();
@@ -151,19 +158,24 @@ StoreWriter::Result StoreWriter::write(StoreOperation& operation) {
   return std::visit(
       Overloaded{[&](SessionMessage& message) -> Result {
                    if (Result failed = insertSession(*message.session)) return failed;
+                   if (operation.user == PayloadAccount::kNobody) {
+                     operation.user = message.session->user;
+                   }
                    rows_.messages.push_back({message.session->row, RowText(), RowText(),
                                              message.category, message.type,
-                                             json(message.payload), time});
+                                             json(message.payload), time,
+                                             userOf(operation, message.payload)});
                    return std::nullopt;
                  },
                  [&](AnalyticsEvent& event) { return write(operation, event); },
                  [&](LoneMessage& message) -> Result {
                    rows_.messages.push_back({std::nullopt, json(message.sessionInfo),
                                              json(message.userInfo), message.category,
-                                             message.type, json(message.payload), time});
+                                             message.type, json(message.payload), time,
+                                             userOf(operation, message.payload)});
                    return std::nullopt;
                  },
-                 [&](PowerEvent& event) { return write(time, event); },
+                 [&](PowerEvent& event) { return write(operation, event); },
                  [&](StatusChange&) -> Result { return std::nullopt; },
                  [&](SessionBegin& begin) { return insertSession(*begin.session); },
                  [&](SessionFlush& flush) -> Result {
@@ -196,11 +208,13 @@ StoreWriter::Result StoreWriter::write(StoreOperation& operation, AnalyticsEvent
   rows_.text += event.name;
   row.payload = json(*event.payload);
   row.createdAt = operation.time;
+  row.user = userOf(operation, *event.payload);
   rows_.analytics.push_back(row);
   return std::nullopt;
 }
 
-StoreWriter::Result StoreWriter::write(std::int64_t time, const PowerEvent& event) {
+StoreWriter::Result StoreWriter::write(const StoreOperation& operation,
+                                       const PowerEvent& event) {
   text_.clear();
   appendLenientJSON(text_, event.event);
   const std::size_t end = text_.size();
@@ -211,7 +225,8 @@ StoreWriter::Result StoreWriter::write(std::int64_t time, const PowerEvent& even
   row.name = event.name;
   row.event = text.substr(0, end);
   if (event.attachment) row.attachment = text.substr(end);
-  row.createdAt = time;
+  row.createdAt = operation.time;
+  row.user = userOf(operation, event.event);
   return database_.insertPowerEvent(row);
 }
 
@@ -232,6 +247,7 @@ StoreWriter::Result StoreWriter::insertSession(StoreSession& session) {
   row.sessionInfo = text.substr(0, end);
   row.userInfo = text.substr(end);
   row.startedAt = session.startedAt;
+  row.user = session.user;
   if (Result failed = database_.insertSession(row, session.row)) {
     session.row = 0;
     return failed;
@@ -261,7 +277,8 @@ StoreWriter::Result StoreWriter::writeRows(bool evenIfFew) {
 std::vector<StoreBatch> StoreWriter::commit() {
   if (fault_ || pending_.empty()) return {};
   DoubtfulCommit made{0, pending_.size(), {}};
-  Result failed = removeOld();
+  Result failed = database_.noteOwners();
+  if (!failed) failed = removeOld();
   if (!failed) failed = writeStatus();
   if (!failed) failed = database_.readFingerprint(made.fingerprint);
   if (failed) {
@@ -345,20 +362,32 @@ StoreWriter::Result StoreWriter::removeOld() {
   }
   const std::int64_t rows = std::max(kLeast, 2 * coming);
   std::int64_t removed = 0;
-  std::int64_t used = 0;
-  if (Result failed = database_.readUsedBytes(used)) return failed;
-  if (used > retention_.bytes) {
-    if (Result failed = database_.removeOldest(rows, std::nullopt, removed))
-      return failed;
-  }
+  if (Result failed = makeRoom(rows, removed)) return failed;
   if (newestTime_ >= nextAgeCheck_) {
     std::int64_t old = 0;
     const std::int64_t before = newestTime_ - retention_.age.count();
     if (Result failed = database_.removeOldest(rows, before, old)) return failed;
+    if (Result failed = database_.forgetOwnersOfRemoved()) return failed;
     if (old == 0) nextAgeCheck_ = newestTime_ + kHour;
     removed += old;
   }
   return removed == 0 ? std::nullopt : database_.addToStatus("removed", removed);
+}
+
+StoreWriter::Result StoreWriter::makeRoom(std::int64_t rows, std::int64_t& removed) {
+  StoreDatabase::Room room;
+  if (Result failed = database_.readRoom(room)) return failed;
+  // Beyond what comes, since a part of what is free is in pages of other tables.
+  const auto coming = static_cast<std::int64_t>(2 * uncommittedBytes_ + kTextAtOnce);
+  const bool mustNotGrow = room.used > retention_.bytesInNeed && room.free < coming &&
+                           StoreDatabase::isScarce(room.diskAvailable, room.diskBytes,
+                                                   retention_.percentKeptFree);
+  if (room.used <= retention_.bytes && !mustNotGrow) return std::nullopt;
+  if (Result failed = database_.removeOfLargestOwner(rows, removed)) return failed;
+  if (removed != 0) return std::nullopt;
+  // Nobody owns what there is.
+  if (Result failed = database_.removeOldest(rows, std::nullopt, removed)) return failed;
+  return database_.forgetOwnersOfRemoved();
 }
 
 StoreWriter::Result StoreWriter::readInterest() {

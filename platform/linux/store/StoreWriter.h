@@ -19,6 +19,10 @@ namespace ostrel {
 struct StoreRetention {
   std::int64_t bytes = limits::kStoreBytes;
   std::chrono::microseconds age = limits::kStoreAge;
+  /// Of the disk, in percent, that the store does not grow into as long as it has so
+  /// many bytes.
+  std::int64_t percentKeptFree = 5;
+  std::int64_t bytesInNeed = 16 * 1024 * 1024;
 };
 
 /// Writes operations to the database and bears its faults. What was handed over
@@ -83,11 +87,12 @@ class StoreWriter {
   Result writePending();
   Result write(StoreOperation& operation);
   Result write(StoreOperation& operation, AnalyticsEvent& event);
-  Result write(std::int64_t time, const PowerEvent& event);
+  Result write(const StoreOperation& operation, const PowerEvent& event);
   Result insertSession(StoreSession& session);
   Result writeRows(bool evenIfFew);
   Result writeStatus();
   Result removeOld();
+  Result makeRoom(std::int64_t rows, std::int64_t& removed);
   Result readInterest();
   bool wants(const std::string& name);
   void fail(const StoreFault& fault);
