@@ -656,74 +656,62 @@ long sleepsOfThisThread() {
   return -1;
 }
 
-// A thread takes several queues from a long line at once. None of them waits for the
-// first of these as long as there is another thread.
-TEST_F(ThreadPoolWorkQueuesTest, TakesOverWhatAThreadThatIsHeldUpTookAhead) {
-  constexpr int kOthers = 200;
-  Gate gate;
-  std::vector<std::shared_ptr<WorkQueue>> all;
-  for (std::size_t i = 0; i < ThreadPoolWorkQueues::kMostUtilityThreads; ++i) {
-    all.push_back(makeQueue());
-    all.back()->async(gate.holdingStep());
-    gate.waitUntilHolding();
-  }
-  std::atomic<int> count{0};
-  std::binary_semaphore othersRan{0};
-  std::atomic<bool> wasInTime{false};
-  all.push_back(makeQueue());
-  all.back()->async(
-      [&] { wasInTime = othersRan.try_acquire_for(std::chrono::seconds(20)); });
-  for (int i = 0; i < kOthers; ++i) {
-    all.push_back(makeQueue());
-    all.back()->async([&] {
-      if (++count == kOthers) othersRan.release();
+/// A thread takes several queues from a long line at once. Here the first step holds its
+/// thread up until all the others have run, which must not wait for it.
+class ThreadPoolWorkQueuesHeldUp : public ThreadPoolWorkQueuesTest {
+ protected:
+  void SetUp() override {
+    for (std::size_t i = 0; i < kThreads; ++i) {
+      add(gate_.holdingStep());
+      gate_.waitUntilHolding();
+    }
+    add([this] {
+      wasInTime_ = othersRan_.try_acquire_for(std::chrono::seconds(20));
+      isOver_ = true;
     });
+    for (int i = 0; i < kOthers; ++i) {
+      add([this] {
+        if (++count_ == kOthers) othersRan_.release();
+      });
+    }
   }
-  for (std::size_t i = 0; i < ThreadPoolWorkQueues::kMostUtilityThreads; ++i) gate.open();
 
-  ASSERT_TRUE(drain());
-  EXPECT_TRUE(wasInTime);
+  WorkQueue& add(Task step) {
+    all_.push_back(makeQueue());
+    all_.back()->async(std::move(step));
+    return *all_.back();
+  }
+
+  void expectThatOthersRun() {
+    for (std::size_t i = 0; i < kThreads; ++i) gate_.open();
+    ASSERT_TRUE(drain());
+    EXPECT_TRUE(wasInTime_);
+  }
+
+  static constexpr std::size_t kThreads = ThreadPoolWorkQueues::kMostUtilityThreads;
+  static constexpr int kOthers = 200;
+  std::atomic<bool> isOver_{false};
+
+ private:
+  Gate gate_;
+  std::vector<std::shared_ptr<WorkQueue>> all_;
+  std::atomic<int> count_{0};
+  std::binary_semaphore othersRan_{0};
+  std::atomic<bool> wasInTime_{false};
+};
+
+TEST_F(ThreadPoolWorkQueuesHeldUp, LeavesWhatItTookAheadToAnotherThread) {
+  expectThatOthersRun();
 }
 
-// As long as more and more comes, too.
-TEST_F(ThreadPoolWorkQueuesTest, TakesOverWhatIsHeldUpThoughTheLineIsNeverEmpty) {
-  constexpr int kOthers = 200;
-  Gate gate;
-  std::vector<std::shared_ptr<WorkQueue>> all;
-  for (std::size_t i = 0; i < ThreadPoolWorkQueues::kMostUtilityThreads; ++i) {
-    all.push_back(makeQueue());
-    all.back()->async(gate.holdingStep());
-    gate.waitUntilHolding();
-  }
-  std::atomic<int> count{0};
-  std::binary_semaphore othersRan{0};
-  std::atomic<bool> wasInTime{false};
-  std::atomic<bool> isOver{false};
-  all.push_back(makeQueue());
-  all.back()->async([&] {
-    wasInTime = othersRan.try_acquire_for(std::chrono::seconds(20));
-    isOver = true;
-  });
-  for (int i = 0; i < kOthers; ++i) {
-    all.push_back(makeQueue());
-    all.back()->async([&] {
-      if (++count == kOthers) othersRan.release();
-    });
-  }
-  // Queues that never have enough.
+TEST_F(ThreadPoolWorkQueuesHeldUp, DoesSoThoughMoreAndMoreComes) {
   std::function<void(WorkQueue&)> goOn = [&](WorkQueue& queue) {
     queue.async([&] {
-      if (!isOver) goOn(queue);
+      if (!isOver_) goOn(queue);
     });
   };
-  for (int i = 0; i < kOthers; ++i) {
-    all.push_back(makeQueue());
-    goOn(*all.back());
-  }
-  for (std::size_t i = 0; i < ThreadPoolWorkQueues::kMostUtilityThreads; ++i) gate.open();
-
-  ASSERT_TRUE(drain());
-  EXPECT_TRUE(wasInTime);
+  for (int i = 0; i < kOthers; ++i) goOn(add([] {}));
+  expectThatOthersRun();
 }
 
 TEST_F(ThreadPoolWorkQueuesTest, WakesNobodyForStepsOfAQueueThatRunsAlready) {
