@@ -100,6 +100,25 @@ inline constexpr std::size_t kSessionBytes = 512;
 /// ListenerSharesUnderWay.AreAQuarterForACrowdedUser]
 inline constexpr std::size_t kMemoryBytesOfUser = 20 * 1024 * 1024;
 
+/// The same of all users together, of each kind and of all kinds. Some users may each
+/// have their shares side by side; when that becomes too much, each has a part of the
+/// total at most, which is more than clients that behave have. Of all kinds little more
+/// than what one user may have: the service is no larger beside many users that ask for
+/// too much than beside one.
+/// [MemoryOfUsers.IsSharedOutBeyondTheTotalOfEachKind,
+/// MemoryOfUsers.LeavesOneWithLittleItsReserve,
+/// ListenerOfUsers.HoldsBackWhoHasMuchOfWhatIsUnderWay,
+/// ListenerOfUsers.CutsOffHalvesOfFramesOfWhoHasMany]
+inline constexpr std::size_t kQueuedBytesOfAll = 32 * 1024 * 1024;
+inline constexpr std::size_t kUnreadReplyBytesOfAll = 16 * 1024 * 1024;
+inline constexpr std::size_t kHalfFrameBytesOfAll = 16 * 1024 * 1024;
+inline constexpr std::size_t kUserInfoBytesOfAll = 24 * 1024 * 1024;
+inline constexpr std::size_t kMemoryBytesOfAll = 24 * 1024 * 1024;
+
+/// Parts of those totals, one of which each user has in any case.
+/// [MemoryOfUsers.LeavesOneWithLittleItsReserve]
+inline constexpr std::size_t kUsersInReserve = 16;
+
 /// Bytes of the entries that sessions keep for their summaries, in all, and of the
 /// messages of one user's clients. Room for a session of a million messages with its
 /// summary, twice. What is beyond a small budget in memory is in files.

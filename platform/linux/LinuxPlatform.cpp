@@ -9,7 +9,7 @@
 #include "platform/linux/DirectoryFileSystem.h"
 #include "platform/linux/EtcDeviceInfo.h"
 #include "platform/linux/FileEntryStorage.h"
-#include "platform/linux/Heap.h"
+#include "platform/linux/HeapKeeper.h"
 #include "platform/linux/InotifyChangeNotification.h"
 #include "platform/linux/JSONTextSerialization.h"
 #include "platform/linux/JSONUserDefaults.h"
@@ -80,9 +80,8 @@ struct LinuxPlatform::Bindings {
   std::shared_ptr<TimerThread> timers;
   std::shared_ptr<StatusNotice> notice;
   std::shared_ptr<MisuseLog> misuse;
+  std::shared_ptr<ThreadPoolWorkQueues> queues;
   std::unique_ptr<UnixSocketIPCListener> listener;
-  std::shared_ptr<ThreadPoolWorkQueues> queues =
-      std::make_shared<ThreadPoolWorkQueues>(timers);
   std::shared_ptr<FileEntryStorage> entries =
       std::make_shared<FileEntryStorage>(stateDirectory());
   std::shared_ptr<Store> store = Store::open(storePath(), storeOptions());
@@ -110,14 +109,15 @@ Outcome<std::unique_ptr<LinuxPlatform>> LinuxPlatform::open() {
   const auto timers = std::make_shared<TimerThread>();
   const auto notice = std::make_shared<StatusNotice>(timers);
   const auto misuse = std::make_shared<MisuseLog>([notice] { notice->give(); });
-  auto listener =
-      UnixSocketIPCListener::open(reportingSocketPath(), peers, ListenerLimits(), misuse);
+  const auto queues = std::make_shared<ThreadPoolWorkQueues>(timers);
+  auto listener = UnixSocketIPCListener::open(
+      reportingSocketPath(), peers,
+      {ListenerLimits(), misuse, &queues->backgroundQueue(),
+       std::make_shared<HeapKeeper>(timers), /*identityOf=*/nullptr});
   if (!listener.value) return {std::nullopt, std::move(listener.error)};
-  auto bindings = std::unique_ptr<Bindings>(
-      new Bindings{log, peers, timers, notice, misuse, *std::move(listener.value)});
+  auto bindings = std::unique_ptr<Bindings>(new Bindings{
+      log, peers, timers, notice, misuse, queues, *std::move(listener.value)});
   notice->setStore(bindings->store);
-  bindings->listener->setHeapKeeper(std::make_shared<HeapKeeper>(timers));
-  bindings->listener->setDisposal(&bindings->queues->backgroundQueue());
   return {std::unique_ptr<LinuxPlatform>(new LinuxPlatform(std::move(bindings))),
           std::nullopt};
 }

@@ -1,7 +1,9 @@
 // What the clients of a user may have, asked for over the socket: below, at and beyond
 // each limit.
 #include <gtest/gtest.h>
+#include <unistd.h>
 
+#include <atomic>
 #include <map>
 #include <memory>
 #include <mutex>
@@ -260,6 +262,122 @@ TEST_F(ListenerSharesUnderWay, AreAQuarterForACrowdedUser) {
       EXPECT_TRUE(service->waitForCalls(taken + 1)) << sessions;
     }
     service->releaseReplies();
+  }
+}
+
+/// Clients of several users, each of whom may have plenty.
+class ListenerOfUsers : public ListenerShares {
+ protected:
+  static constexpr auto kQueued = static_cast<std::size_t>(MemoryKind::kQueued);
+  static constexpr auto kHalfFrames = static_cast<std::size_t>(MemoryKind::kHalfFrames);
+  static constexpr auto kUserInfos = static_cast<std::size_t>(MemoryKind::kUserInfos);
+
+  ListenerOfUsers() {
+    identityOf = [this](int) { return PeerIdentity{::getpid(), userOfNext}; };
+  }
+  ~ListenerOfUsers() override { stop(); }
+
+  bool listenerShouldAcceptNewConnection(
+      IPCListener& accepting, const std::shared_ptr<IPCConnection>& connection) override {
+    return isRecording
+               ? UnixSocketListener::listenerShouldAcceptNewConnection(accepting,
+                                                                       connection)
+               : ListenerShares::listenerShouldAcceptNewConnection(accepting, connection);
+  }
+  std::unique_ptr<RawClient> clientOf(std::uint32_t user) {
+    userOfNext = user;
+    auto client = std::make_unique<RawClient>(path);
+    wire::Request question = createRequest(1, 7);
+    question.operation = wire::Operation::kReporterIDValid;
+    client->send(question);
+    EXPECT_TRUE(client->receive());
+    return client;
+  }
+
+  std::atomic<std::uint32_t> userOfNext{0};
+  bool isRecording = true;
+};
+
+TEST_F(ListenerOfUsers, HoldsBackWhoHasMuchOfWhatIsUnderWay) {
+  constexpr std::size_t kEach = 20;
+  constexpr std::size_t kMost = 2 * kEach * limits::kRequestBytes;
+  for (const std::size_t most : {kMost - 1, kMost, kMost + 1}) {
+    stop();
+    ListenerLimits limits;
+    limits.ofAll[kQueued] = most;
+    limits.ofUser.reservedQueuedBytes = 0;
+    limits.reservedQueuedBytes = 0;
+    serve(limits);
+    const auto one = clientOf(1);
+    const auto two = clientOf(2);
+    const auto three = clientOf(3);
+    service->holdReplies();
+    std::size_t taken = service->calls().size();
+    for (const auto& client : {one.get(), two.get()}) {
+      for (std::size_t i = 0; i < kEach; ++i) client->send(createRequest(0, 7));
+      ASSERT_TRUE(service->waitForCalls(taken += kEach));
+    }
+
+    one->send(createRequest(0, 7));
+    if (most < kMost) {
+      EXPECT_EQ(callsWhileHeld(taken), taken);
+    } else {
+      EXPECT_TRUE(service->waitForCalls(++taken)) << most;
+    }
+    three->send(createRequest(0, 7));
+    three->send(createRequest(0, 7));
+    EXPECT_TRUE(service->waitForCalls(taken + 2)) << "who has little is served";
+    service->releaseReplies();
+    const std::size_t all = taken + 2 + (most < kMost ? 1 : 0);
+    EXPECT_TRUE(service->waitForCalls(all)) << "nothing is lost";
+  }
+}
+
+TEST_F(ListenerOfUsers, CutsOffHalvesOfFramesOfWhoHasMany) {
+  const std::string half =
+      std::string("\x00\x00\x01\x00", 4) + std::string(30 * 1024 - 4, '\x81');
+  for (const std::size_t most :
+       {2 * half.size() - 1, 2 * half.size(), 2 * half.size() + 1}) {
+    stop();
+    ListenerLimits limits;
+    limits.ofAll[kHalfFrames] = most;
+    serve(limits);
+    const auto little = clientOf(3);
+    const auto one = clientOf(1);
+    const auto two = clientOf(2);
+    one->send(half);
+    two->send(half);
+    // Looks after both.
+    clientOf(4);
+    clientOf(4);
+    if (most < 2 * half.size()) {
+      EXPECT_EQ(one->receiveClosing(), "too many frames are not whole");
+      // One of them was enough.
+      two->send(std::string_view(half).substr(0, 1));
+      little->send(std::string_view(half).substr(0, 1000));
+      clientOf(4);
+    }
+    EXPECT_FALSE(two->receive(std::chrono::milliseconds(20))) << most;
+    EXPECT_FALSE(two->isCutOff()) << most;
+    EXPECT_FALSE(little->isCutOff());
+  }
+}
+
+TEST_F(ListenerOfUsers, TakesNoMoreUserInfosOfWhoHasMany) {
+  isRecording = false;
+  const Dictionary info = textOf(3000);
+  const std::size_t kMost = 2 * memoryOf(info);
+  for (const std::size_t most : {kMost - 1, kMost, kMost + 1}) {
+    ListenerLimits limits;
+    limits.ofAll[kUserInfos] = most;
+    serveAnew(limits);
+    const auto one = clientOf(1);
+    const auto two = clientOf(2);
+    const auto three = clientOf(3);
+    EXPECT_EQ(entriesAfter(*one, 1, info), 1u);
+    EXPECT_EQ(entriesAfter(*two, 2, info), 1u);
+    EXPECT_EQ(entriesAfter(*one, 11, textOf(10)), most < kMost ? 0u : 1u) << most;
+    EXPECT_EQ(entriesAfter(*three, 3, textOf(100)), 1u) << "who has little may";
   }
 }
 

@@ -32,6 +32,7 @@ struct ListenerLimits {
   std::size_t mostReservedBytes = limits::kMostReservedBytes;
   UserAccount::Limits ofUser{limits::kQueuedBytesOfUser, limits::kSessionsOfUser,
                              limits::kKeptBytesOfUser};
+  MemoryUse ofAll = MemoryOfAll::kMost;
   std::size_t sessions = limits::kSessions;
   std::size_t keptBytes = limits::kKeptBytes;
   std::size_t unreadReplyBytes = limits::kUnreadReplyBytes;

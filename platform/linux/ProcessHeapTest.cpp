@@ -1,5 +1,5 @@
 // What the keeper of the heap does to the process's own.
-#include "platform/linux/Heap.h"
+#include "platform/linux/HeapKeeper.h"
 
 #include <gtest/gtest.h>
 #include <unistd.h>

@@ -53,7 +53,7 @@ bool watchDescriptor(int epoll, int descriptor, std::uint64_t id) {
   return ::epoll_ctl(epoll, EPOLL_CTL_ADD, descriptor, &event) == 0;
 }
 
-PeerIdentity identityOf(int socket) {
+PeerIdentity kernelsIdentityOf(int socket) {
   ucred credentials{};
   socklen_t size = sizeof credentials;
   if (::getsockopt(socket, SOL_SOCKET, SO_PEERCRED, &credentials, &size) != 0) return {};
@@ -80,13 +80,12 @@ void sendClosing(int socket, std::string_view reason) {
 }  // namespace
 
 Outcome<std::unique_ptr<UnixSocketIPCListener>> UnixSocketIPCListener::open(
-    const std::string& path, std::shared_ptr<PeerRegistry> peers, ListenerLimits limits,
-    std::shared_ptr<MisuseLog> misuse) {
+    const std::string& path, std::shared_ptr<PeerRegistry> peers,
+    ListenerOptions options) {
   auto socket = ServiceSocket::open(path);
   if (!socket.value) return {std::nullopt, std::move(socket.error)};
   auto listener = std::unique_ptr<UnixSocketIPCListener>(new UnixSocketIPCListener(
-      *std::move(socket.value), std::move(peers), limits,
-      misuse ? std::move(misuse) : std::make_shared<MisuseLog>()));
+      *std::move(socket.value), std::move(peers), std::move(options)));
   if (!listener->watchOwnDescriptors()) {
     return {std::nullopt,
             ErrorObject{std::string(kPOSIXErrorDomain), ENOMEM,
@@ -97,14 +96,17 @@ Outcome<std::unique_ptr<UnixSocketIPCListener>> UnixSocketIPCListener::open(
 
 UnixSocketIPCListener::UnixSocketIPCListener(ServiceSocket socket,
                                              std::shared_ptr<PeerRegistry> peers,
-                                             ListenerLimits limits,
-                                             std::shared_ptr<MisuseLog> misuse)
-    : limits_(limits),
+                                             ListenerOptions options)
+    : limits_(options.limits),
       socket_(std::move(socket)),
       peers_(std::move(peers)),
-      misuse_(std::move(misuse)),
+      misuse_(options.misuse ? std::move(options.misuse) : std::make_shared<MisuseLog>()),
+      disposal_(options.disposal),
+      heap_(std::move(options.heap)),
+      identityOf_(options.identityOf ? std::move(options.identityOf) : kernelsIdentityOf),
       epoll_(::epoll_create1(EPOLL_CLOEXEC)),
-      service_(new ServiceAccount{Share(limits.sessions), Share(limits.keptBytes)}),
+      service_(new ServiceAccount{Share(limits_.sessions), Share(limits_.keptBytes),
+                                  MemoryOfAll(limits_.ofAll)}),
       nextID_(kFirstConnection) {}
 
 bool UnixSocketIPCListener::watchOwnDescriptors() {
@@ -140,9 +142,7 @@ void UnixSocketIPCListener::look() {
   waker_->endWait();
   line_.setTime(static_cast<std::uint64_t>(
       std::chrono::nanoseconds(Clock::now().time_since_epoch()).count()));
-  for (const auto& [id, user] : users_) {
-    if (user.account->adapt()) waker_->budgetEased();
-  }
+  shareMemoryOut();
   if (heap_ && count > 0) heap_->noteWork();
   const ThreadPoolWorkQueues::Batch requests;
   for (int i = 0; i < count; ++i) {
@@ -150,6 +150,34 @@ void UnixSocketIPCListener::look() {
     handleEvent(event.data.u64, event.events);
   }
   if (firstDeadline_) handleDeadlines(Clock::now());
+}
+
+// From now until the next look.
+void UnixSocketIPCListener::shareMemoryOut() {
+  do {
+    MemoryUse used{};
+    for (const auto& [id, user] : users_) {
+      const MemoryUse ofUser = user.account->memoryUse();
+      for (std::size_t i = 0; i < kMemoryKinds; ++i) used[i] += ofUser[i];
+    }
+    service_->memory.set(used);
+  } while (cutOffHalfOfWhoHasMost());
+  for (const auto& [id, user] : users_) {
+    if (user.account->adapt()) waker_->budgetEased();
+  }
+}
+
+// Of those that have too many.
+bool UnixSocketIPCListener::cutOffHalfOfWhoHasMost() {
+  std::optional<std::uint32_t> worst;
+  std::size_t most = 0;
+  for (const auto& [id, user] : users_) {
+    const std::size_t bytes = user.account->halfFrameBytes();
+    if (bytes <= most || !user.account->hasManyHalfFrames()) continue;
+    worst = id;
+    most = bytes;
+  }
+  return worst && cutOffOldestHalf(*worst);
 }
 
 // Those that are cheap have their requests served together, which wakes the threads of
@@ -290,19 +318,23 @@ void UnixSocketIPCListener::countHalfFrame(PeerConnection& connection) {
       std::exchange(watched->second.halfFrameBytes, connection.halfFrameBytes());
   UserAccount& account = *users_.at(connection.peer().user).account;
   account.changeHalfFrames(before, connection.halfFrameBytes());
-  if (!account.hasManyHalfFrames()) return;
+  if (account.hasManyHalfFrames()) cutOffOldestHalf(connection.peer().user);
+}
+
+bool UnixSocketIPCListener::cutOffOldestHalf(std::uint32_t user) {
   std::shared_ptr<PeerConnection> oldest;
   for (const auto& [id, each] : connections_) {
     const PeerConnection& candidate = *each.connection;
     if (candidate.halfFrameBytes() == 0) continue;
-    if (candidate.peer().user != connection.peer().user) continue;
+    if (candidate.peer().user != user) continue;
     if (!oldest || candidate.pendingSince() < oldest->pendingSince()) {
       oldest = each.connection;
     }
   }
-  if (!oldest) return;
+  if (!oldest) return false;
   oldest->breakOff(PeerConnection::Ending::kBrokenRules, "too many frames are not whole");
   cutOff(*oldest);
+  return true;
 }
 
 void UnixSocketIPCListener::watch(PeerConnection& connection) {
@@ -373,7 +405,7 @@ std::uint64_t UnixSocketIPCListener::acceptSome() {
 }
 
 void UnixSocketIPCListener::accept(FileDescriptor socket) {
-  const PeerIdentity peer = identityOf(socket.get());
+  const PeerIdentity peer = identityOf_(socket.get());
   if (!isWithinLimits(peer, socket.get())) return;
   User& user = users_[peer.user];
   if (!user.account) {

@@ -3,6 +3,7 @@
 #include <sys/epoll.h>
 
 #include <cstdint>
+#include <functional>
 #include <map>
 #include <memory>
 #include <optional>
@@ -15,7 +16,7 @@
 #include "platform/WorkQueue.h"
 #include "platform/linux/FairLine.h"
 #include "platform/linux/FileDescriptor.h"
-#include "platform/linux/Heap.h"
+#include "platform/linux/HeapKeeper.h"
 #include "platform/linux/LoopWaker.h"
 #include "platform/linux/PeerConnection.h"
 #include "platform/linux/PeerRegistry.h"
@@ -24,6 +25,20 @@
 #include "platform/linux/UserAccount.h"
 
 namespace ostrel {
+
+/// What a listener takes from its surroundings; none of it has to be given.
+struct ListenerOptions {
+  ListenerLimits limits;
+  /// Who is told of clients that are cut short.
+  std::shared_ptr<MisuseLog> misuse;
+  /// Where the sessions of a client that left many are given up: whoever had 100,000
+  /// must not hold up the others by its end. None: where it is.
+  ConcurrentQueue* disposal = nullptr;
+  /// Who is told of each round of requests.
+  std::shared_ptr<HeapKeeper> heap;
+  /// Who is at the other end; empty: whom the kernel says.
+  std::function<PeerIdentity(int socket)> identityOf;
+};
 
 /// Serves clients on a Unix stream socket, all of them on the one thread that calls
 /// `resume`. Frames and their rules are in `docs/protocol.md`.
@@ -35,18 +50,11 @@ namespace ostrel {
 class UnixSocketIPCListener final : public IPCListener {
  public:
   /// The socket that systemd passed, else one of our own at `path`. An error is a
-  /// sentence for people. `peers` learns who connects, `misuse` who is cut short.
+  /// sentence for people. `peers` learns who connects.
   static Outcome<std::unique_ptr<UnixSocketIPCListener>> open(
       const std::string& path, std::shared_ptr<PeerRegistry> peers,
-      ListenerLimits limits = {}, std::shared_ptr<MisuseLog> misuse = nullptr);
+      ListenerOptions options = {});
   ~UnixSocketIPCListener() override;
-
-  /// Where the sessions of a client that left many are given up: whoever had 100,000
-  /// must not hold up the others by its end. Before `resume`; without it, where it is.
-  void setDisposal(ConcurrentQueue* queue) { disposal_ = queue; }
-
-  /// Who is told of each round of requests; before `resume`.
-  void setHeapKeeper(std::shared_ptr<HeapKeeper> heap) { heap_ = std::move(heap); }
 
   void setDelegate(IPCListenerDelegate* delegate) override { delegate_ = delegate; }
 
@@ -65,9 +73,10 @@ class UnixSocketIPCListener final : public IPCListener {
   };
 
   UnixSocketIPCListener(ServiceSocket socket, std::shared_ptr<PeerRegistry> peers,
-                        ListenerLimits limits, std::shared_ptr<MisuseLog> misuse);
+                        ListenerOptions options);
 
   void look();
+  void shareMemoryOut();
   void takeTurns();
   /// Each returns the work that it took.
   std::uint64_t takeTurn(PeerConnection::ID id);
@@ -88,16 +97,20 @@ class UnixSocketIPCListener final : public IPCListener {
   void end(PeerConnection& connection);
   void cutOff(PeerConnection& connection);
   void countHalfFrame(PeerConnection& connection);
+  bool cutOffOldestHalf(std::uint32_t user);
+  bool cutOffHalfOfWhoHasMost();
 
   const ListenerLimits limits_;
   const ServiceSocket socket_;
   const std::shared_ptr<PeerRegistry> peers_;
   const std::shared_ptr<MisuseLog> misuse_;
+  ConcurrentQueue* const disposal_;
+  const std::shared_ptr<HeapKeeper> heap_;  // Or none.
+  const std::function<PeerIdentity(int)> identityOf_;
   const std::shared_ptr<LoopWaker> waker_ = std::make_shared<LoopWaker>();
   TerminationSignals signals_;
   const FileDescriptor epoll_;
   IPCListenerDelegate* delegate_ = nullptr;
-  std::shared_ptr<HeapKeeper> heap_;  // Or none.
 
   struct Watched {
     std::shared_ptr<PeerConnection> connection;
@@ -115,7 +128,6 @@ class UnixSocketIPCListener final : public IPCListener {
   PeerConnection::ID nextID_;
   FairLine line_;  // Of connections, and of the socket that accepts them.
   FairLine::Place placeOfSocket_;
-  ConcurrentQueue* disposal_ = nullptr;
   // Of clients that have gone, and of those among them that had many sessions.
   std::vector<std::shared_ptr<void>> estates_;
   std::vector<std::shared_ptr<void>> largeEstates_;

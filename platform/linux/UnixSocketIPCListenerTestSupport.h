@@ -146,7 +146,9 @@ class UnixSocketListener : public testing::Test, public IPCListenerDelegate {
   ~UnixSocketListener() override { stop(); }
 
   void serve(ListenerLimits limits = {}) {
-    auto opened = UnixSocketIPCListener::open(path, peers, limits, misuse);
+    auto opened = UnixSocketIPCListener::open(
+        path, peers,
+        {limits, misuse, /*disposal=*/nullptr, /*heap=*/nullptr, identityOf});
     ASSERT_TRUE(opened.value) << opened.error->description;
     listener = *std::move(opened.value);
     listener->setDelegate(this);
@@ -198,6 +200,7 @@ class UnixSocketListener : public testing::Test, public IPCListenerDelegate {
   const std::string path = directory / "run/reporting.sock";
   const std::shared_ptr<PeerRegistry> peers = std::make_shared<PeerRegistry>();
   const std::shared_ptr<MisuseLog> misuse = std::make_shared<MisuseLog>();
+  std::function<PeerIdentity(int socket)> identityOf;  // Empty: the kernel's.
   const std::shared_ptr<RecordingService> service = std::make_shared<RecordingService>();
   std::unique_ptr<UnixSocketIPCListener> listener;
   std::thread thread;

@@ -9,6 +9,7 @@
 
 #include "platform/ValueBuffer.h"
 #include "platform/linux/Limits.h"
+#include "platform/linux/MemoryOfAll.h"
 #include "platform/linux/RequestBudget.h"
 #include "platform/linux/Share.h"
 
@@ -17,9 +18,10 @@ namespace ostrel {
 /// What all users of the service may have together.
 struct ServiceAccount {
   Share sessions;
-  // Sessions' threads write it, and the thread that reads looks at `sessions` with each
+  // Sessions' threads write it, and the thread that reads looks at the others with each
   // request.
   alignas(64) Share keptBytes;
+  alignas(64) MemoryOfAll memory = MemoryOfAll();
 };
 
 /// Bears the user infos of sessions, which live as long as these. Any thread.
@@ -65,7 +67,9 @@ class UserAccount {
   };
 
   UserAccount(const Limits& limits, std::shared_ptr<ServiceAccount> service)
-      : limits_(limits),
+      : memoryLimits_{limits.queuedBytes, limits.unreadBytes, limits.halfFrameBytes,
+                      limits.userInfoBytes, limits.memory},
+        reservedQueuedBytes_(limits.reservedQueuedBytes),
         queued_(limits.queuedBytes),
         userInfos_(std::make_shared<UserInfos>(limits.userInfoBytes)),
         service_(std::move(service)),
@@ -79,9 +83,8 @@ class UserAccount {
   /// others have it all.
   void setConnections(std::size_t count) noexcept { connections_ = count; }
   std::size_t reservedQueuedBytes(std::size_t least, std::size_t most) const {
-    return std::clamp(
-        limits_.reservedQueuedBytes / std::max<std::size_t>(connections_, 1), least,
-        most);
+    return std::clamp(reservedQueuedBytes_ / std::max<std::size_t>(connections_, 1),
+                      least, most);
   }
 
   /// One more session. False: there are as many as the user or the service may have.
@@ -103,25 +106,23 @@ class UserAccount {
     unreadBytes_ += now - before;
   }
   bool hasManyUnread() const {
-    return unreadBytes_ > limits_.unreadBytes ||
-           (isCrowded() && unreadBytes_ > limits_.unreadBytes / kPartWhenCrowded);
+    const std::size_t unread = unreadBytes_;
+    return unread != 0 && unread > most(MemoryKind::kUnread);
   }
 
   /// Bytes of frames that are not whole, likewise.
   void changeHalfFrames(std::size_t before, std::size_t now) noexcept {
     halfFrameBytes_ += now - before;
   }
+  std::size_t halfFrameBytes() const { return halfFrameBytes_; }
   bool hasManyHalfFrames() const {
-    return halfFrameBytes_ > limits_.halfFrameBytes ||
-           (isCrowded() &&
-            halfFrameBytes_ > limits_.halfFrameBytes / kPartOfFramesWhenCrowded);
+    return halfFrameBytes_ > most(MemoryKind::kHalfFrames);
   }
 
   /// Whether a user info may grow by so much.
   bool hasRoomForInfo(std::size_t bytes) const {
     return userInfos_->hasRoomFor(bytes) &&
-           !(isCrowded() &&
-             userInfos_->bytes() + bytes > limits_.userInfoBytes / kPartWhenCrowded);
+           userInfos_->bytes() + bytes <= most(MemoryKind::kUserInfos);
   }
 
   /// What all that takes in memory, roughly, and whether that is too much: then each
@@ -130,14 +131,18 @@ class UserAccount {
     return queued_.used() + unreadBytes_ + halfFrameBytes_ + userInfos_->bytes() +
            sessions_.used() * limits::kSessionBytes;
   }
-  bool isCrowded() const { return memory() > limits_.memory; }
+  bool isCrowded() const {
+    constexpr auto kAll = static_cast<std::size_t>(MemoryKind::kAll);
+    return memory() >
+           std::min(memoryLimits_[kAll], service_->memory.mostOfUser(MemoryKind::kAll));
+  }
+  MemoryUse memoryUse() const {
+    return {queued_.used(), unreadBytes_, halfFrameBytes_, userInfos_->bytes(), memory()};
+  }
 
   /// Brings the share of what is queued in line with that. True: somebody who waits for
   /// it is to be told.
-  bool adapt() noexcept {
-    return queued_.limitTo(isCrowded() ? limits_.queuedBytes / kPartOfQueuedWhenCrowded
-                                       : limits_.queuedBytes);
-  }
+  bool adapt() noexcept { return queued_.limitTo(most(MemoryKind::kQueued)); }
 
   /// Who bears the user infos of sessions.
   std::shared_ptr<PayloadAccount> accountOfInfos() const { return userInfos_; }
@@ -147,10 +152,18 @@ class UserAccount {
   std::size_t keptBytes() const { return keptBytes_.used(); }
 
  private:
-  static constexpr std::size_t kPartWhenCrowded = 8;
-  static constexpr std::size_t kPartOfQueuedWhenCrowded = 4;
-  // Whoever sends a large frame slowly is not to be taken for one who hoards them.
-  static constexpr std::size_t kPartOfFramesWhenCrowded = 2;
+  // Of its shares, in the order of the kinds. Whoever sends a large frame slowly is not
+  // to be taken for one who hoards them.
+  static constexpr std::array<std::size_t, kMemoryKinds> kPartsWhenCrowded = {4, 8, 2, 8,
+                                                                              1};
+
+  // What it may have of a kind now.
+  std::size_t most(MemoryKind kind) const {
+    const auto index = static_cast<std::size_t>(kind);
+    const std::size_t own = isCrowded() ? memoryLimits_[index] / kPartsWhenCrowded[index]
+                                        : memoryLimits_[index];
+    return std::min(own, service_->memory.mostOfUser(kind));
+  }
 
   static bool takeBoth(Share& own, Share& all, std::size_t amount) noexcept {
     if (!own.take(amount)) return false;
@@ -163,7 +176,8 @@ class UserAccount {
     all.give(amount);
   }
 
-  const Limits limits_;
+  const MemoryUse memoryLimits_;
+  const std::size_t reservedQueuedBytes_;
   RequestBudget queued_;
   std::atomic<std::size_t> connections_{0};
   std::atomic<std::size_t> unreadBytes_{0};

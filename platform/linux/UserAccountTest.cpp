@@ -160,5 +160,95 @@ TEST_F(CrowdedUser, TellsWhoWaitsWhenItIsNotAnyMore) {
   EXPECT_FALSE(user.adapt());
 }
 
+/// Two users, and what the service lets all have together.
+class MemoryOfUsers : public testing::Test {
+ protected:
+  static constexpr std::size_t kMost = 1600;
+  static constexpr std::size_t kReserve = kMost / limits::kUsersInReserve;
+  static constexpr std::size_t kPlenty = 100'000;
+
+  static UserAccount::Limits limits() {
+    UserAccount::Limits limits{/*queuedBytes=*/kPlenty, /*sessions=*/10, /*keptBytes=*/0};
+    limits.unreadBytes = limits.userInfoBytes = limits.halfFrameBytes = kPlenty;
+    limits.memory = kPlenty;
+    return limits;
+  }
+  void shareOut() {
+    MemoryUse used = big.memoryUse();
+    for (std::size_t i = 0; i < kMemoryKinds; ++i) used[i] += little.memoryUse()[i];
+    service->memory.set(used);
+    big.adapt();
+    little.adapt();
+  }
+
+  const std::shared_ptr<ServiceAccount> service{new ServiceAccount{
+      Share(10), Share(0), MemoryOfAll({kMost, kMost, kMost, kMost, kPlenty})}};
+  UserAccount big{limits(), service};
+  UserAccount little{limits(), service};
+};
+
+TEST_F(MemoryOfUsers, IsSharedOutBeyondTheTotalOfEachKind) {
+  little.queued().take(kReserve);
+  little.changeUnread(0, kReserve);
+  little.changeHalfFrames(0, kReserve);
+  little.accountOfInfos()->charge(kReserve);
+  const std::size_t most = kMost - kReserve;
+  std::size_t before = 0;
+  for (const std::size_t bytes : {most - 1, most, most + 1}) {
+    const bool isTooMuch = bytes > most;
+    big.queued().take(bytes - before);
+    big.changeUnread(before, bytes);
+    big.changeHalfFrames(before, bytes);
+    big.accountOfInfos()->charge(bytes - before);
+    before = bytes;
+    shareOut();
+    EXPECT_EQ(big.queued().isExceeded(), isTooMuch) << bytes;
+    EXPECT_EQ(big.hasManyUnread(), isTooMuch) << bytes;
+    EXPECT_EQ(big.hasManyHalfFrames(), isTooMuch) << bytes;
+    EXPECT_EQ(big.hasRoomForInfo(1), !isTooMuch) << bytes;
+  }
+}
+
+TEST_F(MemoryOfUsers, LeavesOneWithLittleItsReserve) {
+  big.queued().take(2 * kMost);
+  big.changeUnread(0, 2 * kMost);
+  big.changeHalfFrames(0, 2 * kMost);
+  big.accountOfInfos()->charge(2 * kMost);
+  std::size_t before = 0;
+  for (const std::size_t bytes : {kReserve - 1, kReserve, kReserve + 1}) {
+    const bool isTooMuch = bytes > kReserve;
+    little.queued().take(bytes - before);
+    little.changeUnread(before, bytes);
+    little.changeHalfFrames(before, bytes);
+    shareOut();
+    EXPECT_EQ(little.queued().isExceeded(), isTooMuch) << bytes;
+    EXPECT_EQ(little.hasManyUnread(), isTooMuch) << bytes;
+    EXPECT_EQ(little.hasManyHalfFrames(), isTooMuch) << bytes;
+    EXPECT_EQ(little.hasRoomForInfo(bytes), !isTooMuch) << bytes;
+    before = bytes;
+  }
+}
+
+TEST_F(MemoryOfUsers, CrowdsWhoHasMuchOfAllKindsTogether) {
+  const std::size_t reserve = kPlenty / limits::kUsersInReserve;
+  for (const std::size_t total : {kPlenty - 1, kPlenty, kPlenty + 1}) {
+    service->memory.set({0, 0, 0, 0, total});
+    big.changeUnread(0, reserve + 1);
+    EXPECT_EQ(big.isCrowded(), total > kPlenty) << total;
+    big.changeUnread(reserve + 1, reserve);
+    EXPECT_FALSE(big.isCrowded()) << "it has no more than its reserve";
+    big.changeUnread(reserve, 0);
+  }
+}
+
+TEST_F(MemoryOfUsers, IsWhatEachMayHaveAgainWhenItIsLess) {
+  big.queued().take(kMost + 1);
+  shareOut();
+  EXPECT_TRUE(big.queued().await());
+  big.queued().give(1);
+  shareOut();
+  EXPECT_FALSE(big.queued().isExceeded());
+}
+
 }  // namespace
 }  // namespace ostrel

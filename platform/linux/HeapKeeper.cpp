@@ -1,4 +1,4 @@
-#include "platform/linux/Heap.h"
+#include "platform/linux/HeapKeeper.h"
 
 #include <malloc.h>
 
