@@ -311,9 +311,20 @@ inline constexpr std::size_t kStoreKeptThroughFault = 16384;
 inline constexpr std::size_t kStoreFilesSetAside = 2;
 
 /// Of the store: more than a device reports in months, and a share of its flash that
-/// nobody misses. The oldest rows go.
-/// [StoreTest.RemovesTheOldestRowsOfALargeStore]
+/// nobody misses. The oldest rows go of the user who has most in it.
+/// [StoreTest.RemovesTheOldestRowsOfALargeStore,
+/// OwnersOfRows.KeepRowsThatOthersFlood]
 inline constexpr std::int64_t kStoreBytes = std::int64_t{4} * 1024 * 1024 * 1024;
+
+/// Of the disk's space, in percent, that the store does not grow into: beyond it rows go
+/// for those that come.
+/// [OwnersOfRows.AreCutBackOnADiskThatIsNearlyFull,
+/// StoreDatabaseRoom.IsScarceBelowTheLimit]
+inline constexpr std::int64_t kDiskPercentKeptFree = 5;
+
+/// What it may have all the same, whoever filled the disk.
+/// [OwnersOfRows.HaveTheirRowsOnANearlyFullDiskWhereTheStoreIsSmall]
+inline constexpr std::int64_t kStoreBytesInNeed = 16 * 1024 * 1024;
 
 /// How old a row may become.
 /// [StoreTest.RemovesRowsThatAreTooOld]

@@ -39,6 +39,7 @@ class PeerChannel final : public PayloadAccount {
   /// or has too many unread.
   void reply(wire::RequestNumber number, const wire::ReplyValue& value);
 
+  std::int64_t user() const noexcept override { return user_->number(); }
   void charge(std::size_t bytes) noexcept override;
   void relieve(std::size_t bytes) noexcept override;
   bool keep(std::size_t bytes) noexcept override { return user_->keep(bytes); }

@@ -409,7 +409,7 @@ void UnixSocketIPCListener::accept(FileDescriptor socket) {
   if (!isWithinLimits(peer, socket.get())) return;
   User& user = users_[peer.user];
   if (!user.account) {
-    user.account = std::make_shared<UserAccount>(limits_.ofUser, service_);
+    user.account = std::make_shared<UserAccount>(limits_.ofUser, service_, peer.user);
   }
   const PeerConnection::ID id = nextID_++;
   peers_->peerConnected(peer.pid, id, processOf(socket.get(), peer.pid));

@@ -66,8 +66,11 @@ class UserAccount {
     std::size_t reservedQueuedBytes = limits::kReservedQueuedBytesOfUser;
   };
 
-  UserAccount(const Limits& limits, std::shared_ptr<ServiceAccount> service)
-      : memoryLimits_{limits.queuedBytes, limits.unreadBytes, limits.halfFrameBytes,
+  /// `number` is the user's; of nobody in tests.
+  UserAccount(const Limits& limits, std::shared_ptr<ServiceAccount> service,
+              std::int64_t number = PayloadAccount::kNobody)
+      : number_(number),
+        memoryLimits_{limits.queuedBytes, limits.unreadBytes, limits.halfFrameBytes,
                       limits.userInfoBytes, limits.memory},
         reservedQueuedBytes_(limits.reservedQueuedBytes),
         queued_(limits.queuedBytes),
@@ -75,6 +78,8 @@ class UserAccount {
         service_(std::move(service)),
         sessions_(limits.sessions),
         keptBytes_(limits.keptBytes) {}
+
+  std::int64_t number() const { return number_; }
 
   /// Bytes of requests that are accepted and not yet carried out.
   RequestBudget& queued() { return queued_; }
@@ -176,6 +181,7 @@ class UserAccount {
     all.give(amount);
   }
 
+  const std::int64_t number_;
   const MemoryUse memoryLimits_;
   const std::size_t reservedQueuedBytes_;
   RequestBudget queued_;

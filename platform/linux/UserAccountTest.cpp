@@ -173,6 +173,17 @@ class MemoryOfUsers : public testing::Test {
     limits.memory = kPlenty;
     return limits;
   }
+  /// More of each kind but user infos.
+  static void grow(UserAccount& user, std::size_t before, std::size_t now) {
+    user.queued().take(now - before);
+    user.changeUnread(before, now);
+    user.changeHalfFrames(before, now);
+  }
+  static void expectTooMuch(UserAccount& user, bool isTooMuch, std::size_t bytes) {
+    EXPECT_EQ(user.queued().isExceeded(), isTooMuch) << bytes;
+    EXPECT_EQ(user.hasManyUnread(), isTooMuch) << bytes;
+    EXPECT_EQ(user.hasManyHalfFrames(), isTooMuch) << bytes;
+  }
   void shareOut() {
     MemoryUse used = big.memoryUse();
     for (std::size_t i = 0; i < kMemoryKinds; ++i) used[i] += little.memoryUse()[i];
@@ -188,43 +199,29 @@ class MemoryOfUsers : public testing::Test {
 };
 
 TEST_F(MemoryOfUsers, IsSharedOutBeyondTheTotalOfEachKind) {
-  little.queued().take(kReserve);
-  little.changeUnread(0, kReserve);
-  little.changeHalfFrames(0, kReserve);
+  grow(little, 0, kReserve);
   little.accountOfInfos()->charge(kReserve);
   const std::size_t most = kMost - kReserve;
   std::size_t before = 0;
   for (const std::size_t bytes : {most - 1, most, most + 1}) {
-    const bool isTooMuch = bytes > most;
-    big.queued().take(bytes - before);
-    big.changeUnread(before, bytes);
-    big.changeHalfFrames(before, bytes);
+    grow(big, before, bytes);
     big.accountOfInfos()->charge(bytes - before);
-    before = bytes;
     shareOut();
-    EXPECT_EQ(big.queued().isExceeded(), isTooMuch) << bytes;
-    EXPECT_EQ(big.hasManyUnread(), isTooMuch) << bytes;
-    EXPECT_EQ(big.hasManyHalfFrames(), isTooMuch) << bytes;
-    EXPECT_EQ(big.hasRoomForInfo(1), !isTooMuch) << bytes;
+    expectTooMuch(big, bytes > most, bytes);
+    EXPECT_EQ(big.hasRoomForInfo(1), bytes <= most) << bytes;
+    before = bytes;
   }
 }
 
 TEST_F(MemoryOfUsers, LeavesOneWithLittleItsReserve) {
-  big.queued().take(2 * kMost);
-  big.changeUnread(0, 2 * kMost);
-  big.changeHalfFrames(0, 2 * kMost);
+  grow(big, 0, 2 * kMost);
   big.accountOfInfos()->charge(2 * kMost);
   std::size_t before = 0;
   for (const std::size_t bytes : {kReserve - 1, kReserve, kReserve + 1}) {
-    const bool isTooMuch = bytes > kReserve;
-    little.queued().take(bytes - before);
-    little.changeUnread(before, bytes);
-    little.changeHalfFrames(before, bytes);
+    grow(little, before, bytes);
     shareOut();
-    EXPECT_EQ(little.queued().isExceeded(), isTooMuch) << bytes;
-    EXPECT_EQ(little.hasManyUnread(), isTooMuch) << bytes;
-    EXPECT_EQ(little.hasManyHalfFrames(), isTooMuch) << bytes;
-    EXPECT_EQ(little.hasRoomForInfo(bytes), !isTooMuch) << bytes;
+    expectTooMuch(little, bytes > kReserve, bytes);
+    EXPECT_EQ(little.hasRoomForInfo(bytes), bytes <= kReserve) << bytes;
     before = bytes;
   }
 }

@@ -4,6 +4,7 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <sys/stat.h>
+#include <unistd.h>
 
 #include <algorithm>
 #include <regex>
@@ -351,6 +352,15 @@ TEST_F(RecordedSession, MirrorsTheRunningTimeOfTheEngineToThePowerLog) {
               ElementsAre(R"(28|Mediora_Haptics|{"EngineOnDuration":1.5,)"
                           R"("ApplicationName":"com.example.dialer",)"
                           R"("TimestampEnd":1000})"));
+}
+
+TEST_F(RecordedSession, IsItsClientsUsersInTheStore) {
+  EXPECT_THAT(service_->rows("SELECT kind, user, sum(last_id - first_id + 1) FROM "
+                             "row_owners WHERE user != -1 GROUP BY kind, user"),
+              ElementsAre("0|" + std::to_string(::geteuid()) + "|5",
+                          "1|" + std::to_string(::geteuid()) + "|5",
+                          "2|" + std::to_string(::geteuid()) + "|1",
+                          "3|" + std::to_string(::geteuid()) + "|1"));
 }
 
 /// A short session, on a build and with a host application of the test's choice.

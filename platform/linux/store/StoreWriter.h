@@ -21,8 +21,8 @@ struct StoreRetention {
   std::chrono::microseconds age = limits::kStoreAge;
   /// Of the disk, in percent, that the store does not grow into as long as it has so
   /// many bytes.
-  std::int64_t percentKeptFree = 5;
-  std::int64_t bytesInNeed = 16 * 1024 * 1024;
+  std::int64_t percentKeptFree = limits::kDiskPercentKeptFree;
+  std::int64_t bytesInNeed = limits::kStoreBytesInNeed;
 };
 
 /// Writes operations to the database and bears its faults. What was handed over
