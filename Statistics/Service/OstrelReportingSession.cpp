@@ -312,7 +312,7 @@ void OstrelReportingSession::sendMessage(Dictionary message, MessageCategory cat
 void OstrelReportingSession::deliverStep(const Dictionary& message,
                                          MessageCategory category, MessageType type,
                                          const ErrorReply& reply) {
-  const auto [details, list, configuredUserInfo] = takeDelivery();
+  const auto [details, list, configuredUserInfo] = propertiesOnQueue();
   const Dictionary userInfo =
       configuredUserInfo != nullptr ? configuredUserInfo->snapshot() : Dictionary();
   const PayloadSurvey survey(message);
@@ -358,7 +358,8 @@ void OstrelReportingSession::fetchAhead(int stage) const noexcept {
   }
 }
 
-OstrelReportingSession::Delivery OstrelReportingSession::takeDelivery() const {
+OstrelReportingSession::PropertiesOnQueue OstrelReportingSession::propertiesOnQueue()
+    const {
   Details* made = details_.get();
   if (made == nullptr) {
     const std::lock_guard lock(mutex_);
@@ -373,12 +374,12 @@ OstrelReportingSession::Delivery OstrelReportingSession::takeDelivery() const {
 // [KeepsSharedCounterForEqualNames]
 std::string OstrelReportingSession::messageIdForCategory(MessageCategory category,
                                                          MessageType type) {
-  Details& details = takeDelivery().details;
+  Details& details = propertiesOnQueue().details;
   return std::string(details.messageTypeCounts.next(messageNames(category, type)).text());
 }
 
 std::map<std::string, std::int64_t> OstrelReportingSession::messageTypeCounts() const {
-  return takeDelivery().details.messageTypeCounts.byName();
+  return propertiesOnQueue().details.messageTypeCounts.byName();
 }
 
 void OstrelReportingSession::sendToBackend(const Dictionary& message,

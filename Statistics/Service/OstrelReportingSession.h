@@ -200,14 +200,14 @@ class OstrelReportingSession final
   Details& details() const;  // With the lock held.
   std::shared_ptr<AggregatedPayloadData> makeList() const;
 
-  /// What a delivery needs of the properties. They are only replaced on the session's
-  /// queue, so that there is neither a lock nor a reference to take (30 ns a message).
-  struct Delivery {
+  /// The properties on the session's queue. They are only replaced there, so that there
+  /// is neither a lock nor a reference to take (30 ns a message).
+  struct PropertiesOnQueue {
     Details& details;
     AggregatedPayloadData* list;        // May be none.
     const MutableDictionary* userInfo;  // May be none.
   };
-  Delivery takeDelivery() const OSTREL_ON_QUEUE(*sessionReportingQueue_);
+  PropertiesOnQueue propertiesOnQueue() const OSTREL_ON_QUEUE(*sessionReportingQueue_);
   std::shared_ptr<MutableDictionary> mutableUserInfo();
 
   void fetchAhead(int stage) const noexcept override;

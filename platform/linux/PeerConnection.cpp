@@ -404,9 +404,11 @@ std::shared_ptr<void> PeerConnection::invalidate() {
   if (ending_ == Ending::kFarewell) channel_->flush(socket_.get());
   channel_->close();
   socket_.reset();
-  if (ending_ != Ending::kFarewell && ending_ != Ending::kNone && interrupted_) {
-    interrupted_();
-  }
+  // Whoever never was served is not interrupted.
+  const bool isInterrupted = ending_ == Ending::kVanished ||
+                             ending_ == Ending::kBrokenRules ||
+                             (ending_ == Ending::kRefused && isResumed_);
+  if (isInterrupted && interrupted_) interrupted_();
   if (invalidated_) invalidated_();
   interrupted_ = nullptr;
   invalidated_ = nullptr;

@@ -62,6 +62,7 @@ class PeerConnection final : public IPCConnection {
     kFarewell,     // The client ended well.
     kVanished,     // It went away without a word.
     kBrokenRules,  // It is told why and cut off.
+    kRefused,      // It is told why: the service cannot or will not serve it.
   };
 
   PeerConnection(ID id, FileDescriptor socket, PeerIdentity peer,

@@ -63,7 +63,7 @@ class SpillFile {
   /// release. None when it cannot be written or could not be a moment ago.
   std::optional<Extent> write(std::span<const Bytes> parts);
 
-  /// Reads an extent that is not released meanwhile. Else the error.
+  /// Reads an extent that is not released meanwhile. None when it was read.
   std::optional<ErrorObject> read(Extent extent, std::uint8_t* to);
 
   /// Gives the extents' room on the disk back.

@@ -349,7 +349,7 @@ void UnixSocketIPCListener::watch(PeerConnection& connection) {
                                             : EPOLL_CTL_MOD;
   if (::epoll_ctl(epoll_.get(), operation, connection.socket(), &event) != 0) {
     OSTREL_LOG_ERROR(processLogScope, "a connection cannot be watched: error %i", errno);
-    connection.breakOff(PeerConnection::Ending::kBrokenRules, "the service is full");
+    connection.breakOff(PeerConnection::Ending::kRefused, "the service is full");
     end(connection);
     return;
   }
@@ -426,7 +426,7 @@ void UnixSocketIPCListener::accept(FileDescriptor socket) {
   const bool isAccepted = delegate_ != nullptr &&
                           delegate_->listenerShouldAcceptNewConnection(*this, connection);
   if (!isAccepted || !connection->isResumed()) {
-    connection->breakOff(PeerConnection::Ending::kFarewell, "the service refused");
+    connection->breakOff(PeerConnection::Ending::kRefused, "the service refused");
     end(*connection);
     return;
   }

@@ -24,6 +24,16 @@ using namespace testing_support;
 using testing::ElementsAre;
 using testing::HasSubstr;
 
+TEST_F(UnixSocketListener, TellsAClientThatItIsRefusedAndInterruptsNobody) {
+  isRefusing = true;
+  serve();
+  RawClient client(path);
+  EXPECT_EQ(client.receiveClosing(), "the service refused");
+  EXPECT_TRUE(client.isEnded());
+  EXPECT_THAT(eventsAfter(1), ElementsAre("invalidated"));
+  EXPECT_EQ(misuse->counts(), MisuseLog::Counts()) << "it did nothing wrong";
+}
+
 TEST_F(UnixSocketListener, CarriesOutRequestsInTheirOrder) {
   serve();
   RawClient client(path);
