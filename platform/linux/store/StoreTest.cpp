@@ -245,6 +245,7 @@ TEST_F(StoreTest, DropsAnalyticsEventsBeyondTheBoundAndCountsThem) {
   options.queuedEvents = 3;
   options.commitWindow = std::chrono::hours(1);
   open(options);
+  settle();  // The writer has had its first look, and waits.
   for (int i = 0; i < 5; ++i) {
     analytics_->sendEventLazy("a", [] { return Dictionary(); });
   }
