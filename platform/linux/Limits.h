@@ -115,8 +115,10 @@ inline constexpr std::size_t kHalfFrameBytesOfAll = 16 * 1024 * 1024;
 inline constexpr std::size_t kUserInfoBytesOfAll = 24 * 1024 * 1024;
 inline constexpr std::size_t kMemoryBytesOfAll = 24 * 1024 * 1024;
 
-/// Parts of those totals, one of which each user has in any case.
-/// [MemoryOfUsers.LeavesOneWithLittleItsReserve]
+/// Parts of those totals, and of those of sessions and of bytes kept for summaries, one
+/// of which each user has in any case.
+/// [MemoryOfUsers.LeavesOneWithLittleItsReserve,
+/// UserAccount.HasItsPartOfTheServicesShareWhateverTheOthersHave]
 inline constexpr std::size_t kUsersInReserve = 16;
 
 /// Bytes of the entries that sessions keep for their summaries, in all, and of the

@@ -27,6 +27,7 @@ class Share {
 
   void give(std::size_t amount) noexcept { used_ -= amount; }
 
+  std::size_t most() const { return most_; }
   std::size_t used() const { return used_.load(); }
 
  private:

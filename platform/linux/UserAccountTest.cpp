@@ -108,6 +108,29 @@ TEST(UserAccount, KeepsBytesUpToTheUsersShareAndTheServices) {
   EXPECT_TRUE(two.keep(500));
 }
 
+TEST(UserAccount, HasItsPartOfTheServicesShareWhateverTheOthersHave) {
+  constexpr std::size_t kPart = 3;
+  constexpr std::size_t kAll = kPart * limits::kUsersInReserve;
+  const auto service = serviceWith(/*sessions=*/kAll, /*keptBytes=*/kAll);
+  const UserAccount::Limits limits{/*queuedBytes=*/0, /*sessions=*/kAll,
+                                   /*keptBytes=*/kAll};
+  UserAccount big(limits, service);
+  UserAccount little(limits, service);
+  for (std::size_t i = 0; i < kAll; ++i) EXPECT_TRUE(big.takeSession());
+  EXPECT_TRUE(big.keep(kAll));
+  for (std::size_t i = 0; i < kPart; ++i) {
+    EXPECT_TRUE(little.takeSession()) << i;
+    EXPECT_TRUE(little.keep(1)) << i;
+  }
+  EXPECT_FALSE(little.takeSession());
+  EXPECT_FALSE(little.keep(1));
+  EXPECT_FALSE(big.takeSession());
+  little.giveSessions(kPart);
+  little.discard(kPart);
+  EXPECT_FALSE(big.keep(1));
+  EXPECT_EQ(little.sessionsOfAll(), kAll);
+}
+
 class CrowdedUser : public testing::Test {
  protected:
   static UserAccount::Limits limits() {
