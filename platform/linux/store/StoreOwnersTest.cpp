@@ -194,6 +194,20 @@ TEST_F(OwnersOfRows, LetTheNextLoseRowsWhereNoneOfTheirsMayGo) {
   EXPECT_EQ(one("SELECT max(id), count(*) < 2500 FROM telemetry_messages"), "3000|1");
 }
 
+TEST_F(OwnersOfRows, AreBorneHoweverSomebodyMeddledWithThem) {
+  open(optionsOfSmallStore());
+  TelemetrySession& session = begin(1);
+  send(session, 1, 1000);
+  OtherConnection(path()).run(
+      "UPDATE row_owners SET bytes = -5;"
+      "INSERT OR REPLACE INTO row_owners VALUES "
+      "(0, -9223372036854775808, 9223372036854775807, 1, 9223372036854775807),"
+      "(1, 5, 1, 1, 1e300), (3, -9223372036854775808, -5, 1, 'text'), (7, 1, 1, 1, 1);"
+      "INSERT OR REPLACE INTO owner_bytes VALUES (1, 9223372036854775807), (77, 9e300)");
+  for (int round = 0; round < 10; ++round) send(session, 1, 400);
+  EXPECT_EQ(one("SELECT max(id), count(*) < 4000 FROM telemetry_messages"), "5000|1");
+}
+
 TEST_F(OwnersOfRows, AreForgottenWithRowsThatAreTooOld) {
   std::atomic<std::int64_t> now{1'000'000};
   StoreOptions options;
