@@ -36,7 +36,7 @@ JournalLog::~JournalLog() {
     const std::lock_guard lock(mutex_);
     isStopping_ = true;
   }
-  changed_.notify_all();
+  hasWork_.notify_all();
   const std::uint64_t one = 1;
   if (::write(stopEvent_.get(), &one, sizeof one) < 0) std::abort();
   if (writer_.joinable()) writer_.join();
@@ -61,17 +61,45 @@ void JournalLog::write(const LogLine& line) {
   LogLine cut = line;
   cut.text = cut.text.substr(0, kMostLineBytes);
   std::size_t written = 0;
-  const std::lock_guard lock(mutex_);
-  if (isDrained() && sink_->tryWrite(cut, written) != LogSink::Result::kWouldBlock) {
+  std::unique_lock lock(mutex_);
+  if (isDrained()) {
+    if (writeUnlocked(lock, cut, written) == LogSink::Result::kWouldBlock) {
+      waiting_.push_front({cut.level, cut.scopeCode, std::string(cut.text), written});
+      waitingBytes_ += cut.text.size();
+      startWriter();
+    } else if (!isDrained()) {
+      drainSome(lock);
+    }
     return;
   }
+  // The writer is another thread, not the reader: it makes room.
+  ++waiters_;
+  hasWritten_.wait(lock, [&] { return !isWriting_ || fits(cut.text); });
+  --waiters_;
   if (lostLines_ != 0) keepLoss();
-  if (lostLines_ != 0 || waitingBytes_ + cut.text.size() > kMostWaitingBytes) {
+  if (lostLines_ != 0 || !fits(cut.text)) {
     ++lostLines_;
   } else {
     keep({cut.level, cut.scopeCode, std::string(cut.text), written});
   }
-  startWriter();
+  if (isBlocked_) {
+    startWriter();
+  } else if (!isWriting_) {
+    drainSome(lock);
+  }
+}
+
+// The line is nobody else's meanwhile.
+LogSink::Result JournalLog::writeUnlocked(std::unique_lock<std::mutex>& lock,
+                                          const LogLine& line, std::size_t& written) {
+  isWriting_ = true;
+  lock.unlock();
+  const LogSink::Result result = sink_->tryWrite(line, written);
+  lock.lock();
+  isWriting_ = false;
+  isBlocked_ = result == LogSink::Result::kWouldBlock;
+  if (waiters_ != 0) hasWritten_.notify_all();
+  return result;
 }
 
 void JournalLog::keep(WaitingLine line) {
@@ -90,20 +118,27 @@ void JournalLog::keepLoss() {
   lostLines_ = 0;
 }
 
-// Writes what waits, oldest first, until the sink would block or the others have
-// waited long enough for the lock.
-void JournalLog::drainSome() {
+// Writes what waits, oldest first, until the sink would block or it is the writer
+// thread's turn to go on.
+void JournalLog::drainSome(std::unique_lock<std::mutex>& lock) {
   constexpr int kMostLines = 32;
   for (int i = 0; i < kMostLines && !isDrained(); ++i) {
     if (waiting_.empty()) keepLoss();
-    WaitingLine& first = waiting_.front();
-    const auto result =
-        sink_->tryWrite({first.level, first.scopeCode, first.text}, first.written);
-    if (result == LogSink::Result::kWouldBlock) return;
-    waitingBytes_ -= first.text.size();
+    WaitingLine first = std::move(waiting_.front());
     waiting_.pop_front();
+    const auto result =
+        writeUnlocked(lock, {first.level, first.scopeCode, first.text}, first.written);
+    if (result == LogSink::Result::kWouldBlock) {
+      waiting_.push_front(std::move(first));
+      break;
+    }
+    waitingBytes_ -= first.text.size();
   }
-  if (isDrained()) changed_.notify_all();
+  if (!isDrained()) {
+    startWriter();
+  } else if (waiters_ != 0) {
+    hasWritten_.notify_all();
+  }
 }
 
 void JournalLog::startWriter() {
@@ -111,32 +146,36 @@ void JournalLog::startWriter() {
     try {
       writer_ = startThread("log", /*niceness=*/0, [this] { runWriter(); });
     } catch (const std::system_error&) {
-      drainSome();  // The next line tries again to start the thread.
+      // The next line tries again to start the thread, and to write.
+      isBlocked_ = false;
     }
   }
-  changed_.notify_all();
+  hasWork_.notify_one();
 }
 
 void JournalLog::runWriter() {
   std::unique_lock lock(mutex_);
-  while (!isStopping_) {
-    drainSome();
-    if (isDrained()) {
-      changed_.wait(lock, [this] { return isStopping_ || !isDrained(); });
-      continue;
-    }
+  for (;;) {
+    hasWork_.wait(lock, [this] { return isStopping_ || (!isDrained() && !isWriting_); });
+    if (isStopping_) return;
+    if (!isBlocked_) drainSome(lock);
+    if (!isBlocked_) continue;
     pollfd descriptors[] = {{sink_->descriptor(), POLLOUT, 0},
                             {stopEvent_.get(), POLLIN, 0}};
     lock.unlock();
     ::poll(descriptors, std::size(descriptors), /*timeout=*/-1);
     lock.lock();
+    isBlocked_ = false;
   }
 }
 
 bool JournalLog::flush(std::chrono::nanoseconds timeout) {
   std::unique_lock lock(mutex_);
-  if (!isDrained()) startWriter();
-  return changed_.wait_for(lock, timeout, [this] { return isDrained(); });
+  if (!isDrained() && !isWriting_) startWriter();
+  ++waiters_;
+  const bool isOut = hasWritten_.wait_for(lock, timeout, [this] { return isDrained(); });
+  --waiters_;
+  return isOut;
 }
 
 }  // namespace ostrel

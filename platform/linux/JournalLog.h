@@ -37,10 +37,12 @@ class LogSink {
 /// The system log by the journal, or by lines on standard error.
 ///
 /// A line is written at once, on the calling thread, as long as the reader keeps
-/// up. When it does not, lines wait in order in `kMostWaitingBytes` of memory for
-/// a thread that is started then; what does not fit is dropped, and a line says
-/// how many were lost at the place where they were lost. No caller ever waits for
-/// the reader.
+/// up. While another thread writes one, lines wait for that thread, which writes
+/// them too: nobody waits for another's call to the system. When the reader does not
+/// keep up, they wait for a thread that is started then. They wait in order, in
+/// `kMostWaitingBytes` of memory. What does not fit is dropped where it is the reader
+/// who is slow, and a line says how many were lost at the place where they were lost.
+/// No caller ever waits for the reader.
 class JournalLog final : public ScopedLog {
  public:
   static constexpr std::size_t kMostWaitingBytes = limits::kLogWaitingBytes;
@@ -76,21 +78,30 @@ class JournalLog final : public ScopedLog {
     std::size_t written;
   };
 
-  bool isDrained() const { return waiting_.empty() && lostLines_ == 0; }
+  bool isDrained() const { return waiting_.empty() && lostLines_ == 0 && !isWriting_; }
+  bool fits(std::string_view text) const {
+    return waitingBytes_ + text.size() <= kMostWaitingBytes;
+  }
+  LogSink::Result writeUnlocked(std::unique_lock<std::mutex>& lock, const LogLine& line,
+                                std::size_t& written);
   void keep(WaitingLine line);
   void keepLoss();
-  void drainSome();
+  void drainSome(std::unique_lock<std::mutex>& lock);
   void startWriter();
   void runWriter();
 
-  const std::unique_ptr<LogSink> sink_;
+  const std::unique_ptr<LogSink> sink_;  // Whoever set `isWriting_` uses it.
   FileDescriptor stopEvent_;
 
-  std::mutex mutex_;  // Guards all below and the use of the sink.
-  std::condition_variable changed_;
+  std::mutex mutex_;                 // Guards all below.
+  std::condition_variable hasWork_;  // For the writer's thread.
+  std::condition_variable hasWritten_;
+  int waiters_ = 0;  // For `hasWritten_`.
   std::deque<WaitingLine> waiting_;
   std::size_t waitingBytes_ = 0;
   std::uint64_t lostLines_ = 0;
+  bool isWriting_ = false;
+  bool isBlocked_ = false;  // The reader is to be waited for.
   bool isStopping_ = false;
   std::thread writer_;
 };

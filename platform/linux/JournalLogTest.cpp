@@ -6,10 +6,12 @@
 #include <sys/socket.h>
 
 #include <array>
+#include <atomic>
 #include <csignal>
 #include <cstdlib>
 #include <cstring>
 #include <filesystem>
+#include <semaphore>
 #include <sstream>
 #include <thread>
 #include <vector>
@@ -272,6 +274,71 @@ TEST_F(JournalLogLines, OfManyThreadsStayWholeAndInEachThreadsOrder) {
     ++seen;
   }
   EXPECT_EQ(seen, kThreads * kLinesOfThread);
+}
+
+/// Holds the first line's call until it is let go, and keeps what it is given.
+class HeldSink final : public LogSink {
+ public:
+  struct State {
+    std::binary_semaphore isHeld{0};
+    std::binary_semaphore mayGoOn{0};
+    std::vector<std::string> lines;  // The caller's at a time.
+  };
+  explicit HeldSink(State& state) : state_(state) {}
+  Result tryWrite(const LogLine& line, std::size_t& /*written*/) override {
+    if (state_.lines.empty()) {
+      state_.isHeld.release();
+      state_.mayGoOn.acquire();
+    }
+    state_.lines.emplace_back(line.text);
+    return Result::kWritten;
+  }
+  int descriptor() const override { return -1; }
+
+ private:
+  State& state_;
+};
+
+/// A thread is in a call that writes the line "held".
+class JournalLogHeld : public testing::Test {
+ protected:
+  JournalLogHeld() { state_.isHeld.acquire(); }
+  ~JournalLogHeld() override {
+    if (holder_.joinable()) letGo();
+  }
+  void letGo() {
+    state_.mayGoOn.release();
+    holder_.join();
+  }
+
+  HeldSink::State state_;
+  JournalLog log_{std::make_unique<HeldSink>(state_)};
+  std::thread holder_{[this] { log_.write(line("held")); }};
+};
+
+TEST_F(JournalLogHeld, LetsOthersGoOnAndWritesTheirLinesInOrder) {
+  for (int i = 0; i < 100; ++i) log_.write(line(std::to_string(i)));
+  EXPECT_FALSE(log_.flush(std::chrono::nanoseconds(1)));
+  letGo();
+  EXPECT_TRUE(log_.flush(std::chrono::minutes(1)));
+  ASSERT_EQ(state_.lines.size(), 101u);
+  for (std::size_t i = 1; i < state_.lines.size(); ++i) {
+    EXPECT_EQ(state_.lines[i], std::to_string(i - 1));
+  }
+}
+
+TEST_F(JournalLogHeld, LosesNothingThoughMoreComesThanMayWait) {
+  const std::string text(1000, 'x');
+  const std::size_t lines = 2 * JournalLog::kMostWaitingBytes / text.size();
+  std::atomic<std::size_t> given{0};
+  std::thread writer([&] {
+    for (; given < lines; ++given) log_.write(line(text));
+  });
+  while (given < JournalLog::kMostWaitingBytes / text.size()) std::this_thread::yield();
+  letGo();
+  writer.join();
+  EXPECT_TRUE(log_.flush(std::chrono::minutes(1)));
+  EXPECT_EQ(state_.lines.size(), lines + 1);
 }
 
 class JournalLogJournal : public testing::Test {

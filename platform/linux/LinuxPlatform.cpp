@@ -40,6 +40,9 @@ constexpr std::chrono::milliseconds kLogFarewell{200};
 // How soon the status shows what clients were cut short of.
 constexpr std::chrono::seconds kStatusDelay{1};
 
+// How long the last lines are waited for when a client ends the service.
+constexpr std::chrono::milliseconds kLogFarewellOfKill{50};
+
 // Once the store is known, no session waits for it any more.
 void awaitStore(Store& store, std::chrono::steady_clock::time_point deadline) {
   const auto known = std::make_shared<std::promise<void>>();
@@ -135,7 +138,9 @@ LinuxPlatform::LinuxPlatform(std::unique_ptr<Bindings> bindings)
       InotifyChangeNotification::systemDirectory());
   platform_.userDefaults =
       std::make_shared<JSONUserDefaults>(JSONUserDefaults::systemDirectory());
-  platform_.processInfo = std::make_shared<ProcProcessInfo>(bindings_->peers);
+  platform_.processInfo = std::make_shared<ProcProcessInfo>(
+      bindings_->peers, "/proc",
+      [log = bindings_->log] { log->flush(kLogFarewellOfKill); });
   platform_.deviceInfo = std::make_shared<EtcDeviceInfo>(EtcDeviceInfo::systemFiles());
   platform_.telemetryBackend = std::make_shared<StoreTelemetryBackend>(bindings_->store);
   platform_.analyticsSink = std::make_shared<StoreAnalyticsSink>(bindings_->store);

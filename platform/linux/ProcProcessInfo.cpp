@@ -27,8 +27,11 @@ FileDescriptor openProcess(ProcessID pid) {
 }
 
 ProcProcessInfo::ProcProcessInfo(std::shared_ptr<PeerRegistry> peers,
-                                 std::string procDirectory)
-    : peers_(std::move(peers)), procDirectory_(std::move(procDirectory)) {}
+                                 std::string procDirectory,
+                                 std::function<void()> farewell)
+    : peers_(std::move(peers)),
+      procDirectory_(std::move(procDirectory)),
+      farewell_(std::move(farewell)) {}
 
 ProcessID ProcProcessInfo::processIdentifier() const { return ::getpid(); }
 
@@ -64,6 +67,9 @@ std::optional<std::string> ProcProcessInfo::readCommandName(ProcessID pid) const
   return name;
 }
 
-void ProcProcessInfo::endProcess(int status) { ::_exit(status); }
+void ProcProcessInfo::endProcess(int status) {
+  if (farewell_) farewell_();
+  ::_exit(status);
+}
 
 }  // namespace ostrel

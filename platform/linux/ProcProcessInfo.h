@@ -1,5 +1,6 @@
 #pragma once
 
+#include <functional>
 #include <memory>
 #include <optional>
 #include <string>
@@ -13,9 +14,11 @@ namespace ostrel {
 /// live, so that it is never that of a later process with the same id.
 class ProcProcessInfo final : public ProcessInfo {
  public:
-  /// `procDirectory` is "/proc" but in tests.
+  /// `procDirectory` is "/proc" but in tests. `farewell` is called before the process
+  /// ends by `endProcess`.
   explicit ProcProcessInfo(std::shared_ptr<PeerRegistry> peers,
-                           std::string procDirectory = "/proc");
+                           std::string procDirectory = "/proc",
+                           std::function<void()> farewell = nullptr);
 
   ProcessID processIdentifier() const override;
   std::string processName() const override;
@@ -32,6 +35,7 @@ class ProcProcessInfo final : public ProcessInfo {
 
   const std::shared_ptr<PeerRegistry> peers_;
   const std::string procDirectory_;
+  const std::function<void()> farewell_;
 };
 
 /// Opens a descriptor of a running process; none when there is none.

@@ -4,6 +4,7 @@
 #include <unistd.h>
 
 #include <chrono>
+#include <cstdio>
 #include <filesystem>
 #include <memory>
 #include <optional>
@@ -83,6 +84,14 @@ TEST(ProcProcessInfo, PassesOverANameThatIsNotText) {
   EXPECT_EQ(ProcProcessInfo(std::make_shared<PeerRegistry>(), proc.path())
                 .commandName(sleeper.pid()),
             std::nullopt);
+}
+
+TEST(ProcProcessInfo, SaysFarewellBeforeItEndsTheProcess) {
+  GTEST_FLAG_SET(death_test_style, "threadsafe");
+  const auto farewell = [] { std::fputs("farewell", stderr); };
+  EXPECT_EXIT(
+      ProcProcessInfo(std::make_shared<PeerRegistry>(), "/proc", farewell).endProcess(2),
+      testing::ExitedWithCode(2), "farewell");
 }
 
 }  // namespace
