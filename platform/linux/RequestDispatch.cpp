@@ -184,6 +184,12 @@ constexpr bool rowsStandInOrder() {
 }
 static_assert(rowsStandInOrder(), "handlers and operations are one table");
 
+// A configuration of nothing for nobody changes nothing, is answered with YES and costs
+// the same however many sessions there are.
+void changeNothing(Protocol& object, Reply reply) {
+  object.setConfiguration(/*configuration=*/std::nullopt, kNoReporter, std::move(reply));
+}
+
 }  // namespace
 
 void dispatchRequest(OstrelReportingServiceProtocol& object,
@@ -199,13 +205,11 @@ void dispatchRequest(OstrelReportingServiceProtocol& object,
   kHandlers[row].call(object, request, Reply(std::move(ticket)));
 }
 
-// A configuration of nothing for nobody changes nothing and is answered with YES.
 void dispatchRefusedSession(OstrelReportingServiceProtocol& object,
                             const std::shared_ptr<PeerChannel>& channel,
                             const wire::Request& request) {
-  object.setConfiguration(
-      /*configuration=*/std::nullopt, kNoReporter,
-      Reply(ticketFor(channel, request.number, costOf(request, *channel))));
+  changeNothing(object,
+                Reply(ticketFor(channel, request.number, costOf(request, *channel))));
 }
 
 bool keepsReply(wire::Operation operation) {
@@ -220,7 +224,7 @@ bool onlyAsks(wire::Operation operation) {
 
 void dispatchProbe(OstrelReportingServiceProtocol& object,
                    const std::shared_ptr<PeerChannel>& channel) {
-  object.getAllReporters(Reply(ticketFor(channel, /*number=*/0, limits::kRequestBytes)));
+  changeNothing(object, Reply(ticketFor(channel, /*number=*/0, limits::kRequestBytes)));
 }
 
 }  // namespace ostrel

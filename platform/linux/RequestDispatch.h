@@ -28,8 +28,8 @@ bool keepsReply(wire::Operation operation);
 /// Whether an operation changes nothing: without anybody to reply to, it need not run.
 bool onlyAsks(wire::Operation operation);
 
-/// Queues a question on `object` whose only purpose is to learn when everything
-/// before it has run.
+/// Queues a request on `object` that changes nothing; its only purpose is to learn when
+/// everything before it has run.
 void dispatchProbe(OstrelReportingServiceProtocol& object,
                    const std::shared_ptr<PeerChannel>& channel);
 
