@@ -22,10 +22,14 @@ class FairLine {
   static constexpr std::uint64_t kTimeForWork = 20;  // Of which one part is little.
   /// That may be asked for at once.
   static constexpr std::uint64_t kSavedWork = 1'000'000;
+  /// Whoever asked for more at its last turn asks for much, however rarely it comes.
+  static constexpr std::uint64_t kLittleAtOnce = 200'000;
   /// Of one that is new: a tenth of a second.
   static constexpr std::uint64_t kDebtOfNew = 5'000'000;
-  /// So many that ask for little may go before one that does not.
-  static constexpr int kLightInARow = 16;
+  /// Work of those that ask for little, after which one goes that does not.
+  static constexpr std::uint64_t kLightWorkInARow = 1'000'000;
+  /// Of each turn of theirs at least.
+  static constexpr std::uint64_t kLeastWork = 1000;
 
   /// What the line knows of one that comes again and again. Its owner keeps it.
   class Place {
@@ -37,6 +41,7 @@ class FairLine {
     std::uint64_t next_ = 0;
     std::uint64_t debt_ = 0;  // At `asOf_`.
     std::uint64_t asOf_ = 0;
+    std::uint64_t last_ = 0;  // Work of its last turn.
     bool isInLine_ = false;
   };
 
@@ -58,23 +63,30 @@ class FairLine {
     if (place.isInLine_) return;
     place.isInLine_ = true;
     payOff(place);
-    if (place.debt_ <= kSavedWork) {
+    if (place.debt_ <= kSavedWork && place.last_ <= kLittleAtOnce) {
       light_.push(id);
     } else {
       others_.push({std::max(place.next_, now_), entered_++, id});
     }
   }
 
+  /// Whether the next is one that asks for little.
+  bool isNextLight() const {
+    return !light_.empty() && (others_.empty() || lightWork_ < kLightWorkInARow);
+  }
+
   /// The next, which is out of line then: `leave` says so to its place.
   std::optional<ID> take() {
     if (empty()) return std::nullopt;
-    if (!light_.empty() && (others_.empty() || lightInARow_ < kLightInARow)) {
-      ++lightInARow_;
+    if (isNextLight()) {
+      isLightTurn_ = true;
+      lightWork_ += kLeastWork;
       const ID first = light_.front();
       light_.pop();
       return first;
     }
-    lightInARow_ = 0;
+    isLightTurn_ = false;
+    lightWork_ = 0;
     const Waiting first = others_.top();
     others_.pop();
     now_ = first.start;
@@ -88,6 +100,8 @@ class FairLine {
   void use(Place& place, std::uint64_t work) {
     payOff(place);
     place.debt_ += work;
+    place.last_ = work;
+    if (isLightTurn_) lightWork_ += work;
     place.next_ = std::max(place.next_, now_) + work;
   }
 
@@ -109,7 +123,8 @@ class FairLine {
 
   std::queue<ID> light_;
   std::priority_queue<Waiting, std::vector<Waiting>, std::greater<>> others_;
-  int lightInARow_ = 0;
+  std::uint64_t lightWork_ = 0;  // In a row.
+  bool isLightTurn_ = false;     // That of whom was taken last.
   std::uint64_t time_ = 0;
   std::uint64_t now_ = 0;  // In work: the place of who was taken last.
   std::uint64_t entered_ = 0;

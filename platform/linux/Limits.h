@@ -63,15 +63,16 @@ inline constexpr std::size_t kQueuedBytesOfUser = 16 * 1024 * 1024;
 /// What a connection may have of that when the user's other connections have it all: a
 /// client with a request or two is served however much the others sent.
 /// [UnixSocketListener.ServesAClientWithLittleUnderWayHoweverMuchItsUserHas]
-inline constexpr std::size_t kReservedQueuedBytes = 8 * 1024;
+inline constexpr std::size_t kReservedQueuedBytes = 2 * 1024;
 
-/// That of all the user's connections together, where these are few: then each has its
-/// part of it, `kMostReservedBytes` at most. A client with some requests a moment is
-/// served while others have all that they may.
-/// [PeerChannelBudget.ReservesMoreWhereConnectionsAreFew]
-inline constexpr std::size_t kReservedQueuedBytesOfUser =
-    kConnectionsOfUser * kReservedQueuedBytes;
-inline constexpr std::size_t kMostReservedBytes = 64 * 1024;
+/// That of all the user's processes together. Each that has any has its part of it, and
+/// its connections have that among them, `kMostReservedBytes` at most each. A client with
+/// some requests a moment is served while others have all that they may, however many
+/// connections they have.
+/// [PeerChannelReserve.IsMoreWhereProcessesAreFew,
+/// PeerChannelReserve.IsNoMoreForAProcessWithManyConnections]
+inline constexpr std::size_t kReservedQueuedBytesOfUser = 8 * 1024 * 1024;
+inline constexpr std::size_t kMostReservedBytes = 256 * 1024;
 
 /// Bytes of frames that are not whole yet, of all connections of one user: some 25 of
 /// the largest. Beyond it the connection that is in one longest is cut off.
@@ -84,6 +85,13 @@ inline constexpr std::size_t kHalfFrameBytesOfUser = 8 * 1024 * 1024;
 /// UnixSocketListener.MakesAsManySessionsAsAllowedAndAnswersYesForOneMore]
 inline constexpr std::size_t kSessions = 256 * 1024;
 inline constexpr std::size_t kSessionsOfUser = 100 * 1024;
+
+/// Sessions that a user may have however much else its clients have in memory, and how
+/// much that is from which on it may have no more. Whoever has many sessions does not
+/// have many requests that nobody carries out.
+/// [UserAccount.TakesFewerSessionsWhereThereIsMuchElse]
+inline constexpr std::size_t kSessionsInNeed = 16 * 1024;
+inline constexpr std::size_t kMemoryBytesBesideSessions = 8 * 1024 * 1024;
 
 /// What one of them is taken to need in memory as long as it is idle.
 /// [CrowdedUser.HasMoreThanItsMemory]
@@ -166,7 +174,7 @@ inline constexpr std::uint64_t kTurnWork = 500'000;
 /// How long turns are taken before the sockets are looked at again: whoever was quiet
 /// then goes before the rest of the line.
 /// [FairLineOrder.LetsWhoAsksForLittleGoFirst]
-inline constexpr std::chrono::milliseconds kTurnsBetweenLooks{1};
+inline constexpr std::chrono::microseconds kTurnsBetweenLooks{250};
 
 // What sessions are told of themselves
 
@@ -236,7 +244,7 @@ inline constexpr std::size_t kListBytesInMemory = 256 * 1024;
 /// part of what the service may have. Beyond it short lists are in the file alone, and
 /// each longer one has 1 KiB whatever the others have.
 /// [FileEntryStorageTest.RefusesWhatFitsNeitherDiskNorMemory]
-inline constexpr std::size_t kListsBytesInMemory = 12 * 1024 * 1024;
+inline constexpr std::size_t kListsBytesInMemory = 8 * 1024 * 1024;
 
 /// Of that, what waits for more of other sessions so that it is written to the file
 /// together.

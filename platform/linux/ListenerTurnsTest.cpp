@@ -54,7 +54,8 @@ TEST_F(FairLineOrder, TellsLittleFromMuchByWhatWasSaved) {
     FairLine fresh;
     FairLine::Place asking;
     FairLine::Place busy;
-    fresh.use(asking, work);
+    fresh.use(asking, work - 100);
+    fresh.use(asking, 100);
     fresh.introduce(busy);
     fresh.enter(1, busy);
     fresh.enter(2, asking);
@@ -63,7 +64,8 @@ TEST_F(FairLineOrder, TellsLittleFromMuchByWhatWasSaved) {
 }
 
 TEST_F(FairLineOrder, ForgetsWhatWasAskedForInTime) {
-  line.use(places[1], FairLine::kSavedWork + 100);
+  line.use(places[1], FairLine::kSavedWork);
+  line.use(places[1], 100);
   makeBusy(2);
   line.setTime(100 * FairLine::kTimeForWork);
   enter(2);
@@ -85,16 +87,40 @@ TEST_F(FairLineOrder, LetsWhoHadLeastGoFirstOfThoseThatAskForMuch) {
 }
 
 TEST_F(FairLineOrder, LeavesNobodyWithoutATurn) {
-  makeBusy(0);
-  enter(0);
-  std::size_t turns = 0;
-  do {
-    ++turns;
-    ASSERT_LE(turns, kClients);
-    enter(turns);
-  } while (serveNext(0) != 0u);
-  EXPECT_EQ(turns, static_cast<std::size_t>(FairLine::kLightInARow) + 1);
+  constexpr std::uint64_t kPart = FairLine::kLightWorkInARow / 8;
+  for (const std::uint64_t work :
+       {kPart - FairLine::kLeastWork - 1, kPart - FairLine::kLeastWork,
+        kPart - FairLine::kLeastWork + 1}) {
+    line = FairLine();
+    places = {};
+    makeBusy(0);
+    enter(0);
+    std::size_t turns = 0;
+    do {
+      ++turns;
+      ASSERT_LT(turns, kClients);
+      enter(turns);
+      EXPECT_EQ(line.isNextLight(),
+                turns <= (work < kPart - FairLine::kLeastWork ? 9u : 8u));
+    } while (serveNext(work) != 0u);
+    EXPECT_EQ(turns, work < kPart - FairLine::kLeastWork ? 10u : 9u) << work;
+  }
 }
+
+TEST_F(FairLineOrder, TellsWhoAsksForLittleByItsLastTurnToo) {
+  for (const std::uint64_t work : {FairLine::kLittleAtOnce - 1, FairLine::kLittleAtOnce,
+                                   FairLine::kLittleAtOnce + 1}) {
+    FairLine fresh;
+    FairLine::Place asking;
+    fresh.use(asking, work);
+    fresh.setTime(FairLine::kTimeForWork * FairLine::kSavedWork);
+    fresh.enter(1, asking);
+    EXPECT_EQ(fresh.isNextLight(), work <= FairLine::kLittleAtOnce) << work;
+    EXPECT_EQ(fresh.take(), 1u);
+  }
+}
+
+TEST_F(FairLineOrder, HasNobodyNextWhereNobodyIs) { EXPECT_FALSE(line.isNextLight()); }
 
 TEST_F(FairLineOrder, HasEachInItOnce) {
   enter(1);

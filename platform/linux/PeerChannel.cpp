@@ -19,10 +19,12 @@ constexpr std::size_t kKeptCapacity = 512;
 }  // namespace
 
 PeerChannel::PeerChannel(LoopWaker::ConnectionID id, std::shared_ptr<LoopWaker> waker,
-                         std::shared_ptr<UserAccount> user, const Limits& limits)
+                         std::shared_ptr<UserAccount> user, const Limits& limits,
+                         std::shared_ptr<ProcessAccount> process)
     : id_(id),
       waker_(std::move(waker)),
       user_(std::move(user)),
+      process_(process ? std::move(process) : std::make_shared<ProcessAccount>(user_)),
       unreadReplyBytes_(limits.unreadReplyBytes),
       reservedQueuedBytes_(limits.reservedQueuedBytes),
       mostReservedBytes_(limits.mostReservedBytes),
@@ -32,7 +34,7 @@ PeerChannel::PeerChannel(LoopWaker::ConnectionID id, std::shared_ptr<LoopWaker> 
 PeerChannel::~PeerChannel() {
   user_->changeUnread(unread_, /*now=*/0);
   // Whatever could tell that a request ran is gone.
-  if (user_->queued().give(own_.used())) waker_->budgetEased();
+  if (const std::size_t left = own_.used(); left != 0) relieve(left);
 }
 
 void PeerChannel::reply(wire::RequestNumber number, const wire::ReplyValue& value) {
@@ -52,7 +54,7 @@ void PeerChannel::reply(wire::RequestNumber number, const wire::ReplyValue& valu
 }
 
 void PeerChannel::charge(std::size_t bytes) noexcept {
-  own_.take(bytes);
+  if (own_.take(bytes)) process_->addBusyConnection();
   user_->queued().take(bytes);
 }
 
@@ -66,11 +68,12 @@ bool PeerChannel::mayMerge(const Merged& then) noexcept {
 }
 
 void PeerChannel::relieve(std::size_t bytes) noexcept {
-  const bool hasOwnEased = own_.give(bytes);
-  const bool hasUserEased = user_->queued().give(bytes);
+  const RequestBudget::Given own = own_.give(bytes);
+  if (own.isLast) process_->removeBusyConnection();
+  const bool hasUserEased = user_->queued().give(bytes).tellsWaiter;
   const bool hasReserve =
       awaitsReserve_.load() && !isBeyondReserve() && awaitsReserve_.exchange(false);
-  if (hasOwnEased || hasUserEased || hasReserve) waker_->budgetEased();
+  if (own.tellsWaiter || hasUserEased || hasReserve) waker_->budgetEased();
 }
 
 std::uint64_t PeerChannel::chargeRequest(std::size_t bytes) {

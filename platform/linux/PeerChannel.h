@@ -31,8 +31,10 @@ class PeerChannel final : public PayloadAccount {
     std::size_t mostReservedBytes = 0;
   };
 
+  /// Without `process` it is the only connection of its process.
   PeerChannel(LoopWaker::ConnectionID id, std::shared_ptr<LoopWaker> waker,
-              std::shared_ptr<UserAccount> user, const Limits& limits);
+              std::shared_ptr<UserAccount> user, const Limits& limits,
+              std::shared_ptr<ProcessAccount> process = nullptr);
   ~PeerChannel() override;
 
   /// Queues a reply; the loop writes it soon. Nothing once the connection has ended
@@ -100,13 +102,14 @@ class PeerChannel final : public PayloadAccount {
   bool isBeyondReserve(std::size_t uncharged = 0) const {
     const std::size_t used = own_.used() + uncharged;
     return used > reservedQueuedBytes_ &&
-           used > user_->reservedQueuedBytes(reservedQueuedBytes_, mostReservedBytes_);
+           used > process_->reservedQueuedBytes(reservedQueuedBytes_, mostReservedBytes_);
   }
   void updateUnread();
 
   const LoopWaker::ConnectionID id_;
   const std::shared_ptr<LoopWaker> waker_;
   const std::shared_ptr<UserAccount> user_;
+  const std::shared_ptr<ProcessAccount> process_;
   const std::size_t unreadReplyBytes_;
   const std::size_t reservedQueuedBytes_;
   const std::size_t mostReservedBytes_;

@@ -78,26 +78,70 @@ TEST_F(PeerChannelBudget, IsThatOfAllConnectionsOfTheUserToo) {
   EXPECT_FALSE(other.isOverBudget());
 }
 
-TEST_F(PeerChannelBudget, ReservesMoreWhereConnectionsAreFew) {
-  UserAccount::Limits limits{/*queuedBytes=*/100, /*sessions=*/10, /*keptBytes=*/500};
-  limits.reservedQueuedBytes = 40;
-  const auto user = std::make_shared<UserAccount>(limits, service_);
-  user->queued().take(101);
-  const auto mayHave = [&](std::size_t connections, std::size_t bytes) {
-    user->setConnections(connections);
-    PeerChannel channel(1, std::make_shared<LoopWaker>(), user,
-                        PeerChannel::Limits{/*queuedBytes=*/60, kMostUnread,
-                                            /*reservedQueuedBytes=*/5,
-                                            /*mostReservedBytes=*/20});
-    channel.charge(bytes);
-    return !channel.isOverBudget();
-  };
-  EXPECT_TRUE(mayHave(/*connections=*/4, /*bytes=*/10));
-  EXPECT_FALSE(mayHave(/*connections=*/4, /*bytes=*/11));
-  EXPECT_TRUE(mayHave(/*connections=*/1, /*bytes=*/20)) << "that is the most";
-  EXPECT_FALSE(mayHave(/*connections=*/1, /*bytes=*/21));
-  EXPECT_TRUE(mayHave(/*connections=*/100, /*bytes=*/5)) << "that is the least";
-  EXPECT_FALSE(mayHave(/*connections=*/100, /*bytes=*/6));
+/// The user's others have all that they may, and 40 bytes are reserved.
+class PeerChannelReserve : public testing_support::ChannelsOfAUser {
+ protected:
+  static UserAccount::Limits limitsOfUser() {
+    UserAccount::Limits limits = kLimitsOfUser;
+    limits.reservedQueuedBytes = 40;
+    return limits;
+  }
+  PeerChannelReserve() : ChannelsOfAUser(kMostUnread, limitsOfUser()) {
+    user_->queued().take(101);
+  }
+
+  std::shared_ptr<ProcessAccount> makeProcess() const {
+    return std::make_shared<ProcessAccount>(user_);
+  }
+  std::unique_ptr<PeerChannel> connect(const std::shared_ptr<ProcessAccount>& process) {
+    return std::make_unique<PeerChannel>(
+        1, waker_, user_,
+        PeerChannel::Limits{/*queuedBytes=*/60, kMostUnread, /*reservedQueuedBytes=*/5,
+                            /*mostReservedBytes=*/20},
+        process);
+  }
+  /// What a connection may have under way beside `count` that have something.
+  template <typename MakeProcess>
+  std::size_t mostBeside(std::size_t count, MakeProcess processOfOther) {
+    std::vector<std::unique_ptr<PeerChannel>> others;
+    for (std::size_t i = 0; i < count; ++i) {
+      others.push_back(connect(processOfOther()));
+      others.back()->charge(1);
+    }
+    const auto channel = connect(makeProcess());
+    std::size_t bytes = 0;
+    for (; !channel->isOverBudget(); ++bytes) channel->charge(1);
+    return bytes - 1;
+  }
+};
+
+TEST_F(PeerChannelReserve, IsMoreWhereProcessesAreFew) {
+  const auto each = [this] { return makeProcess(); };
+  EXPECT_EQ(mostBeside(0, each), 20u) << "that is the most";
+  EXPECT_EQ(mostBeside(1, each), 20u);
+  EXPECT_EQ(mostBeside(3, each), 10u);
+  EXPECT_EQ(mostBeside(99, each), 5u) << "that is the least";
+}
+
+TEST_F(PeerChannelReserve, IsNoMoreForAProcessWithManyConnections) {
+  const auto process = makeProcess();
+  EXPECT_EQ(mostBeside(99, [&] { return process; }), 20u);
+}
+
+TEST_F(PeerChannelReserve, IsSharedByTheConnectionsOfAProcess) {
+  const auto process = makeProcess();
+  const auto one = connect(process);
+  one->charge(20);
+  EXPECT_FALSE(one->isOverBudget());
+  const auto two = connect(process);
+  two->charge(10);
+  const auto three = connect(process);
+  EXPECT_FALSE(one->isOverBudget()) << "this one has nothing under way";
+  three->charge(1);
+  EXPECT_TRUE(one->isOverBudget()) << "13 for each";
+  EXPECT_FALSE(two->isOverBudget());
+  three->relieve(1);
+  EXPECT_FALSE(one->isOverBudget());
 }
 
 TEST_F(PeerChannelBudget, IsGivenBackWithTheConnectionsRequests) {

@@ -23,6 +23,7 @@ constexpr std::size_t kLeastReadBytes = 4 * 1024;
 // included.
 constexpr std::uint64_t kWorkOfRequest = 2000;
 constexpr std::uint64_t kWorkOfConfiguration = 20'000;
+constexpr std::uint64_t kWorkOfStart = 20'000;  // With the session's thread's.
 constexpr std::uint64_t kWorkOfMessage = 500;
 constexpr std::uint64_t kWorkOfDelivery = 500;
 constexpr std::uint64_t kWorkOfByte = 2;
@@ -45,6 +46,8 @@ std::uint64_t workOf(const wire::Request& request, std::size_t bytes,
       return work + kWorkOfRequest + sessionsOfAll * kWorkOfSessionListed;
     case wire::Operation::kSetConfiguration:
       return work + kWorkOfConfiguration;
+    case wire::Operation::kStartReportingSessionForID:
+      return work + kWorkOfStart;
     default:
       return work + kWorkOfRequest;
   }

@@ -11,11 +11,16 @@ class RequestBudget {
  public:
   explicit RequestBudget(std::size_t most) : most_(most) {}
 
-  void take(std::size_t bytes) noexcept { used_ += bytes; }
+  /// True when nothing was under way before.
+  bool take(std::size_t bytes) noexcept { return used_.fetch_add(bytes) == 0; }
 
-  /// True when a waiter is to be told, which is then no waiter any more.
-  bool give(std::size_t bytes) noexcept {
-    return used_.fetch_sub(bytes) - bytes <= half() && takeWaiter();
+  struct Given {
+    bool tellsWaiter;  // Which is then no waiter any more.
+    bool isLast;       // Nothing is under way now.
+  };
+  Given give(std::size_t bytes) noexcept {
+    const std::size_t left = used_.fetch_sub(bytes) - bytes;
+    return {left <= half() && takeWaiter(), left == 0};
   }
 
   /// From now on so many may be under way; what is beyond it runs off. True as `give`.

@@ -55,6 +55,8 @@ namespace {
 constexpr int kStepsOfTurn = 128;
 /// A batch that has gathered so many strands hands them over.
 constexpr std::size_t kStrandsOfBatch = 64;
+/// So many urgent strands may go before one that is not.
+constexpr int kUrgentInARow = 16;
 /// So many steps for a strand wait for more.
 constexpr int kStepsHeld = 64;
 /// So many strands a thread takes at once, where there are more than that for each.
@@ -102,6 +104,7 @@ struct ThreadPoolWorkQueues::QueueKind {
 /// Lines of strands on their way to a pool.
 struct ThreadPoolWorkQueues::Gathered {
   std::shared_ptr<Pool> pool;
+  bool isUrgent = false;
   std::vector<std::shared_ptr<Strand>> strands;
 };
 
@@ -143,7 +146,7 @@ class ThreadPoolWorkQueues::Pool : public std::enable_shared_from_this<Pool> {
 
  private:
   bool hasEnded() const { return isEnding_ && liveThreads_ == 0; }
-  void append(std::shared_ptr<Strand>&& strand);
+  void append(std::shared_ptr<Strand>&& strand, bool isUrgent = false);
   std::shared_ptr<Strand> takeStrand(Hand& hand);
   bool isAnyInHand() const;
   std::shared_ptr<Strand> takeOver(Hand& hand, bool onlyStuck);
@@ -164,6 +167,8 @@ class ThreadPoolWorkQueues::Pool : public std::enable_shared_from_this<Pool> {
   mutable SmallMutex mutex_;                  // Of what follows.
   Line line_;
   Line lowLine_;  // Of the queues with a priority below 0.
+  Line urgentLine_;
+  int urgentInARow_ = 0;
   std::deque<Task> loose_;
   std::vector<std::thread> threads_;
   std::size_t liveThreads_ = 0;
@@ -461,8 +466,9 @@ ThreadPoolWorkQueues::Pool::Placed ThreadPoolWorkQueues::Pool::place(
   return callThread();
 }
 
-void ThreadPoolWorkQueues::Pool::append(std::shared_ptr<Strand>&& strand) {
-  (strand->isLow() ? lowLine_ : line_).push_back(std::move(strand));
+void ThreadPoolWorkQueues::Pool::append(std::shared_ptr<Strand>&& strand, bool isUrgent) {
+  Line& line = strand->isLow() ? lowLine_ : isUrgent ? urgentLine_ : line_;
+  line.push_back(std::move(strand));
   waiting_.fetch_add(1, std::memory_order_relaxed);
 }
 
@@ -479,7 +485,7 @@ void ThreadPoolWorkQueues::Pool::place(Gathered& gathered) {
            --threads) {
         if (callThread() == Placed::kWakes) ++wakes;
       }
-      for (auto& strand : strands) append(std::move(strand));
+      for (auto& strand : strands) append(std::move(strand), gathered.isUrgent);
       strands.clear();
     }
   }
@@ -545,10 +551,17 @@ bool ThreadPoolWorkQueues::Pool::othersWait() const {
 // With the lock. The others that the thread takes with the first are in its hand.
 std::shared_ptr<ThreadPoolWorkQueues::Strand> ThreadPoolWorkQueues::Pool::takeStrand(
     Hand& hand) {
-  Line& line = line_.empty() ? lowLine_ : line_;
+  const bool isUrgent = !urgentLine_.empty() && (urgentInARow_ < kUrgentInARow ||
+                                                 (line_.empty() && lowLine_.empty()));
+  Line& line = isUrgent ? urgentLine_ : line_.empty() ? lowLine_ : line_;
   if (line.empty()) return nullptr;
   std::shared_ptr<Strand> strand = std::move(line.front());
   line.pop_front();
+  urgentInARow_ = isUrgent ? urgentInARow_ + 1 : 0;
+  if (isUrgent) {
+    waiting_.fetch_sub(1, std::memory_order_relaxed);
+    return strand;
+  }
   // Of those of low priority others might have to go first soon.
   const std::size_t others =
       std::min(line_.size() / (2 * kind_.mostThreads), kStrandsInHand);
@@ -709,7 +722,9 @@ void ThreadPoolWorkQueues::Pool::end() {
 
 thread_local ThreadPoolWorkQueues::Batch* ThreadPoolWorkQueues::currentBatch_ = nullptr;
 
-ThreadPoolWorkQueues::Batch::Batch() { currentBatch_ = this; }
+ThreadPoolWorkQueues::Batch::Batch(Kind kind) : isUrgent_(kind == Kind::kUrgent) {
+  currentBatch_ = this;
+}
 
 ThreadPoolWorkQueues::Batch::~Batch() {
   isRunning_ = true;
@@ -765,6 +780,7 @@ void ThreadPoolWorkQueues::Batch::gather(std::shared_ptr<Strand> strand) {
                            ? **found
                            : *gathered_.emplace_back(std::make_unique<Gathered>());
   if (gathered.pool == nullptr) gathered.pool = pool;
+  gathered.isUrgent = isUrgent_;
   if (gathered.strands.empty()) pool->shared().begin(/*count=*/1);
   gathered.strands.push_back(std::move(strand));
   if (gathered.strands.size() == kStrandsOfBatch) handOver(gathered);

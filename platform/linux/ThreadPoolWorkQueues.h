@@ -80,7 +80,11 @@ class ThreadPoolWorkQueues final : public WorkQueueFactory {
 
 class ThreadPoolWorkQueues::Batch {
  public:
-  Batch();
+  /// `kUrgent`: other idle queues that it queues on go before those that wait for a
+  /// thread of their pool.
+  enum class Kind { kUsual, kUrgent };
+
+  explicit Batch(Kind kind = Kind::kUsual);
   ~Batch();
   Batch(const Batch&) = delete;
   Batch& operator=(const Batch&) = delete;
@@ -102,6 +106,7 @@ class ThreadPoolWorkQueues::Batch {
   void gather(std::shared_ptr<Strand> strand);
   void handOver(Gathered& gathered);
 
+  const bool isUrgent_;
   bool isRunning_ = false;
   std::shared_ptr<Strand> held_;  // Whose steps these are.
   StepList heldSteps_;

@@ -8,6 +8,7 @@
 #include <unistd.h>
 
 #include <algorithm>
+#include <array>
 #include <atomic>
 #include <fstream>
 #include <mutex>
@@ -311,6 +312,69 @@ TEST_F(ThreadPoolWorkQueuesTest, ABatchRunsWhatAReleasedQueueWasGiven) {
   }
   ASSERT_TRUE(drain());
   EXPECT_EQ(ran, 2);
+}
+
+/// One thread for all sessions' queues, which is held until it is let go.
+class ThreadPoolUrgency : public ThreadPoolWorkQueuesTest {
+ protected:
+  ThreadPoolUrgency() {
+    for (auto& [queue, gate] : held_) {
+      queue = makeQueue();
+      queue->async(gate.holdingStep());
+      gate.waitUntilHolding();
+    }
+  }
+  void queueUrgently(const std::function<void()>& step) {
+    const ThreadPoolWorkQueues::Batch batch(ThreadPoolWorkQueues::Batch::Kind::kUrgent);
+    server_->async([&] { step(); });
+  }
+  Task writing(int number) {
+    return [this, number] { ran_.push_back(number); };
+  }
+  std::vector<int> runAll() {
+    std::binary_semaphore isDone{0};
+    last_->async([&] { isDone.release(); });
+    held_[0].gate.open();
+    isDone.acquire();
+    held_[1].gate.open();
+    EXPECT_TRUE(drain());
+    return ran_;
+  }
+
+  const std::shared_ptr<WorkQueue> server_ =
+      makeQueue(QualityOfService::kUserInteractive);
+  const std::shared_ptr<WorkQueue> last_ =
+      makeQueue(QualityOfService::kUtility, /*relativePriority=*/-1);
+  struct Held {
+    std::shared_ptr<WorkQueue> queue;
+    Gate gate;
+  };
+  std::array<Held, ThreadPoolWorkQueues::kMostUtilityThreads> held_;
+  std::vector<int> ran_;
+};
+
+TEST_F(ThreadPoolUrgency, OfABatchGetsItsQueuesBeforeOthers) {
+  const auto usual = makeQueue();
+  const auto urgent = makeQueue();
+  usual->async(writing(2));
+  queueUrgently([&] { urgent->async(writing(1)); });
+  EXPECT_EQ(runAll(), (std::vector<int>{1, 2}));
+}
+
+TEST_F(ThreadPoolUrgency, OfManyLeavesOthersTheirTurns) {
+  constexpr int kInARow = 16;
+  const auto usual = makeQueue();
+  std::vector<std::shared_ptr<WorkQueue>> urgent;
+  usual->async(writing(0));
+  queueUrgently([&] {
+    for (int i = 1; i <= kInARow + 1; ++i) {
+      urgent.push_back(makeQueue());
+      urgent.back()->async(writing(i));
+    }
+  });
+  const std::vector<int> ran = runAll();
+  ASSERT_EQ(ran.size(), kInARow + 2u);
+  EXPECT_EQ(std::ranges::find(ran, 0) - ran.begin(), kInARow);
 }
 
 TEST_F(ThreadPoolWorkQueuesTest, ABatchEntersAQueueThatNobodyUses) {

@@ -28,6 +28,8 @@
 namespace ostrel {
 namespace {
 
+using Batch = ThreadPoolWorkQueues::Batch;
+
 constexpr std::uint64_t kSocketEvent = 0;
 constexpr std::uint64_t kWakerEvent = 1;
 constexpr std::uint64_t kSignalEvent = 2;
@@ -42,6 +44,10 @@ constexpr int kMostEvents = 1024;
 constexpr std::uint64_t kWorkOfAccepting = 25'000;
 constexpr std::uint64_t kWorkOfEnding = 40'000;
 constexpr std::uint64_t kWorkOfSessionsEnd = 2000;
+
+// The accounts of a user's processes are looked through when there are so many more than
+// connections.
+constexpr std::size_t kProcessesKept = 64;
 
 // Few are given up at once: what waits for a thread of lower priority keeps its memory.
 constexpr std::size_t kManySessions = 500;
@@ -144,7 +150,7 @@ void UnixSocketIPCListener::look() {
       std::chrono::nanoseconds(Clock::now().time_since_epoch()).count()));
   shareMemoryOut();
   if (heap_ && count > 0) heap_->noteWork();
-  const ThreadPoolWorkQueues::Batch requests;
+  const Batch requests;
   for (int i = 0; i < count; ++i) {
     const epoll_event& event = events_[static_cast<std::size_t>(i)];
     handleEvent(event.data.u64, event.events);
@@ -186,9 +192,13 @@ void UnixSocketIPCListener::takeTurns() {
   std::optional<Clock::time_point> end;
   for (;;) {
     {
-      const ThreadPoolWorkQueues::Batch requests;
+      // Nobody who asks for little waits for what others ask for in the same batch.
+      const bool isLight = line_.isNextLight();
+      const Batch requests(isLight ? Batch::Kind::kUrgent : Batch::Kind::kUsual);
       std::uint64_t work = 0;
-      while (const auto next = line_.take()) {
+      while (line_.isNextLight() == isLight) {
+        const auto next = line_.take();
+        if (!next) break;
         work += takeTurn(*next);
         if (work >= limits_.turnWork || line_.empty()) break;
         // Where the estimate is wrong.
@@ -199,7 +209,7 @@ void UnixSocketIPCListener::takeTurns() {
     }
     {
       // The requests have been served, and their replies are there.
-      const ThreadPoolWorkQueues::Batch requests;
+      const Batch requests;
       handleWork();
     }
     giveUpEstates();
@@ -365,7 +375,7 @@ void UnixSocketIPCListener::end(PeerConnection& connection) {
   peers_->peerDisconnected(ended->peer().pid, ended->id());
   const auto user = users_.find(ended->peer().user);
   if (user != users_.end()) {
-    user->second.account->setConnections(--user->second.connections);
+    --user->second.connections;
     user->second.account->changeHalfFrames(halfFrameBytes, /*now=*/0);
   }
   const bool isLarge = disposal_ != nullptr && ended->sessions() > kManySessions;
@@ -416,13 +426,14 @@ void UnixSocketIPCListener::accept(FileDescriptor socket) {
   auto channel = std::make_shared<PeerChannel>(
       id, waker_, user.account,
       PeerChannel::Limits{limits_.queuedBytes, limits_.unreadReplyBytes,
-                          limits_.reservedQueuedBytes, limits_.mostReservedBytes});
+                          limits_.reservedQueuedBytes, limits_.mostReservedBytes},
+      user.processAccount(peer.pid));
   auto connection = std::make_shared<PeerConnection>(
       id, std::move(socket), peer, std::move(channel), limits_, *misuse_);
   Watched& watched = connections_[id];
   watched.connection = connection;
   line_.introduce(watched.place);
-  user.account->setConnections(++user.connections);
+  ++user.connections;
   const bool isAccepted = delegate_ != nullptr &&
                           delegate_->listenerShouldAcceptNewConnection(*this, connection);
   if (!isAccepted || !connection->isResumed()) {
@@ -431,6 +442,18 @@ void UnixSocketIPCListener::accept(FileDescriptor socket) {
     return;
   }
   watch(*connection);
+}
+
+// What a connection that has gone left under way still counts for its process.
+std::shared_ptr<ProcessAccount> UnixSocketIPCListener::User::processAccount(
+    ProcessID pid) {
+  if (processes.size() > 2 * connections + kProcessesKept) {
+    std::erase_if(processes, [](const auto& each) { return each.second.expired(); });
+  }
+  std::weak_ptr<ProcessAccount>& known = processes[pid];
+  std::shared_ptr<ProcessAccount> process = known.lock();
+  if (!process) known = process = std::make_shared<ProcessAccount>(account);
+  return process;
 }
 
 bool UnixSocketIPCListener::isWithinLimits(const PeerIdentity& peer, int socket) {

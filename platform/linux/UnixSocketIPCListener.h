@@ -70,6 +70,10 @@ class UnixSocketIPCListener final : public IPCListener {
   struct User {
     std::size_t connections = 0;
     std::shared_ptr<UserAccount> account;
+    /// Those of processes that have gone are left out now and then.
+    std::unordered_map<ProcessID, std::weak_ptr<ProcessAccount>> processes;
+
+    std::shared_ptr<ProcessAccount> processAccount(ProcessID pid);
   };
 
   UnixSocketIPCListener(ServiceSocket socket, std::shared_ptr<PeerRegistry> peers,

@@ -64,6 +64,8 @@ class UserAccount {
     std::size_t halfFrameBytes = limits::kHalfFrameBytesOfUser;
     std::size_t memory = limits::kMemoryBytesOfUser;
     std::size_t reservedQueuedBytes = limits::kReservedQueuedBytesOfUser;
+    std::size_t sessionsInNeed = limits::kSessionsInNeed;
+    std::size_t memoryBesideSessions = limits::kMemoryBytesBesideSessions;
   };
 
   /// `number` is the user's; of nobody in tests.
@@ -73,6 +75,8 @@ class UserAccount {
         memoryLimits_{limits.queuedBytes, limits.unreadBytes, limits.halfFrameBytes,
                       limits.userInfoBytes, limits.memory},
         reservedQueuedBytes_(limits.reservedQueuedBytes),
+        sessionsInNeed_(limits.sessionsInNeed),
+        memoryBesideSessions_(limits.memoryBesideSessions),
         queued_(limits.queuedBytes),
         userInfos_(std::make_shared<UserInfos>(limits.userInfoBytes)),
         service_(std::move(service)),
@@ -84,16 +88,23 @@ class UserAccount {
   /// Bytes of requests that are accepted and not yet carried out.
   RequestBudget& queued() { return queued_; }
 
-  /// How many connections the user has, and what of that each of them may have when the
-  /// others have it all.
-  void setConnections(std::size_t count) noexcept { connections_ = count; }
-  std::size_t reservedQueuedBytes(std::size_t least, std::size_t most) const {
-    return std::clamp(reservedQueuedBytes_ / std::max<std::size_t>(connections_, 1),
-                      least, most);
+  /// How many processes have anything of that, and what of it each of them may have when
+  /// the others have it all.
+  void addBusyProcess() noexcept { ++busyProcesses_; }
+  void removeBusyProcess() noexcept { --busyProcesses_; }
+  std::size_t reservedQueuedBytes() const {
+    return reservedQueuedBytes_ / std::max<std::size_t>(busyProcesses_, 1);
   }
 
-  /// One more session. False: there are as many as the user or the service may have.
-  bool takeSession() noexcept { return takeBoth(sessions_, service_->sessions, 1); }
+  /// One more session. False: there are as many as the user or the service may have, or
+  /// as the user may have where its clients have much else in memory.
+  bool takeSession() noexcept {
+    if (sessions_.used() >= sessionsInNeed_ &&
+        memoryBesideSessions() > memoryBesideSessions_) {
+      return false;
+    }
+    return takeBoth(sessions_, service_->sessions, 1);
+  }
   void giveSessions(std::size_t count) noexcept {
     giveBoth(sessions_, service_->sessions, count);
   }
@@ -133,8 +144,7 @@ class UserAccount {
   /// What all that takes in memory, roughly, and whether that is too much: then each
   /// kind has only a part of its share until it is not.
   std::size_t memory() const {
-    return queued_.used() + unreadBytes_ + halfFrameBytes_ + userInfos_->bytes() +
-           sessions_.used() * limits::kSessionBytes;
+    return memoryBesideSessions() + sessions_.used() * limits::kSessionBytes;
   }
   bool isCrowded() const {
     constexpr auto kAll = static_cast<std::size_t>(MemoryKind::kAll);
@@ -157,6 +167,10 @@ class UserAccount {
   std::size_t keptBytes() const { return keptBytes_.used(); }
 
  private:
+  std::size_t memoryBesideSessions() const {
+    return queued_.used() + unreadBytes_ + halfFrameBytes_ + userInfos_->bytes();
+  }
+
   // Of its shares, in the order of the kinds. Whoever sends a large frame slowly is not
   // to be taken for one who hoards them.
   static constexpr std::array<std::size_t, kMemoryKinds> kPartsWhenCrowded = {4, 8, 2, 8,
@@ -189,8 +203,10 @@ class UserAccount {
   const std::int64_t number_;
   const MemoryUse memoryLimits_;
   const std::size_t reservedQueuedBytes_;
+  const std::size_t sessionsInNeed_;
+  const std::size_t memoryBesideSessions_;
   RequestBudget queued_;
-  std::atomic<std::size_t> connections_{0};
+  std::atomic<std::size_t> busyProcesses_{0};
   std::atomic<std::size_t> unreadBytes_{0};
   std::atomic<std::size_t> halfFrameBytes_{0};
   const std::shared_ptr<UserInfos> userInfos_;
@@ -199,6 +215,32 @@ class UserAccount {
   // On a line of the cache of its own: sessions' threads write it, and the thread that
   // reads looks at the others with each message.
   alignas(64) Share keptBytes_;
+};
+
+/// What the connections of one process have in common: many of them have no more of what
+/// is reserved than one. Any thread.
+class ProcessAccount {
+ public:
+  explicit ProcessAccount(std::shared_ptr<UserAccount> user) : user_(std::move(user)) {}
+
+  /// One more or less of its connections has requests under way.
+  void addBusyConnection() noexcept {
+    if (busyConnections_++ == 0) user_->addBusyProcess();
+  }
+  void removeBusyConnection() noexcept {
+    if (--busyConnections_ == 0) user_->removeBusyProcess();
+  }
+
+  /// What each of these may have under way when the user's others have all.
+  std::size_t reservedQueuedBytes(std::size_t least, std::size_t most) const {
+    return std::clamp(
+        user_->reservedQueuedBytes() / std::max<std::size_t>(busyConnections_, 1), least,
+        most);
+  }
+
+ private:
+  const std::shared_ptr<UserAccount> user_;
+  std::atomic<std::size_t> busyConnections_{0};
 };
 
 }  // namespace ostrel

@@ -63,9 +63,18 @@ TEST(RequestBudget, TellsAWaiterOnceWhenHalfIsFree) {
   RequestBudget budget(100);
   budget.take(101);
   EXPECT_TRUE(budget.await());
-  EXPECT_FALSE(budget.give(50)) << "51 are used";
-  EXPECT_TRUE(budget.give(1));
-  EXPECT_FALSE(budget.give(1)) << "nobody waits any more";
+  EXPECT_FALSE(budget.give(50).tellsWaiter) << "51 are used";
+  EXPECT_TRUE(budget.give(1).tellsWaiter);
+  EXPECT_FALSE(budget.give(1).tellsWaiter) << "nobody waits any more";
+}
+
+TEST(RequestBudget, SaysWhenAnythingIsUnderWayAndWhenNothingIs) {
+  RequestBudget budget(100);
+  EXPECT_TRUE(budget.take(1));
+  EXPECT_FALSE(budget.take(1));
+  EXPECT_FALSE(budget.give(1).isLast);
+  EXPECT_TRUE(budget.give(1).isLast);
+  EXPECT_TRUE(budget.take(1));
 }
 
 TEST(RequestBudget, DoesNotLetWaitWhenHalfIsFreeAlready) {
@@ -90,6 +99,24 @@ TEST(UserAccount, TakesSessionsUpToTheUsersShareAndTheServices) {
   one.giveSessions(3);
   EXPECT_TRUE(two.takeSession());
   EXPECT_EQ(two.sessionsOfAll(), 3u);
+}
+
+TEST(UserAccount, TakesFewerSessionsWhereThereIsMuchElse) {
+  UserAccount::Limits limits{/*queuedBytes=*/1000, /*sessions=*/4, /*keptBytes=*/0};
+  limits.sessionsInNeed = 2;
+  limits.memoryBesideSessions = 100;
+  UserAccount user(limits, serviceWith(/*sessions=*/10, /*keptBytes=*/0));
+  user.changeUnread(0, 60);
+  user.queued().take(41);
+  EXPECT_TRUE(user.takeSession());
+  EXPECT_TRUE(user.takeSession()) << "so many there may be in any case";
+  EXPECT_FALSE(user.takeSession());
+  user.queued().give(1);
+  EXPECT_TRUE(user.takeSession()) << "100 are not too much";
+  user.queued().take(1);
+  EXPECT_FALSE(user.takeSession());
+  user.giveSessions(2);
+  EXPECT_TRUE(user.takeSession());
 }
 
 TEST(UserAccount, KeepsBytesUpToTheUsersShareAndTheServices) {
