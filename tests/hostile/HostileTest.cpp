@@ -73,12 +73,13 @@ Usage usageOf(pid_t pid) {
   return usage;
 }
 
-/// How long everything at once goes on, and each behaviour alone.
-double secondsAtOnce() {
-  const char* value = std::getenv("OSTREL_HOSTILE_SECONDS");
-  return value != nullptr ? std::atof(value) : 1;
+double secondsOf(const char* variable, double usual) {
+  const char* value = std::getenv(variable);
+  return value != nullptr ? std::atof(value) : usual;
 }
-constexpr double kSecondsAlone = 0.1;
+/// How long everything at once goes on, and each behaviour alone.
+double secondsAtOnce() { return secondsOf("OSTREL_HOSTILE_SECONDS", 1); }
+double secondsAlone() { return secondsOf("OSTREL_HOSTILE_SECONDS_ALONE", 0.1); }
 
 /// A client that behaves: one request at a time, each answered before the next.
 class GoodClient {
@@ -280,7 +281,8 @@ class HostileBehaviour : public testing::TestWithParam<hostile::Behaviour> {
 
 TEST_P(HostileBehaviour, AloneHarmsNobody) {
   GoodClient good(service_->socketPath());
-  const int status = service_->attack(std::string(GetParam().name), kSecondsAlone).wait();
+  const int status =
+      service_->attack(std::string(GetParam().name), secondsAlone()).wait();
   const GoodClient::Result result = good.finish();
 
   EXPECT_EQ(status, 0) << service_->read("attack.txt");
