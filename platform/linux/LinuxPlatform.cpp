@@ -105,6 +105,7 @@ struct LinuxPlatform::Bindings {
 };
 
 Outcome<std::unique_ptr<LinuxPlatform>> LinuxPlatform::open() {
+  shareHeaps();
   const std::shared_ptr<JournalLog> log = JournalLog::open();
   setSystemLog(log);
   registerLogScope(processLogScope);

@@ -2,12 +2,16 @@
 #include "platform/linux/HeapKeeper.h"
 
 #include <gtest/gtest.h>
+#include <malloc.h>
 #include <unistd.h>
 
 #include <chrono>
 #include <cstddef>
+#include <cstdio>
+#include <cstdlib>
 #include <cstring>
 #include <fstream>
+#include <latch>
 #include <memory>
 #include <thread>
 #include <vector>
@@ -38,7 +42,9 @@ TEST(ProcessHeap, GivesBackWhatABurstTook) {
   for (auto& piece : pieces) piece.reset();
   EXPECT_GT(during, before + kPieces * kPieceBytes / 2);
 
-  for (std::size_t i = 0; i < HeapKeeper::kRoundsOfBurst; ++i) keeper->noteWork();
+  for (std::size_t i = 0; i < HeapKeeper::kRoundsOfBurst; ++i) {
+    keeper->noteWork(std::chrono::steady_clock::now());
+  }
   const auto isGivenBack = [&] {
     return residentBytes() < before + kPieces * kPieceBytes / 4;
   };
@@ -49,6 +55,38 @@ TEST(ProcessHeap, GivesBackWhatABurstTook) {
   }
   EXPECT_TRUE(isGivenBack());
 }
+
+#ifndef OSTREL_SANITIZED  // Sanitizers have heaps of their own.
+// Exits with the number of heaps that eight threads made.
+[[noreturn]] void exitWithHeaps() {
+  shareHeaps();
+  constexpr std::size_t kThreads = 8;
+  std::latch haveSome(kThreads + 1);
+  std::latch mayEnd(1);
+  for (std::size_t i = 0; i < kThreads; ++i) {
+    std::thread([&] {
+      const std::vector<char> some(1000);
+      haveSome.arrive_and_wait();
+      mayEnd.wait();
+    }).detach();
+  }
+  haveSome.arrive_and_wait();
+  char* text = nullptr;
+  std::size_t size = 0;
+  std::FILE* const file = ::open_memstream(&text, &size);
+  ::malloc_info(/*options=*/0, file);
+  std::fclose(file);
+  int heaps = 0;
+  for (const char* at = text; (at = std::strstr(at, "<heap nr")) != nullptr; ++at)
+    ++heaps;
+  std::_Exit(heaps);
+}
+
+TEST(ProcessHeap, IsOneOfTwoForAllThreads) {
+  GTEST_FLAG_SET(death_test_style, "threadsafe");
+  EXPECT_EXIT(exitWithHeaps(), testing::ExitedWithCode(2), "");
+}
+#endif
 
 }  // namespace
 }  // namespace ostrel
