@@ -142,9 +142,10 @@ inline constexpr std::size_t kKeptBytesOfUser = std::size_t{1} * 1024 * 1024 * 1
 /// [UnixSocketListener.HoldsBackAClientThatFloodsRequestsWithoutPayload]
 inline constexpr std::size_t kRequestBytes = 256;
 
-/// What each delivery of a message costs beyond the first: its step on the queue of the
-/// session, and its place in the store's. A message to all is taken to go to every
-/// session that there is, `kReporterIDs` at most.
+/// What each delivery of a message costs beyond the first, with the size of the request:
+/// its step on the queue of the session, its place in the store's, and a copy of the
+/// payload, which is made where a key has a blank. A message to all is taken to go to
+/// every session that there is, `kReporterIDs` at most.
 /// [UnixSocketListener.ChargesEachDeliveryOfAMessage]
 inline constexpr std::size_t kDeliveryBytes = 512;
 
@@ -211,7 +212,7 @@ inline constexpr std::size_t kUnreadReplyBytesToPause = kUnreadReplyBytes / 4;
 /// them. Beyond it each may have `kUnreadReplyBytesInNeed`, so that many connections
 /// do not make many times the memory.
 /// [UnreadReplies.OfOthersLeaveAClientItsRoomUpToTheLimitOfTheirUser]
-inline constexpr std::size_t kUnreadReplyBytesOfUser = 8 * 1024 * 1024;
+inline constexpr std::size_t kUnreadReplyBytesOfUser = 4 * 1024 * 1024;
 
 /// Of one connection, then: a thousand short replies.
 /// [UnreadReplies.BeyondItAreFewForEachClient]

@@ -70,10 +70,14 @@ bool PeerChannel::mayMerge(const Merged& then) noexcept {
 void PeerChannel::relieve(std::size_t bytes) noexcept {
   const RequestBudget::Given own = own_.give(bytes);
   if (own.isLast) process_->removeBusyConnection();
+  const bool hasLargeEnded = own.isLast && hasLarge_.load() && hasLarge_.exchange(false);
+  if (hasLargeEnded) user_->removeLargeRequest();
   const bool hasUserEased = user_->queued().give(bytes).tellsWaiter;
   const bool hasReserve =
       awaitsReserve_.load() && !isBeyondReserve() && awaitsReserve_.exchange(false);
-  if (own.tellsWaiter || hasUserEased || hasReserve) waker_->budgetEased();
+  if (own.tellsWaiter || hasUserEased || hasReserve || hasLargeEnded) {
+    waker_->budgetEased();
+  }
 }
 
 std::uint64_t PeerChannel::chargeRequest(std::size_t bytes) {
@@ -88,8 +92,17 @@ void PeerChannel::requestsRan(std::uint64_t mark) noexcept {
   if (ran < mark) relieve(mark - ran);
 }
 
+// It is under way while anything of the connection's is.
+void PeerChannel::noteLarge() noexcept {
+  if (hasLarge_.exchange(true)) return;
+  user_->addLargeRequest();
+  if (own_.used() == 0 && hasLarge_.exchange(false)) user_->removeLargeRequest();
+}
+
 bool PeerChannel::awaitBudget() {
   const bool isOwnFull = own_.isExceeded() && own_.await();
+  // Its end is told of by the waker, which is asked after this.
+  if (mustWaitForLarge() && user_->queued().isExceeded()) return true;
   if (!isBeyondReserve() || !user_->queued().isExceeded()) return isOwnFull;
   awaitsReserve_ = true;
   // Whoever gives after this sees it; whoever gave before is seen here.

@@ -63,6 +63,16 @@ class PeerChannel final : public PayloadAccount {
   /// Of all users.
   std::size_t sessionsOfAll() const { return user_->sessionsOfAll(); }
 
+  /// The loop's: whether a request of this cost has to wait for another of the user's. A
+  /// large one, beyond `mostReservedBytes`, does where the user has too much under way;
+  /// then the connection is over its budget until that one is done.
+  bool mustWaitForLarge(std::size_t cost) noexcept {
+    isLarge_ = cost > mostReservedBytes_;
+    return mustWaitForLarge() && user_->queued().isExceeded();
+  }
+  /// The loop's: a large request is under way, and charged.
+  void noteLarge() noexcept;
+
   /// The loop's: a request without a payload of its own costs `bytes` until a
   /// request up to the mark returned, or a later one, has run.
   std::uint64_t chargeRequest(std::size_t bytes);
@@ -72,7 +82,8 @@ class PeerChannel final : public PayloadAccount {
   // The loop's. `uncharged`: what is to be charged soon.
   bool isOverBudget(std::size_t uncharged = 0) const {
     return own_.isExceededWith(uncharged) ||
-           (isBeyondReserve(uncharged) && user_->queued().isExceededWith(uncharged));
+           ((isBeyondReserve(uncharged) || mustWaitForLarge()) &&
+            user_->queued().isExceededWith(uncharged));
   }
   /// Whether the user's clients have all under way that they may.
   bool isUserOverBudget() const { return user_->queued().isExceeded(); }
@@ -104,6 +115,7 @@ class PeerChannel final : public PayloadAccount {
     return used > reservedQueuedBytes_ &&
            used > process_->reservedQueuedBytes(reservedQueuedBytes_, mostReservedBytes_);
   }
+  bool mustWaitForLarge() const { return isLarge_ && user_->hasLargeRequest(); }
   void updateUnread();
 
   const LoopWaker::ConnectionID id_;
@@ -117,6 +129,8 @@ class PeerChannel final : public PayloadAccount {
   std::atomic<bool> hasRefusedMerge_{false};
   RequestBudget own_;
   std::atomic<bool> awaitsReserve_{false};
+  bool isLarge_ = false;  // The loop's: of the request that comes next, or came last.
+  std::atomic<bool> hasLarge_{false};
   std::uint64_t chargedMark_ = 0;  // The loop's.
   std::atomic<std::uint64_t> ranMark_{0};
   std::atomic<std::size_t> idsReplyBytes_;

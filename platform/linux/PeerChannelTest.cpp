@@ -144,6 +144,65 @@ TEST_F(PeerChannelReserve, IsSharedByTheConnectionsOfAProcess) {
   EXPECT_FALSE(one->isOverBudget());
 }
 
+TEST_F(PeerChannelReserve, LetsOneLargeRequestAfterTheOther) {
+  const auto small = connect(makeProcess());
+  const auto one = connect(makeProcess());
+  const auto two = connect(makeProcess());
+  const auto take = [](PeerChannel& channel, std::size_t cost) {
+    channel.charge(cost);
+    if (cost > 20) channel.noteLarge();
+  };
+  take(*one, 21);
+  EXPECT_FALSE(two->mustWaitForLarge(/*cost=*/20));
+  EXPECT_FALSE(two->isOverBudget());
+  EXPECT_TRUE(two->mustWaitForLarge(/*cost=*/21));
+  EXPECT_TRUE(two->isOverBudget()) << "it has nothing under way, but asks for much";
+  EXPECT_TRUE(two->awaitBudget());
+  take(*small, 1);
+  EXPECT_FALSE(small->isOverBudget());
+
+  LoopWaker::Work work;
+  waker_->take(work);
+  one->relieve(21);
+  waker_->take(work);
+  EXPECT_TRUE(work.hasBudgetEased);
+  EXPECT_FALSE(two->isOverBudget());
+  EXPECT_FALSE(two->mustWaitForLarge(/*cost=*/21));
+}
+
+TEST_F(PeerChannelReserve, TellsLargeRequestsByTheMostThatIsReserved) {
+  const auto other = connect(makeProcess());
+  other->charge(1);
+  other->noteLarge();
+  const auto channel = connect(makeProcess());
+  for (const std::size_t cost : {19u, 20u, 21u}) {
+    EXPECT_EQ(channel->mustWaitForLarge(cost), cost > 20) << cost;
+  }
+}
+
+TEST_F(PeerChannelReserve, HoldsNobodyBackForLargeRequestsWhereThereIsRoom) {
+  user_->queued().give(101);
+  const auto one = connect(makeProcess());
+  const auto two = connect(makeProcess());
+  for (const auto& channel : {one.get(), two.get()}) {
+    channel->charge(21);
+    channel->noteLarge();
+  }
+  EXPECT_FALSE(one->isOverBudget());
+  EXPECT_FALSE(two->isOverBudget());
+  EXPECT_FALSE(two->mustWaitForLarge(/*cost=*/21));
+}
+
+TEST_F(PeerChannelReserve, EndsALargeRequestWithItsConnection) {
+  {
+    const auto channel = connect(makeProcess());
+    channel->charge(21);
+    channel->noteLarge();
+    EXPECT_TRUE(user_->hasLargeRequest());
+  }
+  EXPECT_FALSE(user_->hasLargeRequest());
+}
+
 TEST_F(PeerChannelBudget, IsGivenBackWithTheConnectionsRequests) {
   {
     PeerChannel other = makeChannel(2);

@@ -233,7 +233,7 @@ std::size_t PeerConnection::process(std::span<const std::uint8_t> bytes) {
     const std::size_t length = wire::frameLength(frames.data() + done);
     announced += announce(frames.subspan(announced));
     used += carryOut(input, frames.subspan(done + wire::kFrameHeaderSize, length));
-    if (ending_ != Ending::kNone) break;
+    if (ending_ != Ending::kNone || isHeldBack_) break;
     done += wire::kFrameHeaderSize + length;
   }
   // One message keeps all of them alive.
@@ -296,7 +296,23 @@ void PeerConnection::processPending() {
   if (pending_.empty()) pending_.shrink_to_fit();
 }
 
-// How many bytes of `input` were charged to it: all of a request with a payload.
+// Of the payload and what is made of it.
+std::size_t PeerConnection::costOf(const wire::Request& request,
+                                   std::size_t bytes) const {
+  if (!request.dictionary) return 0;
+  std::size_t cost = bytes + limits::kRequestBytes;
+  if (request.operation != wire::Operation::kSendMessage) return cost;
+  // To all that are started, which are few of many at most times.
+  const std::size_t deliveries =
+      request.reporterIDs ? request.reporterIDs->size()
+                          : std::min(channel_->sessionsOfAll(), limits_.reporterIDs);
+  // Each may make a copy of the payload.
+  if (deliveries > 1) cost += (deliveries - 1) * (limits::kDeliveryBytes + bytes);
+  return cost;
+}
+
+// Nothing where the request has to wait. How many bytes of `input` were charged to it:
+// all of a request with a payload.
 std::size_t PeerConnection::carryOut(ValueBuffer& input,
                                      std::span<const std::uint8_t> item) {
   wire::Request request;
@@ -313,21 +329,20 @@ std::size_t PeerConnection::carryOut(ValueBuffer& input,
   // A client that has gone may have left thousands of questions behind.
   if (isDeaf_ && onlyAsks(request.operation)) return 0;
   work_ += workOf(request, item.size(), channel_->sessionsOfAll());
+  const std::size_t cost = costOf(request, item.size());
+  if (channel_->mustWaitForLarge(cost)) {
+    isHeldBack_ = true;
+    return 0;
+  }
   if (!countSession(request)) {
     dispatchRefusedSession(*object_, channel_, request);
     return 0;
   }
-  std::size_t used = 0;
-  if (request.dictionary) {
-    used = item.size();
-    uncharged_ += used + limits::kRequestBytes;
-  }
-  if (request.operation == wire::Operation::kSendMessage) {
-    // To all that are started, which are few of many at most times.
-    const std::size_t deliveries =
-        request.reporterIDs ? request.reporterIDs->size()
-                            : std::min(channel_->sessionsOfAll(), limits_.reporterIDs);
-    if (deliveries > 1) uncharged_ += (deliveries - 1) * limits::kDeliveryBytes;
+  const std::size_t used = request.dictionary ? item.size() : 0;
+  uncharged_ += cost;
+  if (cost > limits_.mostReservedBytes) {
+    chargeInput();
+    channel_->noteLarge();
   }
   if (keepsReply(request.operation)) {
     needsProbe_ = true;

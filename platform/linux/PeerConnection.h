@@ -130,6 +130,7 @@ class PeerConnection final : public IPCConnection {
   void processPending();
   void chargeInput();
   std::size_t announce(std::span<const std::uint8_t> frames);
+  std::size_t costOf(const wire::Request& request, std::size_t bytes) const;
   std::size_t carryOut(ValueBuffer& input, std::span<const std::uint8_t> item);
   bool countSession(const wire::Request& request);
   void checkNextFrame(std::span<const std::uint8_t> bytes);

@@ -45,6 +45,9 @@ constexpr std::uint64_t kWorkOfAccepting = 25'000;
 constexpr std::uint64_t kWorkOfEnding = 40'000;
 constexpr std::uint64_t kWorkOfSessionsEnd = 2000;
 
+// A look that finds many takes longer, and comes less often.
+constexpr std::chrono::microseconds kTurnsOfEvent{1};
+
 // The accounts of a user's processes are looked through when there are so many more than
 // connections.
 constexpr std::size_t kProcessesKept = 64;
@@ -146,10 +149,12 @@ void UnixSocketIPCListener::look() {
   const int count = ::epoll_wait(epoll_.get(), events_.data(), kMostEvents,
                                  mayWait ? millisecondsToWait() : 0);
   waker_->endWait();
+  const Clock::time_point now = Clock::now();
   line_.setTime(static_cast<std::uint64_t>(
-      std::chrono::nanoseconds(Clock::now().time_since_epoch()).count()));
+      std::chrono::nanoseconds(now.time_since_epoch()).count()));
   shareMemoryOut();
-  if (heap_ && count > 0) heap_->noteWork();
+  if (heap_ && count > 0) heap_->noteWork(now);
+  turnsBetweenLooks_ = limits::kTurnsBetweenLooks + std::max(count, 0) * kTurnsOfEvent;
   const Batch requests;
   for (int i = 0; i < count; ++i) {
     const epoll_event& event = events_[static_cast<std::size_t>(i)];
@@ -203,7 +208,7 @@ void UnixSocketIPCListener::takeTurns() {
         if (work >= limits_.turnWork || line_.empty()) break;
         // Where the estimate is wrong.
         const Clock::time_point now = Clock::now();
-        if (!end) end = now + limits::kTurnsBetweenLooks;
+        if (!end) end = now + turnsBetweenLooks_;
         if (now >= *end) break;
       }
     }
@@ -215,7 +220,7 @@ void UnixSocketIPCListener::takeTurns() {
     giveUpEstates();
     if (line_.empty() || isStopping_) return;
     const Clock::time_point now = Clock::now();
-    if (!end) end = now + limits::kTurnsBetweenLooks;
+    if (!end) end = now + turnsBetweenLooks_;
     if (now >= *end) return;
   }
 }
@@ -320,31 +325,38 @@ void UnixSocketIPCListener::cutOff(PeerConnection& connection) {
 }
 
 // A client that begins frames and does not end them takes memory for as long as it likes:
-// where a user has too many such, those that began first go.
+// where a user has too many such, those go that began first, of the process that has most
+// of them. Whoever sends one large frame, however slowly, is not taken for a hoarder.
 void UnixSocketIPCListener::countHalfFrame(PeerConnection& connection) {
-  const auto watched = connections_.find(connection.id());
-  if (watched == connections_.end()) return;
+  const auto found = connections_.find(connection.id());
+  if (found == connections_.end()) return;
+  Watched& watched = found->second;
   const std::size_t before =
-      std::exchange(watched->second.halfFrameBytes, connection.halfFrameBytes());
-  UserAccount& account = *users_.at(connection.peer().user).account;
-  account.changeHalfFrames(before, connection.halfFrameBytes());
-  if (account.hasManyHalfFrames()) cutOffOldestHalf(connection.peer().user);
+      std::exchange(watched.halfFrameBytes, connection.halfFrameBytes());
+  watched.process->changeHalfFrames(before, connection.halfFrameBytes());
+  const std::uint32_t user = connection.peer().user;
+  if (users_.at(user).account->hasManyHalfFrames()) cutOffOldestHalf(user);
 }
 
 bool UnixSocketIPCListener::cutOffOldestHalf(std::uint32_t user) {
-  std::shared_ptr<PeerConnection> oldest;
+  const Watched* first = nullptr;
   for (const auto& [id, each] : connections_) {
-    const PeerConnection& candidate = *each.connection;
-    if (candidate.halfFrameBytes() == 0) continue;
-    if (candidate.peer().user != user) continue;
-    if (!oldest || candidate.pendingSince() < oldest->pendingSince()) {
-      oldest = each.connection;
-    }
+    if (each.connection->halfFrameBytes() == 0) continue;
+    if (each.connection->peer().user != user) continue;
+    if (first == nullptr || goesBefore(each, *first)) first = &each;
   }
-  if (!oldest) return false;
+  if (first == nullptr) return false;
+  const std::shared_ptr<PeerConnection> oldest = first->connection;
   oldest->breakOff(PeerConnection::Ending::kBrokenRules, "too many frames are not whole");
   cutOff(*oldest);
   return true;
+}
+
+bool UnixSocketIPCListener::goesBefore(const Watched& one, const Watched& other) {
+  const std::size_t ofOne = one.process->halfFrameBytes();
+  const std::size_t ofOther = other.process->halfFrameBytes();
+  if (ofOne != ofOther) return ofOne > ofOther;
+  return one.connection->pendingSince() < other.connection->pendingSince();
 }
 
 void UnixSocketIPCListener::watch(PeerConnection& connection) {
@@ -370,14 +382,11 @@ void UnixSocketIPCListener::end(PeerConnection& connection) {
   const auto found = connections_.find(connection.id());
   if (found == connections_.end()) return;
   const std::shared_ptr<PeerConnection> ended = std::move(found->second.connection);
-  const std::size_t halfFrameBytes = found->second.halfFrameBytes;
+  found->second.process->changeHalfFrames(found->second.halfFrameBytes, /*now=*/0);
   connections_.erase(found);
   peers_->peerDisconnected(ended->peer().pid, ended->id());
   const auto user = users_.find(ended->peer().user);
-  if (user != users_.end()) {
-    --user->second.connections;
-    user->second.account->changeHalfFrames(halfFrameBytes, /*now=*/0);
-  }
+  if (user != users_.end()) --user->second.connections;
   const bool isLarge = disposal_ != nullptr && ended->sessions() > kManySessions;
   (isLarge ? largeEstates_ : estates_).push_back(ended->invalidate());
 }
@@ -423,15 +432,17 @@ void UnixSocketIPCListener::accept(FileDescriptor socket) {
   }
   const PeerConnection::ID id = nextID_++;
   peers_->peerConnected(peer.pid, id, processOf(socket.get(), peer.pid));
+  const auto process = user.processAccount(peer.pid);
   auto channel = std::make_shared<PeerChannel>(
       id, waker_, user.account,
       PeerChannel::Limits{limits_.queuedBytes, limits_.unreadReplyBytes,
                           limits_.reservedQueuedBytes, limits_.mostReservedBytes},
-      user.processAccount(peer.pid));
+      process);
   auto connection = std::make_shared<PeerConnection>(
       id, std::move(socket), peer, std::move(channel), limits_, *misuse_);
   Watched& watched = connections_[id];
   watched.connection = connection;
+  watched.process = process;
   line_.introduce(watched.place);
   ++user.connections;
   const bool isAccepted = delegate_ != nullptr &&

@@ -67,6 +67,7 @@ class UnixSocketIPCListener final : public IPCListener {
 
  private:
   using Clock = PeerConnection::Clock;
+  struct Watched;
   struct User {
     std::size_t connections = 0;
     std::shared_ptr<UserAccount> account;
@@ -103,6 +104,8 @@ class UnixSocketIPCListener final : public IPCListener {
   void countHalfFrame(PeerConnection& connection);
   bool cutOffOldestHalf(std::uint32_t user);
   bool cutOffHalfOfWhoHasMost();
+  /// Which of two half frames is given up first.
+  static bool goesBefore(const Watched& one, const Watched& other);
 
   const ListenerLimits limits_;
   const ServiceSocket socket_;
@@ -118,6 +121,7 @@ class UnixSocketIPCListener final : public IPCListener {
 
   struct Watched {
     std::shared_ptr<PeerConnection> connection;
+    std::shared_ptr<ProcessAccount> process;
     std::size_t halfFrameBytes = 0;  // As its user's count has it.
     std::uint32_t events = 0;        // As epoll knows them; 0: not in it.
     bool isListedHeldBack = false;   // In `heldBack_`.
@@ -135,6 +139,7 @@ class UnixSocketIPCListener final : public IPCListener {
   // Of clients that have gone, and of those among them that had many sessions.
   std::vector<std::shared_ptr<void>> estates_;
   std::vector<std::shared_ptr<void>> largeEstates_;
+  Clock::duration turnsBetweenLooks_ = limits::kTurnsBetweenLooks;
   LoopWaker::Work work_;
   std::vector<epoll_event> events_;
   std::vector<std::uint8_t> buffer_;

@@ -2,11 +2,16 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <linux/sockios.h>
+#include <poll.h>
 #include <sys/ioctl.h>
 #include <sys/resource.h>
 #include <sys/socket.h>
+#include <sys/un.h>
+#include <sys/wait.h>
+#include <unistd.h>
 
 #include <chrono>
+#include <cstdlib>
 #include <memory>
 #include <string>
 #include <string_view>
@@ -236,6 +241,64 @@ TEST_F(UnixSocketListener, CutsOffWhoIsLongestInAFrameWhereAUserHasTooManyHalves
 
   EXPECT_EQ(clients.front()->receiveClosing(), "too many frames are not whole");
   EXPECT_EQ(misuse->counts()[static_cast<std::size_t>(MisuseLog::Kind::kCutOff)], 1u);
+}
+
+// Another process with connections that each have sent this and say no more.
+class OtherProcess {
+ public:
+  OtherProcess(const std::string& path, int connections, const std::string& bytes) {
+    int ends[2];
+    if (::socketpair(AF_UNIX, SOCK_STREAM, 0, ends) != 0) std::abort();
+    ours_ = FileDescriptor(ends[0]);
+    const FileDescriptor theirs(ends[1]);
+    sockaddr_un address{};
+    address.sun_family = AF_UNIX;
+    path.copy(address.sun_path, sizeof address.sun_path - 1);
+    pid_ = ::fork();
+    if (pid_ == 0) {
+      for (int i = 0; i < connections; ++i) {
+        const int socket = ::socket(AF_UNIX, SOCK_STREAM, 0);
+        ::connect(socket, reinterpret_cast<const sockaddr*>(&address), sizeof address);
+        if (::send(socket, bytes.data(), bytes.size(), MSG_NOSIGNAL) < 0) ::_exit(1);
+      }
+      char byte = 0;
+      ::close(ours_.get());
+      if (::write(theirs.get(), &byte, 1) == 1) {
+        while (::read(theirs.get(), &byte, 1) > 0) {
+        }
+      }
+      ::_exit(0);
+    }
+    char byte = 0;
+    EXPECT_EQ(::read(ours_.get(), &byte, 1), 1);
+  }
+  ~OtherProcess() {
+    ours_.reset();
+    ::waitpid(pid_, nullptr, 0);
+  }
+
+ private:
+  FileDescriptor ours_;
+  pid_t pid_ = -1;
+};
+
+TEST_F(UnixSocketListener, CutsOffTheProcessWithMostHalfFramesAndNobodyElse) {
+  ListenerLimits limits;
+  limits.ofUser.halfFrameBytes = 90 * 1024;
+  serve(limits);
+  const std::string half =
+      std::string("\x00\x00\x01\x00", 4) + std::string(30 * 1024 - 4, '\x81');
+  RawClient slow(path);
+  slow.send(half);
+  const auto cutOff = [&] {
+    return misuse->counts()[static_cast<std::size_t>(MisuseLog::Kind::kCutOff)];
+  };
+
+  const OtherProcess hoarder(path, /*connections=*/6, half);
+  EXPECT_TRUE(eventually([&] { return cutOff() == 4; }));
+
+  pollfd atSlow{slow.socket(), POLLIN, 0};
+  EXPECT_EQ(::poll(&atSlow, 1, /*timeout=*/0), 0) << "it was told nothing";
 }
 
 // A kilobyte under way for all connections of a user, and the reserve for each.

@@ -201,7 +201,7 @@ class UnixSocketListener : public testing::Test, public IPCListenerDelegate {
   const std::string path = directory / "run/reporting.sock";
   const std::shared_ptr<PeerRegistry> peers = std::make_shared<PeerRegistry>();
   const std::shared_ptr<MisuseLog> misuse = std::make_shared<MisuseLog>();
-  bool isRefusing = false;  // All connections. Before `serve`.
+  bool isRefusing = false;                             // All connections. Before `serve`.
   std::function<PeerIdentity(int socket)> identityOf;  // Empty: the kernel's.
   const std::shared_ptr<RecordingService> service = std::make_shared<RecordingService>();
   std::unique_ptr<UnixSocketIPCListener> listener;

@@ -96,6 +96,11 @@ class UserAccount {
     return reservedQueuedBytes_ / std::max<std::size_t>(busyProcesses_, 1);
   }
 
+  /// How many connections have a large request under way.
+  void addLargeRequest() noexcept { ++largeRequests_; }
+  void removeLargeRequest() noexcept { --largeRequests_; }
+  bool hasLargeRequest() const { return largeRequests_ != 0; }
+
   /// One more session. False: there are as many as the user or the service may have, or
   /// as the user may have where its clients have much else in memory.
   bool takeSession() noexcept {
@@ -207,6 +212,7 @@ class UserAccount {
   const std::size_t memoryBesideSessions_;
   RequestBudget queued_;
   std::atomic<std::size_t> busyProcesses_{0};
+  std::atomic<std::size_t> largeRequests_{0};
   std::atomic<std::size_t> unreadBytes_{0};
   std::atomic<std::size_t> halfFrameBytes_{0};
   const std::shared_ptr<UserInfos> userInfos_;
@@ -238,9 +244,17 @@ class ProcessAccount {
         most);
   }
 
+  /// Of its connections' frames that are not whole.
+  void changeHalfFrames(std::size_t before, std::size_t now) noexcept {
+    halfFrameBytes_ += now - before;
+    user_->changeHalfFrames(before, now);
+  }
+  std::size_t halfFrameBytes() const { return halfFrameBytes_; }
+
  private:
   const std::shared_ptr<UserAccount> user_;
   std::atomic<std::size_t> busyConnections_{0};
+  std::atomic<std::size_t> halfFrameBytes_{0};
 };
 
 }  // namespace ostrel
