@@ -58,7 +58,7 @@ inline constexpr std::size_t kQueuedBytes = 4 * 1024 * 1024;
 /// [RequestBudget.IsExceededBeyondItsBytes,
 /// PeerChannelBudget.IsThatOfAllConnectionsOfTheUserToo,
 /// ListenerSharesUnderWay.AreThoseOfAllConnectionsOfTheUser]
-inline constexpr std::size_t kQueuedBytesOfUser = 16 * 1024 * 1024;
+inline constexpr std::size_t kQueuedBytesOfUser = 12 * 1024 * 1024;
 
 /// What a connection may have of that when the user's other connections have it all: a
 /// client with a request or two is served however much the others sent.
@@ -106,7 +106,7 @@ inline constexpr std::size_t kSessionBytes = 512;
 /// ListenerShares.OfACrowdedUserAreLessForUserInfos,
 /// ListenerShares.OfACrowdedUserAreLessForHalvesOfFrames,
 /// ListenerSharesUnderWay.AreAQuarterForACrowdedUser]
-inline constexpr std::size_t kMemoryBytesOfUser = 20 * 1024 * 1024;
+inline constexpr std::size_t kMemoryBytesOfUser = 16 * 1024 * 1024;
 
 /// The same of all users together, of each kind and of all kinds. Some users may each
 /// have their shares side by side; when that becomes too much, each has a part of the
@@ -245,7 +245,7 @@ inline constexpr std::size_t kListBytesInMemory = 256 * 1024;
 /// part of what the service may have. Beyond it short lists are in the file alone, and
 /// each longer one has 1 KiB whatever the others have.
 /// [FileEntryStorageTest.RefusesWhatFitsNeitherDiskNorMemory]
-inline constexpr std::size_t kListsBytesInMemory = 8 * 1024 * 1024;
+inline constexpr std::size_t kListsBytesInMemory = 6 * 1024 * 1024;
 
 /// Of that, what waits for more of other sessions so that it is written to the file
 /// together.

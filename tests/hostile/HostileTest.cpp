@@ -9,6 +9,7 @@
 #include <cstdlib>
 #include <future>
 #include <iostream>
+#include <limits>
 #include <sstream>
 
 #include "ostrel/OstrelReportingClient.h"
@@ -33,7 +34,7 @@ constexpr bool kMemoryIsBounded = true;
 constexpr std::size_t kMostResidentKiB = 96 * 1024;
 // With all at once, and with sessions that start as fast as a client can make them. That
 // it is 96 MiB here too is the aim. On a machine that is busy with other work too, where
-// the service's threads of low priority lag behind, up to 111 were seen.
+// the service's threads of low priority lag behind, up to 108 were seen.
 constexpr std::size_t kMostResidentOfBusyMachineKiB = 128 * 1024;
 constexpr std::string_view kMakesStarts = "leaves-while-starting";
 
@@ -45,7 +46,6 @@ constexpr std::size_t kMostThreads = 16;
 #endif
 
 // Of a reply to a client that behaves, on a machine that is busy with other tests too.
-// `scripts/longrun hostile` prints what it is on one that is not.
 constexpr auto kLongestReply = 10s;
 
 struct Usage {
@@ -73,13 +73,19 @@ Usage usageOf(pid_t pid) {
   return usage;
 }
 
-double secondsOf(const char* variable, double usual) {
+double numberIn(const char* variable, double usual) {
   const char* value = std::getenv(variable);
   return value != nullptr ? std::atof(value) : usual;
 }
 /// How long everything at once goes on, and each behaviour alone.
-double secondsAtOnce() { return secondsOf("OSTREL_HOSTILE_SECONDS", 1); }
-double secondsAlone() { return secondsOf("OSTREL_HOSTILE_SECONDS_ALONE", 0.1); }
+double secondsAtOnce() { return numberIn("OSTREL_HOSTILE_SECONDS", 1); }
+/// What 99 of 100 replies take at most beside all at once, in milliseconds; of an
+/// optimised build on a machine with nothing else to do, as `scripts/longrun hostile`
+/// runs it.
+double mostMilliseconds() {
+  return numberIn("OSTREL_HOSTILE_P99_MS", std::numeric_limits<double>::infinity());
+}
+double secondsAlone() { return numberIn("OSTREL_HOSTILE_SECONDS_ALONE", 0.1); }
 
 /// A client that behaves: one request at a time, each answered before the next.
 class GoodClient {
@@ -328,6 +334,7 @@ TEST(HostileBehaviours, AllAtOnceHarmNobody) {
   EXPECT_EQ(status, 0) << service.read("attack.txt");
   EXPECT_EQ(result.unanswered, 0u);
   EXPECT_GT(result.replies, 0u);
+  EXPECT_LT(result.quantile(0.99), mostMilliseconds());
   EXPECT_LT(result.quantile(1), std::chrono::milliseconds(kLongestReply).count());
   service.expectItIsAsItWas();
   if (kMemoryIsBounded) {
