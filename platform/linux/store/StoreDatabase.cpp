@@ -81,6 +81,13 @@ StoreDatabase::Result makeDirectories(const std::string& path) {
   }
 }
 
+bool hasMemory() {
+  constexpr sqlite3_uint64 kMuch = 1024 * 1024;
+  void* const memory = sqlite3_malloc64(kMuch);
+  sqlite3_free(memory);
+  return memory != nullptr;
+}
+
 StoreFault damaged(std::string description) {
   return {StoreFault::Kind::kDamaged, SQLITE_CORRUPT, std::move(description)};
 }
@@ -190,7 +197,23 @@ StoreDatabase::StoreDatabase(std::string path, const char* vfs)
 
 StoreDatabase::~StoreDatabase() { close(); }
 
+// SQLite takes some damaged schemas for a want of memory: then it says so each time,
+// though there is some.
 StoreDatabase::Result StoreDatabase::open() {
+  const auto isMemory = [](const Result& result) {
+    return result && (result->code & 0xFF) == SQLITE_NOMEM;
+  };
+  Result result = tryToOpen();
+  if (isMemory(result)) {
+    const bool wasAnother = isAnother_;
+    result = tryToOpen();
+    isAnother_ |= wasAnother;
+  }
+  if (isMemory(result) && hasMemory()) return damaged(result->description);
+  return result;
+}
+
+StoreDatabase::Result StoreDatabase::tryToOpen() {
   close();
   Result result = makeFile();
   if (!result) result = connect();

@@ -131,6 +131,7 @@ class StoreDatabase {
  private:
   struct Statements;
 
+  Result tryToOpen();
   Result makeFile();
   Result clearCompanions();
   Result checkHeader(int file);
