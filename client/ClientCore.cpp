@@ -419,6 +419,7 @@ bool ClientCore::refill() {
   writingBegin_ = 0;
   std::uint64_t looksWanted;
   bool isLastLook;
+  bool isQueueAll;  // That there is to take.
   {
     const std::lock_guard lock(mutex_);
     queue_.swap(writing_);
@@ -431,10 +432,20 @@ bool ClientCore::refill() {
     }
     newRings_.clear();
     ringsWanted_ = false;
+    isQueueAll = rings_.empty() && !isLastLook;
+    if (isQueueAll) {
+      nextRingLook_ = Clock::time_point::max();
+      looksDone_ = looksWanted;
+      writingBytes_ = writing_.size() - writingBegin_;
+    }
   }
   const std::size_t queued = writing_.size();
   if (queued == 0 && writing_.capacity() > kKeptBufferBytes) std::string().swap(writing_);
-  if (!rings_.empty() && Clock::now() >= nextRingLook_) drainRings();
+  if (isQueueAll) {
+    changed_.notify_all();
+    return queued != 0;
+  }
+  if (Clock::now() >= nextRingLook_) drainRings();
   if (isLastLook && !std::exchange(hasSaidFarewell_, true)) {
     rings_.clear();
     wire::appendFarewell(writing_);

@@ -8,6 +8,7 @@
 #include <atomic>
 #include <chrono>
 #include <condition_variable>
+#include <ctime>
 #include <filesystem>
 #include <mutex>
 #include <thread>
@@ -245,6 +246,18 @@ TEST_F(ClientOfTheService, ServesManyThreadsAtOnce) {
   testing_support::eventually([&] { return answered == kThreads * kMessages; });
   EXPECT_EQ(answered, kThreads * kMessages);
   EXPECT_EQ(client.counts().droppedRequests, 0u);
+}
+
+// It once went on looking for audio threads without a pause.
+TEST_F(ClientOfTheService, IsAsleepAfterAFlush) {
+  startService();
+  Client client(options());
+  client.createReportingSession(kSession, answers.expect<bool>("create"));
+  ASSERT_TRUE(client.flush(kSoon));
+  answers.wait(1);
+  const std::clock_t before = std::clock();
+  std::this_thread::sleep_for(500ms);
+  EXPECT_LT(std::clock() - before, CLOCKS_PER_SEC / 10) << "of processor time";
 }
 
 TEST_F(ClientOfTheService, HandsOverEveryMessageOfAnAudioThread) {
