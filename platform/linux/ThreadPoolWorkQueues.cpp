@@ -558,20 +558,21 @@ std::shared_ptr<ThreadPoolWorkQueues::Strand> ThreadPoolWorkQueues::Pool::takeSt
   std::shared_ptr<Strand> strand = std::move(line.front());
   line.pop_front();
   urgentInARow_ = isUrgent ? urgentInARow_ + 1 : 0;
-  if (isUrgent) {
-    waiting_.fetch_sub(1, std::memory_order_relaxed);
-    return strand;
-  }
   // Of those of low priority others might have to go first soon.
+  Line& more = isUrgent ? urgentLine_ : line_;
+  const std::size_t most =
+      isUrgent ? static_cast<std::size_t>(std::max(kUrgentInARow - urgentInARow_, 0))
+               : kStrandsInHand;
   const std::size_t others =
-      std::min(line_.size() / (2 * kind_.mostThreads), kStrandsInHand);
+      std::min({more.size() / (2 * kind_.mostThreads), most, kStrandsInHand});
   if (others != 0) {
     std::array<std::shared_ptr<Strand>, kStrandsInHand> taken;
     for (std::size_t i = 0; i < others; ++i) {
-      taken[i] = std::move(line_.front());
-      line_.pop_front();
+      taken[i] = std::move(more.front());
+      more.pop_front();
     }
     hand.fill({taken.data(), others});
+    if (isUrgent) urgentInARow_ += static_cast<int>(others);
   }
   waiting_.fetch_sub(static_cast<std::int64_t>(1 + others), std::memory_order_relaxed);
   return strand;
