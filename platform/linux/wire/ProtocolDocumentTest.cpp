@@ -111,6 +111,13 @@ TEST(ProtocolDocument, SaysTheLimits) {
   says("bytes of one connection's requests that wait", limits::kQueuedBytes);
   says("the same of all connections of one user", limits::kQueuedBytesOfUser);
   says("reply bytes that a client has not read", limits::kUnreadReplyBytes);
+  says("reply bytes that all clients of one user have not read",
+       limits::kUnreadReplyBytesOfUser);
+  says("the limit of each client beyond that", limits::kUnreadReplyBytesInNeed);
+  says("bytes of frames that are not whole yet, of all connections of one user",
+       limits::kHalfFrameBytesOfUser);
+  says("sessions, in all", limits::kSessions);
+  says("sessions of one user", limits::kSessionsOfUser);
 }
 
 }  // namespace
