@@ -88,6 +88,7 @@ class OwnersOfRows : public testing::Test {
   }
 
   TemporaryDirectory directory;
+  std::atomic<std::int64_t> now{1'000'000};  // Asked until the last session is gone.
   std::shared_ptr<Store> store;
   std::unique_ptr<StoreTelemetryBackend> backend;
   std::vector<std::shared_ptr<TelemetrySession>> sessions;
@@ -209,9 +210,8 @@ TEST_F(OwnersOfRows, AreBorneHoweverSomebodyMeddledWithThem) {
 }
 
 TEST_F(OwnersOfRows, AreForgottenWithRowsThatAreTooOld) {
-  std::atomic<std::int64_t> now{1'000'000};
   StoreOptions options;
-  options.now = [&] { return now.load(); };
+  options.now = [this] { return now.load(); };
   options.retention.age = std::chrono::hours(1);
   open(options);
   send(begin(1), 1, 500);

@@ -58,6 +58,7 @@ class StoreTest : public ::testing::Test {
 
   TemporaryDirectory directory_;
   std::atomic<std::int64_t> ticks_{0};
+  std::atomic<std::int64_t> now_{1'000'000};
   std::shared_ptr<Store> store_;
   std::unique_ptr<StoreTelemetryBackend> backend_;
   std::unique_ptr<StoreAnalyticsSink> analytics_;
@@ -498,16 +499,15 @@ TEST_F(StoreTest, RemovesTheOldestRowsOfALargeStore) {
 }
 
 TEST_F(StoreTest, RemovesRowsThatAreTooOld) {
-  std::atomic<std::int64_t> now{1'000'000};
   StoreOptions options;
-  options.now = [&] { return now.load(); };
+  options.now = [this] { return now_.load(); };
   options.retention.age = std::chrono::hours(1);
   open(options);
   makeSession(1)->sendMessage(1, 1, kPayload);
   analytics_->sendEventLazy("old", [] { return kPayload; });
   wattlog_->logRegisteredEvent(1, "old", kPayload, std::nullopt);
   settle();
-  now = 1'000'000 + 3'600'000'000 + 1;
+  now_ = 1'000'000 + 3'600'000'000 + 1;
   makeSession(2)->sendMessage(2, 2, kPayload);
   analytics_->sendEventLazy("new", [] { return kPayload; });
   wattlog_->logRegisteredEvent(1, "new", kPayload, std::nullopt);
