@@ -33,8 +33,9 @@ ValueBuffer ValueBuffer::copyOf(std::span<const std::uint8_t> bytes,
 
 ValueBuffer ValueBuffer::copyOfInput(std::span<const std::uint8_t> bytes,
                                      std::shared_ptr<PayloadAccount> account) {
-  ValueBuffer buffer = makeUncharged(bytes.size(), std::move(account));
+  ValueBuffer buffer = makeUncharged(bytes.size() + kReadableBytes, std::move(account));
   std::memcpy(buffer.data(), bytes.data(), bytes.size());
+  std::memset(buffer.data() + bytes.size(), 0, kReadableBytes);
   return buffer;
 }
 

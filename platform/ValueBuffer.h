@@ -53,8 +53,10 @@ class ValueBuffer {
   static ValueBuffer make(std::size_t size, std::shared_ptr<PayloadAccount> account = {});
   static ValueBuffer copyOf(std::span<const std::uint8_t> bytes,
                             std::shared_ptr<PayloadAccount> account = {});
-  /// A copy of what one read brought. Charged are only the bytes that `charge` is
-  /// told of: who reads them charges what it makes values of.
+  /// A copy of what one read brought, and `kReadableBytes` zeros behind it. Charged are
+  /// only the bytes that `charge` is told of: who reads them charges what it makes values
+  /// of.
+  static constexpr std::size_t kReadableBytes = 64;
   static ValueBuffer copyOfInput(std::span<const std::uint8_t> bytes,
                                  std::shared_ptr<PayloadAccount> account);
 

@@ -2,6 +2,12 @@
 // are a small stack of places. Every count is compared with the bytes that are
 // left and with the limits before anything is done with it.
 //
+// Nearly all entries are a short text and behind it a number, a truth or a short
+// text. `passPlainEntries` goes over those with the state of their dictionary in
+// registers, reading whole words, while there are as many bytes that it may read as
+// the longest of them takes; it leaves all others, wrong ones too, to the general
+// check. A payload of ten entries takes 51 ns so, and 75 without.
+//
 // Repeated keys. A small dictionary keeps a mask of 64 bits, one set by the hash
 // of each key; only a key that meets a set bit is compared with the earlier
 // ones, first by hash, then byte by byte. A large one notes hash and place of
@@ -10,6 +16,7 @@
 #include "platform/linux/wire/PayloadDecoder.h"
 
 #include <algorithm>
+#include <array>
 #include <bit>
 #include <string>
 #include <vector>
@@ -44,6 +51,11 @@ std::uint64_t loadWord(const Byte* at) {
   return word;
 }
 
+std::uint64_t littleEndian(std::uint64_t word) {
+  if constexpr (std::endian::native == std::endian::little) return word;
+  return __builtin_bswap64(word);
+}
+
 // The words that a short hash of a text is made of, and whether any byte is
 // outside ASCII.
 struct TextGlance {
@@ -67,11 +79,7 @@ struct TextGlance {
   std::uint64_t word = 0;
   if (static_cast<std::size_t>(end - at) >= sizeof word) [[likely]] {
     const std::uint64_t mask = (std::uint64_t{1} << (8 * size)) - 1;
-    if constexpr (std::endian::native == std::endian::little) {
-      word = loadWord(at) & mask;
-    } else {
-      word = __builtin_bswap64(loadWord(at)) & mask;
-    }
+    word = littleEndian(loadWord(at)) & mask;
   } else {
     for (std::size_t i = 0; i < size; ++i) word |= std::uint64_t{at[i]} << (8 * i);
   }
@@ -80,6 +88,80 @@ struct TextGlance {
 
 [[gnu::always_inline]] inline std::uint32_t mix(std::uint64_t a, std::uint64_t b) {
   return static_cast<std::uint32_t>(((a ^ std::rotl(b, 29)) * 0x9E3779B97F4A7C15) >> 32);
+}
+
+// Texts up to this size have it in their first byte.
+constexpr std::size_t kShortText = 23;
+constexpr Byte kShortTextHead = kTextString << 5;
+
+// The longest plain entry, and the word that is read of a text's last bytes.
+constexpr std::size_t kPlainEntryRoom = 2 * (1 + kShortText) + sizeof(std::uint64_t);
+constexpr std::size_t kPlainElementRoom = 1 + kShortText + sizeof(std::uint64_t);
+
+// The sizes of items that are right whatever follows their first byte: integers, truths
+// and doubles. 0 for all others.
+constexpr auto kPlainSizes = [] {
+  std::array<std::uint8_t, 256> sizes{};
+  for (unsigned i = 0; i < kOneByteFollows; ++i) {
+    sizes[kUnsignedInteger << 5 | i] = sizes[kNegativeInteger << 5 | i] = 1;
+  }
+  for (unsigned i = 0; i < 4; ++i) {
+    const auto size = static_cast<std::uint8_t>(1 + (1 << i));
+    sizes[kUnsignedInteger << 5 | (kOneByteFollows + i)] = size;
+    // Of eight bytes, some are below the least.
+    if (i < 3) sizes[kNegativeInteger << 5 | (kOneByteFollows + i)] = size;
+    if (i > 0) sizes[kSimpleItem << 5 | (kOneByteFollows + i)] = size;
+  }
+  sizes[kFalseItem] = sizes[kTrueItem] = 1;
+  return sizes;
+}();
+
+// As `glance`, of a text of `size` bytes, `kShortText` at most, behind whose beginning
+// are a word's bytes or more.
+[[gnu::always_inline]] inline TextGlance glanceAtShort(const Byte* at, std::size_t size) {
+  constexpr std::size_t kWord = sizeof(std::uint64_t);
+  if (size < kWord) {
+    const std::uint64_t word =
+        littleEndian(loadWord(at)) & ((std::uint64_t{1} << (8 * size)) - 1);
+    return {word, 0, (word & kHighBits) == 0};
+  }
+  const std::uint64_t first = loadWord(at);
+  const std::uint64_t last = loadWord(at + size - kWord);
+  const std::uint64_t between = loadWord(at + std::min(kWord, size - kWord));
+  return {first, last, ((first | between | last) & kHighBits) == 0};
+}
+
+// The size of the plain item at `at`, behind which there is room for one. 0: another.
+[[gnu::always_inline]] inline std::size_t plainSize(const Byte* at) {
+  const unsigned head = *at;
+  const auto textSize = static_cast<std::uint8_t>(head - kShortTextHead);
+  if (textSize <= kShortText) {
+    return glanceAtShort(at + 1, textSize).isASCII ? std::size_t{1} + textSize : 0;
+  }
+  return kPlainSizes[head];
+}
+
+// `at` moved on by the size of a plain item. A processor guesses which of the usual sizes
+// it is and goes on with the next item; without the barriers the compiler makes one
+// addition of all, which waits until this item's first byte has come (a sixth of the
+// check).
+[[gnu::always_inline]] inline const Byte* behindPlain(const Byte* at, std::size_t size) {
+  switch (size) {
+    case 1:
+      at += 1;
+      asm volatile("" : "+r"(at));
+      return at;
+    case 3:
+      at += 3;
+      asm volatile("" : "+r"(at));
+      return at;
+    case 9:
+      at += 9;
+      asm volatile("" : "+r"(at));
+      return at;
+    default:
+      return at + size;
+  }
 }
 
 // A number that differs from process to process.
@@ -145,9 +227,10 @@ struct KeyNote {
 
 class ItemCheck {
  public:
-  ItemCheck(Bytes bytes, const PayloadLimits& limits)
+  ItemCheck(Bytes bytes, const PayloadLimits& limits, const Byte* readableEnd)
       : begin_(bytes.data()),
         end_(begin_ + bytes.size()),
+        readableEnd_(std::max(end_, readableEnd)),
         keyBytes_(limits.keyBytes),
         nesting_(std::min(limits.nesting, kDeepestNesting)),
         nodesLeft_(limits.nodes) {}
@@ -159,8 +242,10 @@ class ItemCheck {
     std::size_t left;  // Elements or entries to come.
     bool isMap;
     bool isLarge;
-    std::uint8_t keys;      // In the two tables below.
-    std::uint64_t keyBits;  // Of a small dictionary.
+    struct Keys {
+      std::size_t count;    // In the two tables below.
+      std::uint64_t bits;   // Of their hashes.
+    } keys;                 // Of a small dictionary.
     std::size_t firstNote;  // Of a large dictionary, in `notes_`.
     std::uint32_t hashes[kSmallDictionary];
     std::uint32_t offsets[kSmallDictionary];
@@ -173,11 +258,19 @@ class ItemCheck {
   const char* checkDate(const Byte*& at) const;
   void close(Level& level);
 
-  void noteSmallKey(Level& level, std::uint32_t hash, const Byte* key);
+  std::size_t bytesFrom(const Byte* at) const {
+    return static_cast<std::size_t>(readableEnd_ - at);
+  }
+  void passPlainItems(const Byte*& at, Level& level);
+  void passPlainEntries(const Byte*& at, Level& level);
+  void passPlainElements(const Byte*& at, Level& level) const;
+
+  void noteSmallKey(Level::Keys& keys, Level& level, std::uint32_t hash, const Byte* key);
   void noteLargeKey(const Byte* key);
 
   const Byte* const begin_;
   const Byte* const end_;
+  const Byte* const readableEnd_;
   const std::size_t keyBytes_;
   const std::size_t nesting_;
   std::size_t nodesLeft_;
@@ -244,26 +337,28 @@ class ItemCheck {
   if (level.isLarge) [[unlikely]] {
     noteLargeKey(key);
   } else {
-    noteSmallKey(level, hash, key);
+    noteSmallKey(level.keys, level, hash, key);
   }
   return nullptr;
 }
 
-[[gnu::always_inline]] inline void ItemCheck::noteSmallKey(Level& level,
+// `keys` are those of `level`, or a copy of them.
+[[gnu::always_inline]] inline void ItemCheck::noteSmallKey(Level::Keys& keys,
+                                                           Level& level,
                                                            std::uint32_t hash,
                                                            const Byte* key) {
   const std::uint64_t bit = std::uint64_t{1} << (hash >> 26);
-  if (level.keyBits & bit) {
-    for (std::size_t i = 0; i < level.keys; ++i) {
+  if (keys.bits & bit) {
+    for (std::size_t i = 0; i < keys.count; ++i) {
       if (level.hashes[i] != hash) continue;
       const Byte* const other = begin_ + level.offsets[i];
       if (compare(keyAt(other, end_), keyAt(key, end_)) == 0) hasRepeatedKeys_ = true;
     }
   }
-  level.keyBits |= bit;
-  level.hashes[level.keys] = hash;
-  level.offsets[level.keys] = static_cast<std::uint32_t>(key - begin_);
-  ++level.keys;
+  keys.bits |= bit;
+  level.hashes[keys.count] = hash;
+  level.offsets[keys.count] = static_cast<std::uint32_t>(key - begin_);
+  ++keys.count;
 }
 
 [[gnu::noinline]] void ItemCheck::noteLargeKey(const Byte* key) {
@@ -285,8 +380,7 @@ const char* ItemCheck::open(const Byte*& at, const Head& head, std::size_t& dept
   level.left = head.argument;
   level.isMap = isMap;
   level.isLarge = isMap && level.left > kSmallDictionary;
-  level.keys = 0;
-  level.keyBits = 0;
+  level.keys = {};
   level.firstNote = notes_.size();
   return nullptr;
 }
@@ -332,6 +426,43 @@ const char* ItemCheck::open(const Byte*& at, const Head& head, std::size_t& dept
   notes_.erase(first, notes_.end());
 }
 
+[[gnu::always_inline]] inline void ItemCheck::passPlainItems(const Byte*& at,
+                                                             Level& level) {
+  if (!level.isMap) return passPlainElements(at, level);
+  if (!level.isLarge && keyBytes_ >= kShortText) passPlainEntries(at, level);
+}
+
+[[gnu::always_inline]] inline void ItemCheck::passPlainEntries(const Byte*& at,
+                                                               Level& level) {
+  Level::Keys keys = level.keys;
+  std::size_t left = level.left;
+  const Byte* key = at;
+  while (left != 0 && bytesFrom(key) >= kPlainEntryRoom) {
+    const auto keySize = static_cast<std::uint8_t>(*key - kShortTextHead);
+    if (keySize > kShortText) break;
+    const TextGlance seen = glanceAtShort(key + 1, keySize);
+    const Byte* const value = key + 1 + keySize;
+    const std::size_t valueSize = plainSize(value);
+    if (!seen.isASCII || valueSize == 0 || value + valueSize > end_) break;
+    noteSmallKey(keys, level, mix(seen.first + keySize, seen.last), key);
+    key = behindPlain(value, valueSize);
+    --left;
+  }
+  level.keys = keys;
+  level.left = left;
+  at = key;
+}
+
+[[gnu::always_inline]] inline void ItemCheck::passPlainElements(const Byte*& at,
+                                                                Level& level) const {
+  while (level.left != 0 && bytesFrom(at) >= kPlainElementRoom) {
+    const std::size_t size = plainSize(at);
+    if (size == 0 || at + size > end_) return;
+    at = behindPlain(at, size);
+    --level.left;
+  }
+}
+
 DecodeError ItemCheck::run(std::size_t& size, bool& hasRepeatedKeys) {
   if (begin_ == end_) return kTruncated;
   if (nodesLeft_ == 0) return kTooManyValues;
@@ -341,6 +472,7 @@ DecodeError ItemCheck::run(std::size_t& size, bool& hasRepeatedKeys) {
   const char* error = checkValue(at, depth);
   while (error == nullptr && depth != 0) {
     Level& level = levels_[depth - 1];
+    passPlainItems(at, level);
     if (level.left == 0) {
       if (level.isLarge) close(level);
       --depth;
@@ -537,8 +669,9 @@ bool isUTF8(std::span<const std::uint8_t> text) {
 }
 
 DecodeError checkItem(std::span<const std::uint8_t> bytes, const PayloadLimits& limits,
-                      std::size_t& size, bool& hasRepeatedKeys) {
-  ItemCheck check(bytes, limits);
+                      std::size_t& size, bool& hasRepeatedKeys,
+                      const std::uint8_t* readableEnd) {
+  ItemCheck check(bytes, limits, readableEnd);
   return check.run(size, hasRepeatedKeys);
 }
 
@@ -549,7 +682,8 @@ DecodedDictionary decodeDictionary(std::span<const std::uint8_t> bytes,
   if (bytes[0] >> 5 != kMapItem) return {std::nullopt, kNotADictionary};
   std::size_t size = 0;
   bool hasRepeatedKeys = false;
-  if (auto error = checkItem(bytes, limits, size, hasRepeatedKeys)) {
+  const Byte* const readableEnd = owner ? owner.data() + owner.size() : nullptr;
+  if (auto error = checkItem(bytes, limits, size, hasRepeatedKeys, readableEnd)) {
     return {std::nullopt, error};
   }
   auto item = bytes.first(size);

@@ -28,9 +28,11 @@ using DecodeError = std::optional<std::string_view>;
 /// `hasRepeatedKeys` becomes true when a dictionary in it holds a key twice.
 /// Takes time in proportion to the bytes, and no memory while no dictionary has
 /// more than 16 entries; larger ones cost 8 bytes a key until the call returns,
-/// and a sort. On an error neither result means anything.
+/// and a sort. On an error neither result means anything. `readableEnd` says up to where
+/// bytes behind `bytes` may be read, which makes it faster whatever they are; null: none.
 DecodeError checkItem(std::span<const std::uint8_t> bytes, const PayloadLimits& limits,
-                      std::size_t& size, bool& hasRepeatedKeys);
+                      std::size_t& size, bool& hasRepeatedKeys,
+                      const std::uint8_t* readableEnd = nullptr);
 
 /// Whether `text` is well-formed UTF-8: no overlong form, no surrogate, nothing
 /// above U+10FFFF.

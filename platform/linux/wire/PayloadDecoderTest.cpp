@@ -221,6 +221,66 @@ TEST(PayloadCheck, TakesKeysUpToTheLimit) {
   EXPECT_TRUE(check(withKeyOf(21), limits).error);
 }
 
+// A limit below the longest text that has its size in its first byte turns the quick way
+// over plain entries off.
+TEST(PayloadCheck, FindsTheSameOnItsQuickWayWhateverByteIsWrong) {
+  const std::string item = encoded([](ValueEncoder& to) {
+    to.beginDictionary(8);
+    to.string("route");
+    to.string("Speaker");
+    to.string("a key of 20 bytes...");
+    to.string("a text of 23 bytes.....");
+    to.string("rate");
+    to.signedInteger(48000);
+    to.string("gain");
+    to.floatingPoint(-0.5);
+    to.string("");
+    to.signedInteger(-4);
+    to.string("isMuted");
+    to.boolean(false);
+    to.string("list");
+    to.beginArray(3);
+    to.string("aac");
+    to.signedInteger(7'000'000'000);
+    to.string("");
+    to.string("last");
+    to.string("8 bytes.");
+  });
+  const PayloadLimits general{.nesting = 32, .nodes = 100, .keyBytes = 22};
+  const PayloadLimits quick{.nesting = 32, .nodes = 100, .keyBytes = 23};
+  int rejected = 0;
+  for (std::size_t at = 0; at < item.size(); ++at) {
+    for (int byte = 0; byte < 256; ++byte) {
+      std::string other = item;
+      other[at] = static_cast<char>(byte);
+      const Checked expected = check(other, general);
+      if (expected.error == "a key is too long") continue;
+      const Checked seen = check(other, quick);
+      ASSERT_EQ(seen.error, expected.error) << at << " " << byte;
+      rejected += expected.error.has_value();
+      if (expected.error) continue;
+      ASSERT_EQ(seen.size, expected.size) << at << " " << byte;
+      ASSERT_EQ(seen.hasRepeatedKeys, expected.hasRepeatedKeys) << at << " " << byte;
+    }
+  }
+  EXPECT_GT(rejected, 5000);
+}
+
+TEST(PayloadCheck, FindsARepeatedKeyOnItsQuickWay) {
+  for (std::size_t first = 0; first < 10; ++first) {
+    for (std::size_t second = first + 1; second < 10; ++second) {
+      const std::string item = encoded([&](ValueEncoder& to) {
+        to.beginDictionary(10);
+        for (std::size_t i = 0; i < 10; ++i) {
+          to.string("key number " + std::to_string(i == second ? first : i));
+          to.signedInteger(1);
+        }
+      });
+      EXPECT_TRUE(check(item).hasRepeatedKeys) << first << " " << second;
+    }
+  }
+}
+
 TEST(PayloadCheck, SaysWhenAKeyIsRepeated) {
   EXPECT_TRUE(check(bytesOf({0xA2, 0x61, 'a', 0x00, 0x61, 'a', 0x00})).hasRepeatedKeys);
   EXPECT_FALSE(check(bytesOf({0xA2, 0x61, 'a', 0x00, 0x61, 'b', 0x00})).hasRepeatedKeys);
@@ -391,7 +451,7 @@ TEST(PayloadDecoder, ChargesNothingForWhatItRejects) {
   const auto account = std::make_shared<CountingAccount>();
   const std::string bytes = bytesOf({0xA2, 0x01, 0x02, 0x01, 0xF6});
   const ValueBuffer owner = ValueBuffer::copyOfInput(spanOf(bytes), account);
-  const auto decoded = decodeDictionary({owner.data(), owner.size()}, kTestLimits, owner);
+  const auto decoded = decodeDictionary({owner.data(), bytes.size()}, kTestLimits, owner);
   EXPECT_FALSE(decoded.dictionary);
   EXPECT_EQ(account.use_count(), 2) << "the test's and the owner's";
   EXPECT_EQ(account->bytes(), 0U);
@@ -422,7 +482,7 @@ TEST(PayloadDecoder, CopiesADictionaryWithRepeatedKeysAndChargesTheOwnersAccount
     const std::string bytes = bytesOf({0xA2, 0x01, 0x02, 0x01, 0x03});
     const ValueBuffer owner = ValueBuffer::copyOfInput(spanOf(bytes), account);
     const auto decoded =
-        decodeDictionary({owner.data(), owner.size()}, kTestLimits, owner);
+        decodeDictionary({owner.data(), bytes.size()}, kTestLimits, owner);
     ASSERT_TRUE(decoded.dictionary);
     EXPECT_EQ(description(decoded.dictionary->value()), "{1: 3}");
     EXPECT_EQ(decoded.size, bytes.size());

@@ -290,6 +290,7 @@ struct Ours {
 Ours ours(const std::string& item) {
   const ExactBytes exact(item);
   const auto decoded = decodeWhole(exact.span(), kLimits);
+  EXPECT_FALSE(decoded.dictionary && check(item, kLimits).error);
   if (!decoded.dictionary) return {{}, {}, std::string(*decoded.error)};
   const ValueView value = decoded.dictionary->value();
   return {textOf(value, /*areDatesNumbers=*/false),
