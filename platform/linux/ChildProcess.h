@@ -3,11 +3,13 @@
 
 #include <fcntl.h>
 #include <signal.h>
+#include <spawn.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
-#include <cstdlib>
+#include <algorithm>
 #include <string>
+#include <string_view>
 #include <vector>
 
 namespace ostrel::testing_support {
@@ -19,22 +21,21 @@ class ChildProcess {
   explicit ChildProcess(std::vector<std::string> command,
                         const std::string& output = "/dev/null",
                         const std::vector<std::string>& environment = {}) {
-    std::vector<char*> arguments;
-    for (std::string& argument : command) arguments.push_back(argument.data());
-    arguments.push_back(nullptr);
-    pid_ = ::fork();
-    if (pid_ == 0) {
-      const int in = ::open("/dev/null", O_RDONLY);
-      const int out = ::open(output.c_str(), O_WRONLY | O_CREAT | O_APPEND, 0600);
-      ::dup2(in, STDIN_FILENO);
-      ::dup2(out, STDOUT_FILENO);
-      ::dup2(out, STDERR_FILENO);
-      for (const std::string& variable : environment) {
-        ::putenv(const_cast<char*>(variable.c_str()));
-      }
-      ::execvp(arguments.front(), arguments.data());
-      ::_exit(127);
+    std::vector<char*> arguments = pointersTo(command);
+    std::vector<std::string> variables = withInherited(environment);
+    posix_spawn_file_actions_t files;
+    ::posix_spawn_file_actions_init(&files);
+    ::posix_spawn_file_actions_addopen(&files, STDIN_FILENO, "/dev/null", O_RDONLY, 0);
+    ::posix_spawn_file_actions_addopen(&files, STDOUT_FILENO, output.c_str(),
+                                       O_WRONLY | O_CREAT | O_APPEND, 0600);
+    ::posix_spawn_file_actions_adddup2(&files, STDOUT_FILENO, STDERR_FILENO);
+    // A copy of a process with threads must not do more than this before it becomes
+    // another program: a lock that another thread held would never be free.
+    if (::posix_spawnp(&pid_, arguments.front(), &files, /*attributes=*/nullptr,
+                       arguments.data(), pointersTo(variables).data()) != 0) {
+      pid_ = 0;
     }
+    ::posix_spawn_file_actions_destroy(&files);
   }
   ChildProcess(const ChildProcess&) = delete;
   ChildProcess& operator=(const ChildProcess&) = delete;
@@ -46,15 +47,37 @@ class ChildProcess {
 
   pid_t pid() const { return pid_; }
 
-  /// Waits for its end by itself; the exit status, or -1 for another end.
+  /// Waits for its end by itself; the exit status, or -1 for another end and for a
+  /// program that could not be started.
   int wait() {
-    int status = 0;
-    ::waitpid(pid_, &status, 0);
+    int status = -1;
+    if (pid_ > 0) ::waitpid(pid_, &status, 0);
     pid_ = 0;
     return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
   }
 
  private:
+  static std::vector<char*> pointersTo(std::vector<std::string>& texts) {
+    std::vector<char*> pointers;
+    for (std::string& text : texts) pointers.push_back(text.data());
+    pointers.push_back(nullptr);
+    return pointers;
+  }
+
+  // `variables`, and those of this process that are not among them.
+  static std::vector<std::string> withInherited(
+      const std::vector<std::string>& variables) {
+    std::vector<std::string> all = variables;
+    for (char** inherited = environ; *inherited != nullptr; ++inherited) {
+      const std::string_view variable(*inherited);
+      const std::string_view name = variable.substr(0, variable.find('=') + 1);
+      const bool isOverridden = std::ranges::any_of(
+          variables, [&](const std::string& own) { return own.starts_with(name); });
+      if (!isOverridden) all.emplace_back(variable);
+    }
+    return all;
+  }
+
   pid_t pid_ = 0;
 };
 
