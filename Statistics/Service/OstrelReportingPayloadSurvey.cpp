@@ -1,5 +1,6 @@
 #include "Statistics/Service/OstrelReportingPayloadSurvey.h"
 
+#include <bit>
 #include <cstddef>
 #include <cstdint>
 #include <cstring>
@@ -10,7 +11,8 @@
 namespace ostrel {
 namespace {
 
-// Not 0 when one of the eight characters is a blank.
+// Not 0 where one of the eight characters from `text` on is a blank: the lowest byte of
+// it that is not 0 is that of the first.
 std::uint64_t blanksIn8(const char* text) {
   constexpr std::uint64_t kOnes = 0x0101010101010101;
   std::uint64_t word;
@@ -19,9 +21,14 @@ std::uint64_t blanksIn8(const char* text) {
   return (word - kOnes) & ~word & (kOnes << 7);
 }
 
-// Keys are short: a call of `memchr` takes longer than the search.
-bool holdsBlank(std::string_view text) {
+// Keys are short: a call of `memchr` takes longer than the search. Up to `readableEnd`
+// there are bytes, be it other ones than of the text.
+bool holdsBlank(std::string_view text, const char* readableEnd) {
   if (text.size() < 8) {
+    if (std::endian::native == std::endian::little && readableEnd - text.data() >= 8) {
+      const std::uint64_t ofText = (std::uint64_t{1} << (8 * text.size())) - 1;
+      return (blanksIn8(text.data()) & ofText) != 0;
+    }
     bool isFound = false;
     for (const char character : text) isFound |= character == ' ';
     return isFound;
@@ -50,12 +57,15 @@ void fetchNextMessage(const std::uint8_t* payload) {
 PayloadSurvey::PayloadSurvey(const Dictionary& payload) : begin_(payload.value().data()) {
   fetchNextMessage(begin_);
   const DictionaryView entries = payload.view();
+  const ValueBuffer& owner = payload.owner();
+  const auto* const readableEnd =
+      reinterpret_cast<const char*>(owner.data() + owner.size());
   ValueView last = payload.value();
   for (const auto& [key, value] : entries) {
     last = value;
     const auto text = key.string();
     if (!text) continue;
-    hasBlankInKey_ |= holdsBlank(*text);
+    hasBlankInKey_ |= holdsBlank(*text, readableEnd);
     hasEngineOnTime_ |= *text == OstrelReportingWattlogUtility::kEngineOnTimeKey;
   }
   end_ = last.end();  // Of the last value, or of the dictionary without any.
