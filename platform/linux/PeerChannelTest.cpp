@@ -2,6 +2,9 @@
 
 #include <gtest/gtest.h>
 
+#include <cstdint>
+#include <memory>
+#include <span>
 #include <string>
 
 #include "platform/linux/PeerChannelTestSupport.h"
@@ -142,6 +145,17 @@ TEST_F(PeerChannelReserve, IsSharedByTheConnectionsOfAProcess) {
   EXPECT_FALSE(two->isOverBudget());
   three->relieve(1);
   EXPECT_FALSE(one->isOverBudget());
+}
+
+// As half a frame is read.
+TEST_F(PeerChannelReserve, IsNotTakenFromAProcessWhoseReadsChargeNothing) {
+  const auto process = makeProcess();
+  const std::shared_ptr<PeerChannel> half = connect(process);
+  const std::uint8_t byte = 0;
+  for (int i = 0; i < 3; ++i) {
+    ValueBuffer::copyOfInput(std::span(&byte, 1).first(0), half);
+  }
+  EXPECT_EQ(mostBeside(0, [&] { return process; }), 20u);
 }
 
 TEST_F(PeerChannelReserve, LetsOneLargeRequestAfterTheOther) {

@@ -11,19 +11,23 @@ class RequestBudget {
  public:
   explicit RequestBudget(std::size_t most) : most_(most) {}
 
-  /// True when nothing was under way before.
-  bool take(std::size_t bytes) noexcept { return used_.fetch_add(bytes) == 0; }
+  /// True when nothing was under way before. Of 0 bytes neither is ever true: what
+  /// charges nothing begins and ends nothing.
+  bool take(std::size_t bytes) noexcept {
+    return used_.fetch_add(bytes) == 0 && bytes != 0;
+  }
 
   struct Given {
     bool tellsWaiter;  // Which is then no waiter any more.
-    bool isLast;       // Nothing is under way now.
+    bool isLast;       // Nothing is under way any more.
   };
   Given give(std::size_t bytes) noexcept {
     const std::size_t left = used_.fetch_sub(bytes) - bytes;
-    return {left <= half() && takeWaiter(), left == 0};
+    return {left <= half() && takeWaiter(), left == 0 && bytes != 0};
   }
 
-  /// From now on so many may be under way; what is beyond it runs off. True as `give`.
+  /// From now on so many may be under way; what is beyond it runs off. True: a waiter is
+  /// to be told, as by `give`.
   bool limitTo(std::size_t most) noexcept {
     if (most_.exchange(most) >= most) return false;
     return used_.load() <= half() && takeWaiter();

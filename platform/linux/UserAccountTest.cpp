@@ -77,6 +77,15 @@ TEST(RequestBudget, SaysWhenAnythingIsUnderWayAndWhenNothingIs) {
   EXPECT_TRUE(budget.take(1));
 }
 
+TEST(RequestBudget, BeginsAndEndsNothingWithNoBytes) {
+  RequestBudget budget(100);
+  EXPECT_FALSE(budget.give(0).isLast);
+  EXPECT_FALSE(budget.take(0));
+  EXPECT_TRUE(budget.take(1));
+  EXPECT_FALSE(budget.give(0).isLast);
+  EXPECT_TRUE(budget.give(1).isLast);
+}
+
 TEST(RequestBudget, DoesNotLetWaitWhenHalfIsFreeAlready) {
   RequestBudget budget(100);
   budget.take(50);
