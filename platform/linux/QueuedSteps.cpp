@@ -39,15 +39,19 @@ struct Kept {
   std::size_t count = 0;
   QueuedStep* full = nullptr;  // A whole batch beside `steps`, so that a thread that
                                // goes up and down does not go to the stock each time.
-  ~Kept() {
-    freeAll(std::exchange(steps, nullptr));
-    freeAll(std::exchange(full, nullptr));
-    hasEnded = true;
-  }
-  bool hasEnded = false;
+  ~Kept();
 };
 
 thread_local Kept kept;
+// Whether the thread's has ended. Not in there: compilers leave out what a destructor
+// writes to its own object.
+thread_local bool hasEnded = false;
+
+Kept::~Kept() {
+  hasEnded = true;
+  freeAll(steps);
+  freeAll(full);
+}
 
 QueuedStep* takeBatch() {
   Stock& from = stock();
@@ -68,11 +72,10 @@ void giveBatch(QueuedStep* batch) noexcept {
 }
 
 QueuedStep* takeMemory() {
+  if (hasEnded) return new QueuedStep;
   Kept& mine = kept;
   if (mine.steps == nullptr) {
-    mine.steps = mine.full != nullptr ? std::exchange(mine.full, nullptr)
-                 : mine.hasEnded      ? nullptr
-                                      : takeBatch();
+    mine.steps = mine.full != nullptr ? std::exchange(mine.full, nullptr) : takeBatch();
     if (mine.steps == nullptr) return new QueuedStep;
     mine.count = kBatch;
   }
@@ -92,11 +95,11 @@ QueuedStep* QueuedStep::make(Task&& task) {
 }
 
 void QueuedStep::takeBack(QueuedStep* step) noexcept {
-  Kept& mine = kept;
-  if (mine.hasEnded) {
+  if (hasEnded) {
     delete step;
     return;
   }
+  Kept& mine = kept;
   if (mine.count == kBatch) {
     if (mine.full != nullptr) giveBatch(mine.full);
     mine.full = std::exchange(mine.steps, nullptr);

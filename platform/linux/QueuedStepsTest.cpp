@@ -2,6 +2,7 @@
 
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
+#include <malloc.h>
 
 #include <memory>
 #include <thread>
@@ -117,6 +118,37 @@ TEST(QueuedStep, GoesRoundBetweenThreads) {
     }).join();
     EXPECT_EQ(count, kSteps);
   }
+}
+
+/// Ends steps when its thread ends, after what the thread keeps of their memory.
+struct LastSteps {
+  StepList list;
+  std::size_t* count = nullptr;
+  ~LastSteps() {
+    if (count == nullptr) return;
+    while (!list.empty()) list.runFirst();
+    list.append(QueuedStep::make([count = count] { ++*count; }));
+    list.runFirst();
+  }
+};
+
+TEST(QueuedStep, IsFreedByAThreadThatKeepsNoneAnyMore) {
+  constexpr std::size_t kThreads = 200;
+  constexpr std::size_t kSteps = 60;
+  std::size_t count = 0;
+  const std::size_t before = ::mallinfo2().uordblks;
+  for (std::size_t i = 0; i < kThreads; ++i) {
+    std::thread([&] {
+      // Made first, so that it ends last.
+      thread_local LastSteps last;
+      last.count = &count;
+      for (std::size_t j = 0; j < kSteps; ++j) {
+        last.list.append(QueuedStep::make([&count] { ++count; }));
+      }
+    }).join();
+  }
+  EXPECT_EQ(count, kThreads * (kSteps + 1));
+  EXPECT_LT(::mallinfo2().uordblks, before + kThreads * kSteps * sizeof(QueuedStep) / 4);
 }
 
 }  // namespace
