@@ -157,6 +157,7 @@ class FileEntryStorage::Entries final : public StoredEntries {
     noteUsed();
     std::vector<EntriesSnapshot::Part> parts;
     for (Chunk& chunk : chunks_) {
+      if (chunk.used == 0) continue;
       chunk.isShared = true;
       parts.push_back({chunk.memory, chunk.used});
     }
@@ -268,7 +269,8 @@ class FileEntryStorage::Entries final : public StoredEntries {
       std::vector<Bytes> parts;
       std::size_t size = 0;
       for (const Chunk& chunk : chunks_) {
-        if (!parts.empty() && size + chunk.used > kLargestExtent) break;
+        // Never an extent of nothing: the last chunk that was written may be empty still.
+        if (size != 0 && size + chunk.used > kLargestExtent) break;
         parts.emplace_back(chunk.memory->data(), chunk.used);
         size += chunk.used;
       }

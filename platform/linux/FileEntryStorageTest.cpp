@@ -219,6 +219,32 @@ TEST_F(FileEntryStorageTest, KeepsEntriesInMemoryWhileTheDiskIsFull) {
   EXPECT_LE(storage.bytesInMemory(), 128u * 1024);
 }
 
+// An entry that is larger than an extent comes while the disk is full, and has a chunk of
+// its own behind the one that was written last and is empty.
+TEST_F(FileEntryStorageTest, WritesNoExtentOfNothingBeforeALargeEntry) {
+  FileEntryStorage storage = storageOf(/*bytesOfList=*/4096, /*bytesOfAll=*/4 << 20);
+  const auto entries = storage.makeEntries(kSession);
+  std::string expected;
+  const auto add = [&](std::size_t size, char letter) {
+    ASSERT_TRUE(append(*entries, std::string(size, letter)));
+    expected += std::string(size, letter);
+  };
+  add(3000, 'a');
+  add(3000, 'b');
+  add(200'000, 'c');
+  ASSERT_TRUE(storage.hasFile());
+  faults_.writeError = ENOSPC;
+  add(300'000, 'd');
+  faults_.writeError = 0;
+  add(200'000, 'e');
+  std::string all;
+  entries->snapshot()->forEachRun([&](StoredEntries::Bytes run) {
+    EXPECT_NE(run.size(), 0u);
+    all.append(run.begin(), run.end());
+  });
+  EXPECT_TRUE(all == expected);
+}
+
 TEST_F(FileEntryStorageTest, RefusesWhatFitsNeitherDiskNorMemory) {
   faults_.writeError = ENOSPC;
   FileEntryStorage storage = storageOf(/*bytesOfList=*/4096, /*bytesOfAll=*/10'000);

@@ -28,7 +28,10 @@ namespace {
 constexpr std::uint64_t kPage = 4096;
 constexpr mode_t kFileMode = 0600;
 
-std::uint64_t roomOf(std::size_t size) { return (size + kPage - 1) / kPage * kPage; }
+// A page at least, so that no two extents begin at one place.
+std::uint64_t roomOf(std::size_t size) {
+  return (std::max<std::size_t>(size, 1) + kPage - 1) / kPage * kPage;
+}
 
 // 0, or the error.
 int writeAll(int file, std::span<iovec> parts, std::uint64_t begin,

@@ -139,6 +139,16 @@ TEST_F(SpillFileTest, WritesALargePieceByItself) {
   expectAllReadable();
 }
 
+TEST_F(SpillFileTest, TakesAPieceOfNothing) {
+  ASSERT_TRUE(write(0));
+  ASSERT_TRUE(write(1024));
+  expectAllReadable();
+  releasePieces(0, 1);
+  expectAllReadable();
+  releasePieces(0, 1);
+  EXPECT_FALSE(file_.isOpen());
+}
+
 TEST_F(SpillFileTest, HasPiecesOfEverySizeInTheirOrder) {
   std::mt19937 random(11);
   for (int i = 0; i < 600; ++i) ASSERT_TRUE(write(1 + random() % (kLargest + 2000)));
