@@ -389,6 +389,27 @@ TEST_F(StoreFaults, RefusesOnAFullDiskAndRecovers) {
             "1");
 }
 
+// Ends and flushes insert nothing by which their commit could be told.
+TEST_F(StoreFaults, KeepsTheEndOfASessionThoughItsCommitFailed) {
+  StoreOptions options = quickOptions();
+  options.vfs = FaultVFS::kName;
+  for (const int code : {SQLITE_FULL, SQLITE_IOERR_WRITE}) {
+    FaultVFS::instance().clearPlan();
+    open(options);
+    makeSession();
+    ASSERT_TRUE(send(1).succeeded);
+    ASSERT_EQ(flushed(*session_), std::nullopt);
+    FaultVFS::instance().setPlan({FaultPlan::Kind::kWrite, code, /*after=*/0});
+    session_.reset();
+    ASSERT_TRUE(eventually([&] { return FaultVFS::instance().failed() == 1; }));
+    close();
+    EXPECT_EQ(OtherConnection(path()).one(
+                  "SELECT count(*) FROM telemetry_sessions WHERE ended_at IS NULL"),
+              "0")
+        << code;
+  }
+}
+
 TEST_F(StoreFaults, GivesUpTheOldestInALongFaultAndCountsThem) {
   StoreOptions options = quickOptions();
   options.vfs = FaultVFS::kName;

@@ -137,6 +137,7 @@ StoreWriter::Result StoreWriter::writePending() {
   if (!isInTransaction_) {
     if (Result failed = database_.begin()) return failed;
     isInTransaction_ = true;
+    if (Result failed = database_.readFingerprint(fingerprintBefore_)) return failed;
     if (Result failed = readInterest()) return failed;
   }
   try {
@@ -294,7 +295,8 @@ std::vector<StoreBatch> StoreWriter::commit() {
     for (StoreSession* session : uncommittedSessions_) {
       made.rows.emplace_back(session, session->row);
     }
-    doubt_ = std::move(made);
+    // What inserts nothing is written again, whether it was there or not.
+    if (made.fingerprint != fingerprintBefore_) doubt_ = std::move(made);
     fail(*failed);
     return {};
   }

@@ -114,6 +114,7 @@ class StoreWriter {
   std::vector<StoreBatch> pending_;
   Position written_;  // What comes before it is in the open transaction.
   bool isInTransaction_ = false;
+  std::int64_t fingerprintBefore_ = 0;  // Of the store, before the transaction.
   std::size_t uncommittedBytes_ = 0;
   std::vector<StoreSession*> uncommittedSessions_;
   std::optional<DoubtfulCommit> doubt_;
