@@ -125,8 +125,8 @@ int StoreOwners::prepare(sqlite3* connection) {
        "first_id = ?2");
   make(made->drop, "DELETE FROM row_owners WHERE kind = ?1 AND first_id = ?2");
   make(made->timeOfOldestMessage,
-       "SELECT created_at FROM telemetry_messages WHERE id = (SELECT first_id FROM "
-       "row_owners WHERE user = ?1 AND kind = 0 ORDER BY first_id LIMIT 1)");
+       "SELECT created_at FROM row_owners LEFT JOIN telemetry_messages ON id = first_id "
+       "WHERE user = ?1 AND kind = 0 ORDER BY first_id LIMIT 1");
   if (code == SQLITE_OK) statements_ = std::move(made);
   return code;
 }
@@ -225,9 +225,12 @@ int StoreOwners::removeSessionsOf(std::int64_t user, std::int64_t rows,
   StoreStatement& time = statements_->timeOfOldestMessage;
   std::optional<std::int64_t> before;
   int code = time.begin(user);
-  if (code == SQLITE_ROW) before = time.integer(0);
+  const bool hasMessages = code == SQLITE_ROW;
+  if (hasMessages && !time.isNull(0)) before = time.integer(0);
   time.reset();
   if (code != SQLITE_ROW && code != SQLITE_OK) return code;
+  // The oldest has gone already, and is not forgotten yet: any may have messages.
+  if (hasMessages && !before) return SQLITE_OK;
   Statements::OfKind& ofKind = statements_->ofKind[indexOf(RowKind::kSessions)];
   code = ofKind.lastID.begin();
   const std::int64_t newest = ofKind.lastID.integer(0);

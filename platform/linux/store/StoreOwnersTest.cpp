@@ -195,6 +195,23 @@ TEST_F(OwnersOfRows, LetTheNextLoseRowsWhereNoneOfTheirsMayGo) {
   EXPECT_EQ(one("SELECT max(id), count(*) < 2500 FROM telemetry_messages"), "3000|1");
 }
 
+// As where many rows have become too old at once.
+TEST_F(OwnersOfRows, KeepSessionsWithMessagesThoughTheOldestOfTheseHasGone) {
+  open();
+  send(begin(1), 1, 1500);
+  sessions.clear();
+  send(begin(2), 2, 1);
+  close();
+  // The oldest that is left by the first removal, of 1,000.
+  OtherConnection(path()).run("DELETE FROM telemetry_messages WHERE id = 1001");
+  StoreOptions options;
+  options.retention.bytes = 1'000'000;
+  open(options);
+  send(begin(2), 2, 1);
+  EXPECT_EQ(one("SELECT min(id), count(*) FROM telemetry_messages"), "1002|501");
+  EXPECT_EQ(one("SELECT count(*) FROM telemetry_sessions WHERE reporter_id = 1"), "1");
+}
+
 TEST_F(OwnersOfRows, AreBorneHoweverSomebodyMeddledWithThem) {
   open(optionsOfSmallStore());
   TelemetrySession& session = begin(1);
