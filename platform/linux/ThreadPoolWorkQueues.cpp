@@ -272,7 +272,8 @@ class alignas(64) ThreadPoolWorkQueues::Hand {
   std::size_t takeAll(std::span<std::shared_ptr<Strand>> strands) {
     const std::lock_guard lock(mutex_);
     const std::size_t count = count_ - next_;
-    std::move(&strands_[next_], &strands_[count_], strands.begin());
+    const auto first = strands_.begin() + static_cast<std::ptrdiff_t>(next_);
+    std::move(first, first + static_cast<std::ptrdiff_t>(count), strands.begin());
     next_ = count_;
     isEmpty_.store(true, std::memory_order_relaxed);
     return count;
@@ -551,8 +552,9 @@ bool ThreadPoolWorkQueues::Pool::othersWait() const {
 // With the lock. The others that the thread takes with the first are in its hand.
 std::shared_ptr<ThreadPoolWorkQueues::Strand> ThreadPoolWorkQueues::Pool::takeStrand(
     Hand& hand) {
-  const bool isUrgent = !urgentLine_.empty() && (urgentInARow_ < kUrgentInARow ||
-                                                 (line_.empty() && lowLine_.empty()));
+  // Where nobody waits behind them, any number may go.
+  if (line_.empty() && lowLine_.empty()) urgentInARow_ = 0;
+  const bool isUrgent = !urgentLine_.empty() && urgentInARow_ < kUrgentInARow;
   Line& line = isUrgent ? urgentLine_ : line_.empty() ? lowLine_ : line_;
   if (line.empty()) return nullptr;
   std::shared_ptr<Strand> strand = std::move(line.front());
@@ -561,8 +563,7 @@ std::shared_ptr<ThreadPoolWorkQueues::Strand> ThreadPoolWorkQueues::Pool::takeSt
   // Of those of low priority others might have to go first soon.
   Line& more = isUrgent ? urgentLine_ : line_;
   const std::size_t most =
-      isUrgent ? static_cast<std::size_t>(std::max(kUrgentInARow - urgentInARow_, 0))
-               : kStrandsInHand;
+      isUrgent ? static_cast<std::size_t>(kUrgentInARow - urgentInARow_) : kStrandsInHand;
   const std::size_t others =
       std::min({more.size() / (2 * kind_.mostThreads), most, kStrandsInHand});
   if (others != 0) {
@@ -593,6 +594,9 @@ std::shared_ptr<ThreadPoolWorkQueues::Strand> ThreadPoolWorkQueues::Pool::takeOv
     const std::uint32_t turns = other.turns();
     if (std::exchange(hand.seenTurns[i], turns) != turns && onlyStuck) continue;
     std::array<std::shared_ptr<Strand>, kStrandsInHand> taken;
+    // With the lock, since on their way they are in no hand: a thread that looked then
+    // would go to sleep, and leave them to this one however long its next step takes.
+    const std::lock_guard lock(mutex_);
     const std::size_t count = other.takeAll(taken);
     if (count == 0) continue;
     hand.fill({&taken[1], count - 1});
