@@ -402,7 +402,11 @@ ClientCore::Written ClientCore::writeOut() {
     while (writingBegin_ < writing_.size()) {
       const auto sent = socket_.send(std::string_view(writing_).substr(writingBegin_));
       if (!sent) return Written::kBroken;
-      if (*sent == 0) return Written::kBlocked;
+      if (*sent == 0) {
+        // What a flush waits for may be out, and only what came later is not.
+        changed_.notify_all();
+        return Written::kBlocked;
+      }
       writingBegin_ += *sent;
       writingBytes_ = writing_.size() - writingBegin_;
       const std::lock_guard lock(mutex_);
