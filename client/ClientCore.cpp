@@ -54,7 +54,8 @@ constexpr unsigned kMostRingPeriods = 8;
 
 constexpr std::size_t kReadSize = 64 * 1024;
 constexpr int kReadsInATurn = 16;
-constexpr int kRefillsInATurn = 4;
+// Then the thread looks for replies.
+constexpr int kWritesInARow = 4;
 
 // Buffers beyond it are given back when there is nothing to do.
 constexpr std::size_t kKeptBufferBytes = 256 * 1024;
@@ -292,7 +293,7 @@ void ClientCore::run() {
 
 // False when the client is over.
 bool ClientCore::takeTurn() {
-  endExpired();
+  if (std::exchange(hasExpired_, false)) endExpired();
   if (!socket_) connectIfDue();
   const Written written = socket_ ? writeOut() : Written::kAll;
   if (written == Written::kBroken) {
@@ -305,18 +306,24 @@ bool ClientCore::takeTurn() {
   Clock::time_point until;
   {
     const std::lock_guard lock(mutex_);
+    countWritten();
     if (isClosingDone()) return false;
     until = nextTurn(written);
+    const bool hasMore = until == Clock::time_point::min();
+    if (hasMore && ++writesInARow_ < kWritesInARow) return true;
     isAsleep_ = true;
     isBlocked_ = written == Written::kBlocked;
     sleepsUntil_ = until;
   }
+  writesInARow_ = 0;
   waitUntil(until, /*wantsToWrite=*/written == Written::kBlocked);
   bool awaitsBurst;
   {
     const std::lock_guard lock(mutex_);
     isAsleep_ = false;
     awaitsBurst = std::exchange(awaitsBurst_, false);
+    const auto deadline = pending_.nextDeadline();
+    hasExpired_ = deadline != Clock::time_point::max() && deadline <= Clock::now();
   }
   if (awaitsBurst) std::this_thread::sleep_for(kBurst);
   if (socket_) readReplies();
@@ -367,7 +374,8 @@ void ClientCore::connected(ClientSocket socket) {
   ++counts_.connections;
 }
 
-void ClientCore::connectionLost(const std::string& reason) {
+// `unanswered` is told with all requests that are open; it may be empty.
+void ClientCore::connectionLost(const std::string& reason, Handler unanswered) {
   bool isExpected;
   {
     const auto noFork = ForkGuard::lock();
@@ -382,12 +390,15 @@ void ClientCore::connectionLost(const std::string& reason) {
     queue_.clear();
     queueSent_ = 0;
     sessionsToRestore_ = sessions_;
-    endAll(isExpected ? Status::kClosed : Status::kConnectionLost);
+    const Status status = isExpected ? Status::kClosed : Status::kConnectionLost;
+    endings_.push_back({std::move(unanswered), status});
+    endAll(status);
     changed_.notify_all();
   }
   writing_.clear();
   writingBegin_ = 0;
   writingBytes_ = 0;
+  uncountedBytes_ = 0;
   const auto now = Clock::now();
   if (hasReplied_ || now - connectedAt_ >= kGoodConnection) backOff_ = kFirstBackOff;
   nextAttempt_ = now + withJitter(backOff_);
@@ -397,28 +408,28 @@ void ClientCore::connectionLost(const std::string& reason) {
 }
 
 ClientCore::Written ClientCore::writeOut() {
-  for (int refills = 0; refills < kRefillsInATurn; ++refills) {
-    if (writingBegin_ == writing_.size() && !refill()) return Written::kAll;
-    while (writingBegin_ < writing_.size()) {
-      const auto sent = socket_.send(std::string_view(writing_).substr(writingBegin_));
-      if (!sent) return Written::kBroken;
-      if (*sent == 0) {
-        // What a flush waits for may be out, and only what came later is not.
-        changed_.notify_all();
-        return Written::kBlocked;
-      }
-      writingBegin_ += *sent;
-      writingBytes_ = writing_.size() - writingBegin_;
-      const std::lock_guard lock(mutex_);
-      bytesWritten_ += *sent;
-    }
-    changed_.notify_all();
+  if (writingBegin_ == writing_.size()) refill();
+  while (writingBegin_ < writing_.size()) {
+    const auto sent = socket_.send(std::string_view(writing_).substr(writingBegin_));
+    if (!sent) return Written::kBroken;
+    if (*sent == 0) return Written::kBlocked;
+    writingBegin_ += *sent;
+    writingBytes_ = writing_.size() - writingBegin_;
+    uncountedBytes_ += *sent;
   }
-  return Written::kSome;
+  return Written::kAll;
 }
 
-// Takes what is queued. False when there is nothing.
-bool ClientCore::refill() {
+// With the lock. What was written since the last count; whoever waits for a flush hears
+// of it, also when the rest has to wait.
+void ClientCore::countWritten() {
+  if (uncountedBytes_ == 0) return;
+  bytesWritten_ += std::exchange(uncountedBytes_, 0);
+  changed_.notify_all();
+}
+
+// Takes what is queued.
+void ClientCore::refill() {
   writing_.clear();
   writingBegin_ = 0;
   std::uint64_t looksWanted;
@@ -447,7 +458,7 @@ bool ClientCore::refill() {
   if (queued == 0 && writing_.capacity() > kKeptBufferBytes) std::string().swap(writing_);
   if (isQueueAll) {
     changed_.notify_all();
-    return queued != 0;
+    return;
   }
   if (Clock::now() >= nextRingLook_) drainRings();
   if (isLastLook && !std::exchange(hasSaidFarewell_, true)) {
@@ -461,7 +472,6 @@ bool ClientCore::refill() {
     looksDone_ = looksWanted;
   }
   changed_.notify_all();
-  return !writing_.empty();
 }
 
 void ClientCore::drainRings() {
@@ -482,8 +492,9 @@ void ClientCore::drainRings() {
     if (size >= ring->capacity() / 16) wait = Clock::duration::zero();
   }
   rings_.erase(std::remove(rings_.begin(), rings_.end(), nullptr), rings_.end());
-  nextRingLook_ =
-      wait == Clock::duration::max() ? Clock::time_point::max() : Clock::now() + wait;
+  nextRingLook_ = wait == Clock::duration::max()    ? Clock::time_point::max()
+                  : wait == Clock::duration::zero() ? Clock::time_point::min()
+                                                    : Clock::now() + wait;
 }
 
 void ClientCore::readReplies() {
@@ -524,20 +535,23 @@ bool ClientCore::readFrames() {
 
 bool ClientCore::takeReply(std::span<const std::uint8_t> item) {
   using wire::Operation;
-  bool isForgotten = false;
+  PendingRequests::Answered answered;
   wire::Reply reply;
   const auto error = wire::decodeReply(
       item, kReplyLimits,
       [&](wire::RequestNumber number) -> std::optional<Operation> {
         const std::lock_guard lock(mutex_);
-        const auto operation = pending_.operationOf(number);
-        isForgotten = operation == Operation::kFarewell;
-        return operation;
+        pending_.takeForReply(number, answered);
+        if (isSilent_) answered.handler = {};
+        return answered.operation;
       },
       reply);
-  if (isForgotten) return true;  // Nobody waits for it any more.
+  // Nobody waits for it any more.
+  if (answered.operation == Operation::kFarewell) return true;
   if (error) {
-    connectionLost("the service sent a malformed reply: " + std::string(*error));
+    if (!answered.isFirst) answered.handler = {};
+    connectionLost("the service sent a malformed reply: " + std::string(*error),
+                   std::move(answered.handler));
     return false;
   }
   if (reply.number == 0) {
@@ -546,14 +560,8 @@ bool ClientCore::takeReply(std::span<const std::uint8_t> item) {
     return false;
   }
   hasReplied_ = true;
-  Handler handler;
-  {
-    const std::lock_guard lock(mutex_);
-    if (isSilent_) return true;
-    handler = pending_.takeForReply(reply.number);
-  }
-  if (callHandler(handler, reply.value)) return true;
-  callHandler(handler, Status::kConnectionLost);
+  if (callHandler(answered.handler, reply.value)) return true;
+  callHandler(answered.handler, Status::kConnectionLost);
   connectionLost("the service sent a reply of the wrong kind");
   return false;
 }
@@ -561,7 +569,6 @@ bool ClientCore::takeReply(std::span<const std::uint8_t> item) {
 void ClientCore::endExpired() {
   {
     const std::lock_guard lock(mutex_);
-    if (pending_.nextDeadline() == Clock::time_point::max()) return;
     for (Handler& handler : pending_.takeExpired(Clock::now())) {
       endings_.push_back({std::move(handler), Status::kTimedOut});
       ++counts_.timedOutRequests;
@@ -597,8 +604,8 @@ bool ClientCore::hasAnythingToSend() const {
 // With the lock.
 ClientCore::Clock::time_point ClientCore::nextTurn(Written written) const {
   if (isConnected_ && written != Written::kBlocked &&
-      (written == Written::kSome || !queue_.empty() || !newRings_.empty() ||
-       ringsWanted_ || looksWanted_ != looksDone_)) {
+      (!queue_.empty() || !newRings_.empty() || ringsWanted_ ||
+       looksWanted_ != looksDone_)) {
     return Clock::time_point::min();
   }
   auto next = std::min(pending_.nextDeadline(), closeDeadline_);

@@ -42,7 +42,7 @@ class ClientCore final : public ForkAware,
   /// and the request's number; `note` records it for a restoration. Both run at
   /// once, with the lock.
   template <typename Append, typename Note>
-  Submission submit(wire::Operation operation, Handler handler, Replies replies,
+  Submission submit(wire::Operation operation, Handler&& handler, Replies replies,
                     const std::optional<std::chrono::milliseconds>& timeout,
                     const Append& append, const Note& note);
 
@@ -88,10 +88,11 @@ class ClientCore final : public ForkAware,
   bool takeTurn();
   void connectIfDue();
   void connected(ClientSocket socket);
-  void connectionLost(const std::string& reason);
-  enum class Written { kAll, kSome, kBlocked, kBroken };
+  void connectionLost(const std::string& reason, Handler unanswered = {});
+  enum class Written { kAll, kBlocked, kBroken };
   Written writeOut();
-  bool refill();
+  void countWritten();
+  void refill();
   void drainRings();
   void readReplies();
   bool readFrames();
@@ -114,6 +115,9 @@ class ClientCore final : public ForkAware,
   wire::FrameReader reader_;
   std::string writing_;  // Taken from the queue and the rings, from frame to frame.
   std::size_t writingBegin_ = 0;
+  std::size_t uncountedBytes_ = 0;  // Written, and not in `bytesWritten_` yet.
+  int writesInARow_ = 0;            // Without a look for replies.
+  bool hasExpired_ = false;         // Some request's deadline, at the last look.
   std::vector<std::shared_ptr<AudioSender::Ring>> rings_;
   Clock::time_point nextRingLook_ = Clock::time_point::max();
   Clock::time_point nextAttempt_{};
@@ -160,7 +164,8 @@ class ClientCore final : public ForkAware,
 };
 
 template <typename Append, typename Note>
-Submission ClientCore::submit(wire::Operation operation, Handler handler, Replies replies,
+Submission ClientCore::submit(wire::Operation operation, Handler&& handler,
+                              Replies replies,
                               const std::optional<std::chrono::milliseconds>& timeout,
                               const Append& append, const Note& note) {
   if (!isOfThisProcess()) return Submission::kClosed;

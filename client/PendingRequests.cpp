@@ -106,54 +106,50 @@ bool callHandler(const Handler& handler, wire::ReplyValue& value) noexcept {
   }
 }
 
-void PendingRequests::add(wire::Operation operation, Handler handler, Replies replies,
+void PendingRequests::add(wire::Operation operation, Handler&& handler, Replies replies,
                           TimePoint deadline) {
-  Entry entry{operation, std::move(handler), deadline,
-              replies == Replies::kOne   ? 1u
-              : replies == Replies::kTwo ? 2u
-                                         : std::numeric_limits<unsigned>::max()};
+  const bool isLongLived = replies != Replies::kOne || deadline == TimePoint::max();
+  row_.emplace_back();
+  Entry& entry = isLongLived ? longLived_[nextNumber_] : row_.back();
+  entry.operation = operation;
+  entry.handler = std::move(handler);
+  entry.deadline = deadline;
+  entry.repliesLeft = replies == Replies::kOne   ? 1
+                      : replies == Replies::kTwo ? 2
+                                                 : std::numeric_limits<unsigned>::max();
   nextDeadline_ = std::min(nextDeadline_, deadline);
-  if (replies == Replies::kOne && deadline != TimePoint::max()) {
-    row_.push_back(std::move(entry));
-  } else {
-    longLived_.emplace(nextNumber_, std::move(entry));
-    row_.emplace_back();
-  }
   ++nextNumber_;
   trim();
 }
 
-const PendingRequests::Entry* PendingRequests::find(wire::RequestNumber number) const {
+PendingRequests::Entry* PendingRequests::find(wire::RequestNumber number) {
   if (number >= firstNumber_ && number < nextNumber_) {
-    const Entry& entry = row_[number - firstNumber_];
+    Entry& entry = row_[number - firstNumber_];
     if (entry.repliesLeft != 0) return &entry;
   }
   const auto found = longLived_.find(number);
   return found != longLived_.end() ? &found->second : nullptr;
 }
 
-PendingRequests::Entry* PendingRequests::find(wire::RequestNumber number) {
-  return const_cast<Entry*>(std::as_const(*this).find(number));
-}
-
-std::optional<wire::Operation> PendingRequests::operationOf(
-    wire::RequestNumber number) const {
-  if (number == 0 || number >= nextNumber_) return std::nullopt;
-  const Entry* entry = find(number);
-  return entry != nullptr ? entry->operation : wire::Operation::kFarewell;
-}
-
-Handler PendingRequests::takeForReply(wire::RequestNumber number) {
+void PendingRequests::takeForReply(wire::RequestNumber number, Answered& answered) {
+  if (number == 0 || number >= nextNumber_) return;
   Entry* entry = find(number);
-  if (entry == nullptr) return {};
+  if (entry == nullptr) {
+    answered.operation = wire::Operation::kFarewell;
+    return;
+  }
+  answered.operation = entry->operation;
+  answered.isFirst = !entry->hasEnded;
   entry->hasEnded = true;
   entry->deadline = TimePoint::max();
-  if (--entry->repliesLeft != 0) return entry->handler;
-  Handler handler = std::move(entry->handler);
+  if (--entry->repliesLeft != 0) {
+    answered.handler = entry->handler;
+    return;
+  }
+  answered.handler = std::move(entry->handler);
   entry->handler = {};
   longLived_.erase(number);
   trim();
-  return handler;
 }
 
 std::vector<Handler> PendingRequests::takeExpired(TimePoint now) {

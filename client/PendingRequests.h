@@ -36,15 +36,20 @@ class PendingRequests {
   wire::RequestNumber nextNumber() const { return nextNumber_; }
 
   /// Adds the request `nextNumber()`. `deadline` may be `TimePoint::max()`.
-  void add(wire::Operation operation, Handler handler, Replies replies,
+  void add(wire::Operation operation, Handler&& handler, Replies replies,
            TimePoint deadline);
 
-  /// None for a number that was never given. A request that is over and no
-  /// longer known counts as `kFarewell`.
-  std::optional<wire::Operation> operationOf(wire::RequestNumber number) const;
+  struct Answered {
+    /// None for a number that was never given. A request that is over and no longer
+    /// known counts as `kFarewell`.
+    std::optional<wire::Operation> operation;
+    Handler handler;       // What to call with the reply.
+    bool isFirst = false;  // The handler has not been called yet.
+  };
 
-  /// What to call with a reply to `number`; the request is over with its last.
-  Handler takeForReply(wire::RequestNumber number);
+  /// Finds the request `number`, to which there is a reply; it is over with its last
+  /// one. `answered` is as new.
+  void takeForReply(wire::RequestNumber number, Answered& answered);
 
   /// At the first moment when a deadline may have passed.
   TimePoint nextDeadline() const { return nextDeadline_; }
@@ -66,7 +71,6 @@ class PendingRequests {
   };
 
   Entry* find(wire::RequestNumber number);
-  const Entry* find(wire::RequestNumber number) const;
   void trim();
 
   // Requests with one reply and a deadline stand in a row; the others, which
