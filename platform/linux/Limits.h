@@ -272,7 +272,8 @@ inline constexpr int kOrientationChangesPerSecond = 50;
 
 /// How long an operation on drivers waits for one that does not answer: four in a row
 /// hold the clients' requests up for 250 ms at most.
-/// [MappedChannelReportingHanging.GivesAnErrorAndHoldsTheCallerBrieflyOnce]
+/// [MappedChannelReportingWaits.HoldACallerOfFourDriversForAQuarterSecondAtMost,
+/// MappedChannelReportingHanging.GivesAnErrorAndHoldsTheCallerBrieflyOnce]
 inline constexpr std::chrono::milliseconds kDriverWait{150};
 
 /// Drivers that may hang at a time, a thread each.

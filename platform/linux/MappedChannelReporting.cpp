@@ -159,15 +159,15 @@ std::shared_ptr<MappedChannelReporting> MappedChannelReporting::ofSystem() {
               std::make_shared<AlsaChannelFinder>("/proc/asound")});
 }
 
-MappedChannelReporting::MappedChannelReporting(Finders finders)
-    : finders_(std::move(finders)) {}
+MappedChannelReporting::MappedChannelReporting(Finders finders, Waits waits)
+    : finders_(std::move(finders)), waits_(waits) {}
 
 // The operation's result, which its thread keeps alive should it overrun.
 template <typename Result>
 Outcome<Result> MappedChannelReporting::bounded(
     std::function<Outcome<Result>()> operation) {
   const auto outcome = std::make_shared<Outcome<Result>>();
-  const auto wait = runner_.overrunning() == 0 ? kMostWait : kWaitBehindAnother;
+  const auto wait = runner_.overrunning() == 0 ? waits_.most : waits_.behindAnother;
   switch (runner_.run(
       [outcome, operation = std::move(operation)] { *outcome = operation(); }, wait)) {
     case DeadlineRunner::Result::kDone:

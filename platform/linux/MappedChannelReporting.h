@@ -3,6 +3,7 @@
 #include <chrono>
 #include <cstddef>
 #include <memory>
+#include <utility>
 #include <vector>
 
 #include "platform/ChannelReportingService.h"
@@ -14,8 +15,8 @@ namespace ostrel {
 
 /// Driver counters from channel files (`docs/channels.md`) and other sources.
 ///
-/// An operation that touches a source takes `kMostWait` at most, or
-/// `kWaitBehindAnother` while another one hangs, so that a caller who samples
+/// An operation that touches a source takes `Waits::most` at most, or
+/// `Waits::behindAnother` while another one hangs, so that a caller who samples
 /// every driver in a row waits for 250 ms at most. Beyond it the error is
 /// ETIMEDOUT, and EBUSY from then on until the source answers. Errors are of the
 /// domain "POSIX".
@@ -25,8 +26,10 @@ namespace ostrel {
 /// 0 then; a counter that wraps around has moved by what it counted.
 class MappedChannelReporting final : public ChannelReportingService {
  public:
-  static constexpr std::chrono::milliseconds kMostWait = limits::kDriverWait;
-  static constexpr std::chrono::milliseconds kWaitBehindAnother{10};
+  struct Waits {
+    std::chrono::milliseconds most = limits::kDriverWait;
+    std::chrono::milliseconds behindAnother{10};
+  };
   /// Operations that may hang at a time, one a driver.
   static constexpr std::size_t kMostHanging = limits::kHangingDrivers;
   /// Of one subscription. A report of that many is a payload that is allowed.
@@ -37,7 +40,9 @@ class MappedChannelReporting final : public ChannelReportingService {
   /// The channel files in the runtime directory, and the sound cards.
   static std::shared_ptr<MappedChannelReporting> ofSystem();
 
-  explicit MappedChannelReporting(Finders finders);
+  explicit MappedChannelReporting(Finders finders)
+      : MappedChannelReporting(std::move(finders), Waits()) {}
+  MappedChannelReporting(Finders finders, Waits waits);
 
   Outcome<std::shared_ptr<ChannelCollection>> copyChannelsInGroup(
       const std::optional<std::string>& groupName,
@@ -54,6 +59,7 @@ class MappedChannelReporting final : public ChannelReportingService {
   Outcome<Result> bounded(std::function<Outcome<Result>()> operation);
 
   const Finders finders_;
+  const Waits waits_;
   DeadlineRunner runner_{kMostHanging};
 };
 
