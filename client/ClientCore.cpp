@@ -13,14 +13,12 @@
 // starts over. What is queued afterwards waits for the next connection.
 #include "client/ClientCore.h"
 
-#include <poll.h>
 #include <pthread.h>
 #include <signal.h>
 #include <unistd.h>
 
 #include <algorithm>
 #include <cerrno>
-#include <ctime>
 #include <random>
 #include <span>
 #include <system_error>
@@ -85,13 +83,6 @@ std::size_t countFrames(std::string_view frames, std::size_t written) {
   return count;
 }
 
-timespec timespecOf(ClientCore::Clock::duration time) {
-  const auto nanoseconds =
-      std::chrono::duration_cast<std::chrono::nanoseconds>(time).count();
-  return {static_cast<time_t>(nanoseconds / 1'000'000'000),
-          static_cast<long>(nanoseconds % 1'000'000'000)};
-}
-
 }  // namespace
 
 ClientCore::ClientCore(Options options)
@@ -108,15 +99,15 @@ ClientCore::~ClientCore() { ForkGuard::remove(this); }
 
 void ClientCore::start() {
   const std::lock_guard lock(mutex_);
-  auto wake = WakeEvent::make();
+  auto sleep = ClientSleep::make();
   sigset_t all;
   sigset_t before;
   sigfillset(&all);
   // The host's signal handlers have no business on this thread.
   pthread_sigmask(SIG_SETMASK, &all, &before);
   try {
-    if (wake.value) {
-      wake_ = std::move(wake.value);
+    if (sleep.value) {
+      sleep_ = std::move(sleep.value);
       thread_ = std::thread([self = shared_from_this()] { self->run(); });
     }
   } catch (const std::system_error&) {
@@ -180,7 +171,7 @@ void ClientCore::sendDirectly() {
 void ClientCore::wake() {
   if (!isAsleep_) return;
   isAsleep_ = false;
-  wake_->wake();
+  sleep_->wake();
 }
 
 void ClientCore::addRing(std::shared_ptr<AudioSender::Ring> ring) {
@@ -278,7 +269,7 @@ Counts ClientCore::counts() const {
 
 void ClientCore::closeInChild() noexcept {
   socket_.close();
-  if (wake_) wake_->close();
+  if (sleep_) sleep_->close();
 }
 
 void ClientCore::run() {
@@ -313,10 +304,11 @@ bool ClientCore::takeTurn() {
     if (hasMore && ++writesInARow_ < kWritesInARow) return true;
     isAsleep_ = true;
     isBlocked_ = written == Written::kBlocked;
-    sleepsUntil_ = until;
+    sleepsUntil_ = sleep_->endOfWait(until);
   }
   writesInARow_ = 0;
-  waitUntil(until, /*wantsToWrite=*/written == Written::kBlocked);
+  sleep_->wait(until, socket_ ? socket_.descriptor() : -1,
+               /*wantsToWrite=*/written == Written::kBlocked);
   bool awaitsBurst;
   {
     const std::lock_guard lock(mutex_);
@@ -341,10 +333,11 @@ void ClientCore::connectIfDue() {
   {
     const auto noFork = ForkGuard::lock();
     auto socket = ClientSocket::connect(socketPath_);
-    if (socket.value) {
+    if (socket.value && sleep_->watch(socket.value->descriptor())) {
       connected(std::move(*socket.value));
     } else {
-      reason = socket.error->description;
+      reason =
+          socket.error ? socket.error->description : "a connection cannot be watched";
     }
   }
   if (socket_) {
@@ -381,6 +374,7 @@ void ClientCore::connectionLost(const std::string& reason, Handler unanswered) {
     const auto noFork = ForkGuard::lock();
     const std::lock_guard lock(mutex_);
     isExpected = phase_ != Phase::kOpen;
+    sleep_->forget(socket_.descriptor());
     socket_.close();
     isConnected_ = false;
     ++losses_;
@@ -612,20 +606,6 @@ ClientCore::Clock::time_point ClientCore::nextTurn(Written written) const {
   if (!isConnected_) next = std::min(next, nextAttempt_);
   if (isConnected_ && written != Written::kBlocked) next = std::min(next, nextRingLook_);
   return next;
-}
-
-void ClientCore::waitUntil(Clock::time_point time, bool wantsToWrite) {
-  const short events = wantsToWrite ? POLLIN | POLLOUT : POLLIN;
-  pollfd descriptors[] = {{wake_->descriptor(), POLLIN, /*revents=*/0},
-                          {socket_ ? socket_.descriptor() : -1, events, /*revents=*/0}};
-  timespec left{};
-  if (time != Clock::time_point::min()) {
-    left = timespecOf(std::max(time - Clock::now(), Clock::duration::zero()));
-  }
-  const bool isEndless = time == Clock::time_point::max();
-  ::ppoll(descriptors, std::size(descriptors), isEndless ? nullptr : &left,
-          /*sigmask=*/nullptr);
-  if (descriptors[0].revents != 0) wake_->clear();
 }
 
 void ClientCore::finish() {

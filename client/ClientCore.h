@@ -13,6 +13,7 @@
 #include <vector>
 
 #include "client/AudioRing.h"
+#include "client/ClientSleep.h"
 #include "client/ClientSocket.h"
 #include "client/ForkGuard.h"
 #include "client/PendingRequests.h"
@@ -103,7 +104,6 @@ class ClientCore final : public ForkAware,
   bool isClosingDone() const;
   bool hasAnythingToSend() const;
   Clock::time_point nextTurn(Written written) const;
-  void waitUntil(Clock::time_point time, bool wantsToWrite);
   void finish();
 
   // Constant after construction.
@@ -128,12 +128,12 @@ class ClientCore final : public ForkAware,
   bool hasSaidFarewell_ = false;
   std::string lastConnectError_;
 
-  // Shared, with the lock. The socket and the wake event are changed by the
+  // Shared, with the lock. The socket and what it sleeps in are changed by the
   // client's thread alone, with the fork guard's lock too.
   mutable std::mutex mutex_;
   std::condition_variable changed_;
   ClientSocket socket_;
-  std::optional<WakeEvent> wake_;
+  std::optional<ClientSleep> sleep_;
   Phase phase_ = Phase::kOpen;
   bool isConnected_ = false;
   bool isSilent_ = false;  // `close` is over: the thread calls no handler any more.
