@@ -57,6 +57,11 @@ std::int64_t truncated(double seconds) {
   return static_cast<std::int64_t>(std::clamp(seconds, -kLimit, kLimit));
 }
 
+// None for one session, as most messages have.
+std::shared_ptr<OstrelReportingSharedPayload> payloadFor(std::size_t sessions) {
+  return sessions > 1 ? std::make_shared<OstrelReportingSharedPayload>() : nullptr;
+}
+
 /// How long the client was there, for its uptime event.
 struct Uptime {
   Value seconds{-1};  // An integer when it is not known, else a double.
@@ -498,13 +503,14 @@ void OstrelReportingServerInstance::sendMessageStep(
   if (!reportingIDs) {
     sendToActiveSessions(message, category, type);
   } else {
+    const auto shared = payloadFor(reportingIDs->size());
     for (const ReporterID reporterID : *reportingIDs) {
       if (reporterID == kNoReporter) continue;
       if (auto* const session = master_->borrowReportingSessionForID(reporterID)) {
         // Others that hold the message would share its count with the session's thread.
         const bool isLast = &reporterID + 1 == reportingIDs->end();
         session->sendMessage(isLast ? std::move(message) : message, category, type,
-                             /*reply=*/nullptr);
+                             /*sync=*/false, /*reply=*/nullptr, shared);
       }
     }
   }
@@ -524,8 +530,10 @@ void OstrelReportingServerInstance::sendToActiveSessions(const Dictionary& messa
   }
   OSTREL_LOG_DEFAULT(logScope, "active reporting sessions %lu : %@", active.size(),
                      active);
+  const auto shared = payloadFor(active.size());
   for (const auto& session : active) {
-    session->sendMessage(message, category, type, /*reply=*/nullptr);
+    session->sendMessage(message, category, type, /*sync=*/false, /*reply=*/nullptr,
+                         shared);
   }
   if (!active.empty()) return;
   OSTREL_LOG_DEFAULT(logScope,

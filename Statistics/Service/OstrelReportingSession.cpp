@@ -293,25 +293,37 @@ void OstrelReportingSession::flushStep() {
   set(&Details::reportingSession, std::shared_ptr<TelemetrySession>());
 }
 
-void OstrelReportingSession::sendMessage(Dictionary message, MessageCategory category,
-                                         MessageType type, bool sync, ErrorReply reply) {
+void OstrelReportingSession::sendMessage(
+    Dictionary message, MessageCategory category, MessageType type, bool sync,
+    ErrorReply reply, std::shared_ptr<OstrelReportingSharedPayload> shared) {
   OSTREL_LOG_DEBUG(logScope, "sending message for session owned by %lli", reporterID_);
   if (sync) {
     sessionReportingQueue_->assertCurrent();
-    deliverStep(message, category, type, reply);
+    deliverStep(message, category, type, reply, shared.get());
     return;
   }
+  if (shared != nullptr) {
+    sessionReportingQueue_->async([self = shared_from_this(),
+                                   message = std::move(message), category, type,
+                                   reply = std::move(reply), shared = std::move(shared)] {
+      self->sessionReportingQueue_->assertCurrent();
+      self->deliverStep(message, category, type, reply, shared.get());
+    });
+    return;
+  }
+  // Most messages go to one session: theirs is the smaller step.
   sessionReportingQueue_->async([self = shared_from_this(), message = std::move(message),
                                  category, type, reply = std::move(reply)] {
     self->sessionReportingQueue_->assertCurrent();
-    self->deliverStep(message, category, type, reply);
+    self->deliverStep(message, category, type, reply, /*shared=*/nullptr);
   });
 }
 
 // One walk over the payload for all that the delivery's parts ask of that.
 void OstrelReportingSession::deliverStep(const Dictionary& message,
                                          MessageCategory category, MessageType type,
-                                         const ErrorReply& reply) {
+                                         const ErrorReply& reply,
+                                         OstrelReportingSharedPayload* shared) {
   const auto [details, list, configuredUserInfo] = propertiesOnQueue();
   const Dictionary userInfo =
       configuredUserInfo != nullptr ? configuredUserInfo->snapshot() : Dictionary();
@@ -323,7 +335,9 @@ void OstrelReportingSession::deliverStep(const Dictionary& message,
                                                userInfo);
   }
   std::optional<Dictionary> sanitised;
-  if (survey.hasBlankInKey()) sanitised = SanitisedPayload(message);
+  if (survey.hasBlankInKey()) {
+    sanitised = shared != nullptr ? shared->of(message) : SanitisedPayload(message);
+  }
   const Dictionary& payload = sanitised ? *sanitised : message;
   const MessageIdentifier identifier =
       details.messageTypeCounts.next(messageNames(category, type));

@@ -11,6 +11,7 @@
 
 #include "Statistics/OstrelReportingTypes.h"
 #include "Statistics/Service/OstrelReportingSessionDetails.h"
+#include "Statistics/Service/OstrelReportingSharedPayload.h"
 #include "Statistics/Support/MadeOnce.h"
 #include "Statistics/Support/MutableDictionary.h"
 #include "platform/Condition.h"
@@ -78,9 +79,11 @@ class OstrelReportingSession final
   /// Delivers one message. The backend gets the low 16 bits of `category`;
   /// bridges and log lines get all 32. `reply` may be empty; otherwise it is
   /// called once, on this session's queue or on the background queue, with the
-  /// backend's error or none.
+  /// backend's error or none. `shared` is what all sessions have together that the
+  /// message goes to; none where it goes to this one alone.
   void sendMessage(Dictionary message, MessageCategory category, MessageType type,
-                   bool sync, ErrorReply reply);
+                   bool sync, ErrorReply reply,
+                   std::shared_ptr<OstrelReportingSharedPayload> shared = nullptr);
   void sendMessage(Dictionary message, MessageCategory category, MessageType type,
                    ErrorReply reply) {
     sendMessage(std::move(message), category, type, /*sync=*/false, std::move(reply));
@@ -226,7 +229,8 @@ class OstrelReportingSession final
   void stopStep() OSTREL_ON_QUEUE(*sessionReportingQueue_);
   void flushStep() OSTREL_ON_QUEUE(*sessionReportingQueue_);
   void deliverStep(const Dictionary& message, MessageCategory category, MessageType type,
-                   const ErrorReply& reply) OSTREL_ON_QUEUE(*sessionReportingQueue_);
+                   const ErrorReply& reply, OstrelReportingSharedPayload* shared)
+      OSTREL_ON_QUEUE(*sessionReportingQueue_);
   void sendToBackend(const Dictionary& message, const Dictionary& payload,
                      MessageCategory category, MessageType type, const ErrorReply& reply,
                      const Details& details) OSTREL_ON_QUEUE(*sessionReportingQueue_);
