@@ -143,9 +143,9 @@ inline constexpr std::size_t kKeptBytesOfUser = std::size_t{1} * 1024 * 1024 * 1
 inline constexpr std::size_t kRequestBytes = 256;
 
 /// What each delivery of a message costs beyond the first, with the size of the request:
-/// its step on the queue of the session, its place in the store's, and a copy of the
-/// payload, which is made where a key has a blank. A message to all is taken to go to
-/// every session that there is, `kReporterIDs` at most.
+/// its step on the queue of the session and its place in the store's; and what the
+/// session's list and the store write of it, which others' messages wait for. A message
+/// to all is taken to go to every session that there is, `kReporterIDs` at most.
 /// [UnixSocketListener.ChargesEachDeliveryOfAMessage]
 inline constexpr std::size_t kDeliveryBytes = 512;
 
@@ -174,7 +174,7 @@ inline constexpr std::uint64_t kTurnWork = 500'000;
 
 /// How long turns are taken before the sockets are looked at again: whoever was quiet
 /// then goes before the rest of the line.
-/// [FairLineOrder.LetsWhoAsksForLittleGoFirst]
+/// [ListenerTurnsBetweenLooks.EndAfterAWhileWithSomeStillInLine]
 inline constexpr std::chrono::microseconds kTurnsBetweenLooks{250};
 
 // What sessions are told of themselves
@@ -200,7 +200,8 @@ inline constexpr std::size_t kUserInfoBytesOfUser = 16 * 1024 * 1024;
 
 /// Reply bytes that a client has not read. Beyond it the client is cut off. A reply
 /// that is larger alone is sent all the same.
-/// [PeerChannelReplies.StayUnreadUpToTheLimit]
+/// [PeerChannelReplies.StayUnreadUpToTheLimit,
+/// ListenerUnreadReplies.OfAClientAreTakenUpToItsLimit]
 inline constexpr std::size_t kUnreadReplyBytes = 1024 * 1024;
 
 /// Reply bytes from which on no further requests are read; a client that is merely
@@ -211,11 +212,13 @@ inline constexpr std::size_t kUnreadReplyBytesToPause = kUnreadReplyBytes / 4;
 /// What all connections of one user have unread: enough for the largest reply on some of
 /// them. Beyond it each may have `kUnreadReplyBytesInNeed`, so that many connections
 /// do not make many times the memory.
-/// [UnreadReplies.OfOthersLeaveAClientItsRoomUpToTheLimitOfTheirUser]
+/// [UnreadReplies.OfOthersLeaveAClientItsRoomUpToTheLimitOfTheirUser,
+/// ListenerUnreadRepliesAround.ThatOfTheUserLeaveAClientLittleBeyondIt]
 inline constexpr std::size_t kUnreadReplyBytesOfUser = 4 * 1024 * 1024;
 
 /// Of one connection, then: a thousand short replies.
-/// [UnreadReplies.BeyondItAreFewForEachClient]
+/// [UnreadReplies.BeyondItAreFewForEachClient,
+/// ListenerUnreadRepliesAround.WhatAClientHasInNeedAreTakenUpToThat]
 inline constexpr std::size_t kUnreadReplyBytesInNeed = 16 * 1024;
 
 /// How long a client with more than `kUnreadReplyBytesToPause` unread may read nothing at

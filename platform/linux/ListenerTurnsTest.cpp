@@ -3,15 +3,20 @@
 #include <sys/socket.h>
 
 #include <array>
+#include <atomic>
+#include <chrono>
 
 #include "platform/linux/FairLine.h"
 #include "platform/linux/QueuedSteps.h"
 #include "platform/linux/RequestDispatch.h"
+#include "platform/linux/ThreadPoolWorkQueues.h"
+#include "platform/linux/TimerThread.h"
 #include "platform/linux/UnixSocketIPCListenerTestSupport.h"
 
 namespace ostrel {
 namespace {
 
+using testing_support::RawClient;
 using testing_support::RecordingService;
 
 class FairLineTest : public testing::Test {
@@ -335,6 +340,150 @@ TEST_F(RequestBurden, EndsWithStepsThatAreDropped) {
   queueing.steps.dropFirst();
   EXPECT_EQ(user->queued().used(), before - limits::kStartBytes);
 }
+
+/// A service with a queue, before a listener whose time the test moves on. What it is
+/// asked is told apart by reporter IDs.
+class ListenerTurns : public testing_support::UnixSocketListener {
+ protected:
+  using Events = std::vector<std::string>;
+
+  ListenerTurns() {
+    now = [this] { return PeerConnection::Clock::time_point(time_.load()); };
+  }
+  ~ListenerTurns() override { stop(); }
+
+  bool listenerShouldAcceptNewConnection(
+      IPCListener&, const std::shared_ptr<IPCConnection>& connection) override {
+    connection->setExportedObject(service_);
+    connection->resume();
+    return true;
+  }
+
+  /// A client that asked for much.
+  std::unique_ptr<RawClient> connectHeavy() {
+    constexpr std::size_t kDeliveries = 500;
+    auto client = std::make_unique<RawClient>(path);
+    wire::Request message = testing_support::messageRequest(1, "x");
+    message.reporterIDs = ReporterIDs(kDeliveries, ReporterID{1});
+    client->send(message);
+    EXPECT_TRUE(client->receive());
+    return client;
+  }
+  /// One that has been there for long and asked for little.
+  std::unique_ptr<RawClient> connectLight() {
+    auto client = std::make_unique<RawClient>(path);
+    ask(*client, 0);
+    EXPECT_TRUE(client->receive());
+    pass(std::chrono::seconds(1));
+    return client;
+  }
+  static void ask(RawClient& client, std::int64_t id) {
+    client.send(testing_support::createRequest(1, id));
+  }
+  void pass(std::chrono::nanoseconds time) { time_ = time_.load() + time; }
+  /// What happens when that is read, on the listener's thread. While that is stopped.
+  void at(std::int64_t request, std::function<void()> event) {
+    eventful_ = request;
+    event_ = std::move(event);
+  }
+
+  /// What becomes of `requests` requests that are sent while the listener is busy with
+  /// another, so that its next look finds all of them.
+  Events eventsOf(std::size_t requests, const std::function<void()>& send) {
+    RawClient another(path);
+    ask(another, kStopping);
+    stopping_.waitUntilStopped();
+    {
+      const std::lock_guard lock(mutex);
+      events.clear();
+    }
+    send();
+    stopping_.letGo();
+    Events all = eventsAfter(2 * (requests + 1));
+    EXPECT_EQ(Events(all.begin(), all.begin() + 2), (Events{"read 99", "served 99"}));
+    return Events(all.begin() + 2, all.end());
+  }
+
+ private:
+  static constexpr std::int64_t kStopping = 99;
+
+  class Service final : public RecordingService {
+   public:
+    explicit Service(ListenerTurns& test) : test_(test) {}
+
+    void createReportingSession(ReporterID id, BoolReply reply) override {
+      const auto number = static_cast<std::int64_t>(id);
+      if (number == kStopping) test_.stopping_.stopHere();
+      test_.note("read " + std::to_string(number));
+      if (number == test_.eventful_) test_.event_();
+      test_.queue_->async([this, number, reply = std::move(reply)] {
+        test_.note("served " + std::to_string(number));
+        reply(true);
+      });
+    }
+
+   private:
+    ListenerTurns& test_;
+  };
+
+  std::atomic<std::chrono::nanoseconds> time_{std::chrono::hours(1)};
+  testing_support::StoppingPlace stopping_;
+  std::int64_t eventful_ = -1;
+  std::function<void()> event_;
+  ThreadPoolWorkQueues queues_{std::make_shared<TimerThread>()};
+  const std::shared_ptr<WorkQueue> queue_ = queues_.makeSerialQueue(
+      "turns", QualityOfService::kUserInteractive, /*relativePriority=*/0);
+  const std::shared_ptr<Service> service_ = std::make_shared<Service>(*this);
+};
+
+TEST_F(ListenerTurns, OfWhoAsksForLittleComeFirstAndAreServedApart) {
+  serve();
+  const auto heavy = connectHeavy();
+  const auto light = connectLight();
+  const auto other = connectLight();
+
+  EXPECT_EQ(eventsOf(/*requests=*/3,
+                     [&] {
+                       ask(*heavy, 1);
+                       ask(*light, 2);
+                       ask(*other, 3);
+                     }),
+            (Events{"read 2", "read 3", "served 2", "served 3", "read 1", "served 1"}));
+}
+
+/// By how many nanoseconds the turns take longer than they may.
+class ListenerTurnsBetweenLooks : public ListenerTurns,
+                                  public testing::WithParamInterface<int> {};
+
+TEST_P(ListenerTurnsBetweenLooks, EndAfterAWhileWithSomeStillInLine) {
+  constexpr std::chrono::microseconds kForThreeEvents{3};
+  serve();
+  const auto first = connectHeavy();
+  const auto second = connectHeavy();
+  const auto third = connectHeavy();
+  const auto light = connectLight();
+
+  const Events order = eventsOf(/*requests=*/4, [&] {
+    at(2, [&] {
+      ask(*light, 4);
+      pass(limits::kTurnsBetweenLooks + kForThreeEvents +
+           std::chrono::nanoseconds(GetParam()));
+    });
+    ask(*first, 1);
+    ask(*second, 2);
+    ask(*third, 3);
+  });
+
+  if (GetParam() < 0) {
+    EXPECT_EQ(order, (Events{"read 1", "read 2", "read 3", "served 1", "served 2",
+                             "served 3", "read 4", "served 4"}));
+  } else {
+    EXPECT_EQ(order, (Events{"read 1", "read 2", "served 1", "served 2", "read 4",
+                             "served 4", "read 3", "served 3"}));
+  }
+}
+
+INSTANTIATE_TEST_SUITE_P(Each, ListenerTurnsBetweenLooks, testing::Values(-1, 0, 1));
 
 }  // namespace
 }  // namespace ostrel

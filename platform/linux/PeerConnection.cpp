@@ -306,7 +306,7 @@ std::size_t PeerConnection::costOf(const wire::Request& request,
   const std::size_t deliveries =
       request.reporterIDs ? request.reporterIDs->size()
                           : std::min(channel_->sessionsOfAll(), limits_.reporterIDs);
-  // Each may make a copy of the payload.
+  // Each is written to a list and to the store.
   if (deliveries > 1) cost += (deliveries - 1) * (limits::kDeliveryBytes + bytes);
   return cost;
 }

@@ -113,6 +113,7 @@ UnixSocketIPCListener::UnixSocketIPCListener(ServiceSocket socket,
       disposal_(options.disposal),
       heap_(std::move(options.heap)),
       identityOf_(options.identityOf ? std::move(options.identityOf) : kernelsIdentityOf),
+      now_(options.now ? std::move(options.now) : Clock::now),
       epoll_(::epoll_create1(EPOLL_CLOEXEC)),
       service_(new ServiceAccount{Share(limits_.sessions), Share(limits_.keptBytes),
                                   MemoryOfAll(limits_.ofAll)}),
@@ -149,7 +150,7 @@ void UnixSocketIPCListener::look() {
   const int count = ::epoll_wait(epoll_.get(), events_.data(), kMostEvents,
                                  mayWait ? millisecondsToWait() : 0);
   waker_->endWait();
-  const Clock::time_point now = Clock::now();
+  const Clock::time_point now = now_();
   line_.setTime(static_cast<std::uint64_t>(
       std::chrono::nanoseconds(now.time_since_epoch()).count()));
   shareMemoryOut();
@@ -160,7 +161,7 @@ void UnixSocketIPCListener::look() {
     const epoll_event& event = events_[static_cast<std::size_t>(i)];
     handleEvent(event.data.u64, event.events);
   }
-  if (firstDeadline_) handleDeadlines(Clock::now());
+  if (firstDeadline_) handleDeadlines(now_());
 }
 
 // From now until the next look.
@@ -207,7 +208,7 @@ void UnixSocketIPCListener::takeTurns() {
         work += takeTurn(*next);
         if (work >= limits_.turnWork || line_.empty()) break;
         // Where the estimate is wrong.
-        const Clock::time_point now = Clock::now();
+        const Clock::time_point now = now_();
         if (!end) end = now + turnsBetweenLooks_;
         if (now >= *end) break;
       }
@@ -219,7 +220,7 @@ void UnixSocketIPCListener::takeTurns() {
     }
     giveUpEstates();
     if (line_.empty() || isStopping_) return;
-    const Clock::time_point now = Clock::now();
+    const Clock::time_point now = now_();
     if (!end) end = now + turnsBetweenLooks_;
     if (now >= *end) return;
   }
@@ -268,7 +269,7 @@ void UnixSocketIPCListener::handleEvent(std::uint64_t id, std::uint32_t events) 
   }
   const auto connection = found->second.connection;
   if ((events & ~EPOLLOUT) != 0) line_.enter(id, found->second.place);
-  connection->write(Clock::now());
+  connection->write(now_());
   settle(*connection);
 }
 
@@ -279,7 +280,7 @@ void UnixSocketIPCListener::handleWork() {
     const auto found = connections_.find(id);
     if (found == connections_.end()) continue;
     const auto connection = found->second.connection;
-    connection->write(Clock::now());
+    connection->write(now_());
     settle(*connection);
   }
   if (!work_.hasBudgetEased) return;
@@ -320,7 +321,7 @@ void UnixSocketIPCListener::settle(PeerConnection& connection) {
 
 void UnixSocketIPCListener::cutOff(PeerConnection& connection) {
   misuse_->note(connection.peer().user, MisuseLog::Kind::kCutOff,
-                connection.endingReason(), Clock::now());
+                connection.endingReason(), now_());
   end(connection);
 }
 
@@ -416,7 +417,7 @@ std::uint64_t UnixSocketIPCListener::acceptSome() {
                      errno);
     ::epoll_ctl(epoll_.get(), EPOLL_CTL_DEL, socket_.descriptor(), nullptr);
     isBackedOff_ = true;
-    acceptAgainAt_ = Clock::now() + limits::kAcceptBackOff;
+    acceptAgainAt_ = now_() + limits::kAcceptBackOff;
     noteDeadline(acceptAgainAt_);
     break;
   }
@@ -474,7 +475,7 @@ bool UnixSocketIPCListener::isWithinLimits(const PeerIdentity& peer, int socket)
     return true;
   }
   misuse_->note(peer.user, MisuseLog::Kind::kConnectionRefused, "there are too many",
-                Clock::now());
+                now_());
   sendClosing(socket, "there are too many connections");
   return false;
 }
@@ -507,7 +508,7 @@ void UnixSocketIPCListener::handleDeadlines(Clock::time_point now) {
 int UnixSocketIPCListener::millisecondsToWait() const {
   if (!firstDeadline_) return -1;
   const auto left =
-      std::chrono::ceil<std::chrono::milliseconds>(*firstDeadline_ - Clock::now());
+      std::chrono::ceil<std::chrono::milliseconds>(*firstDeadline_ - now_());
   return static_cast<int>(std::max<std::int64_t>(left.count(), 0));
 }
 

@@ -38,6 +38,8 @@ struct ListenerOptions {
   std::shared_ptr<HeapKeeper> heap;
   /// Who is at the other end; empty: whom the kernel says.
   std::function<PeerIdentity(int socket)> identityOf;
+  /// What turns and waits are measured by; empty: steady time.
+  std::function<PeerConnection::Clock::time_point()> now = {};
 };
 
 /// Serves clients on a Unix stream socket, all of them on the one thread that calls
@@ -114,6 +116,7 @@ class UnixSocketIPCListener final : public IPCListener {
   ConcurrentQueue* const disposal_;
   const std::shared_ptr<HeapKeeper> heap_;  // Or none.
   const std::function<PeerIdentity(int)> identityOf_;
+  const std::function<Clock::time_point()> now_;
   const std::shared_ptr<LoopWaker> waker_ = std::make_shared<LoopWaker>();
   TerminationSignals signals_;
   const FileDescriptor epoll_;

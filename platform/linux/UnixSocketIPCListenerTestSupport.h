@@ -8,6 +8,7 @@
 #include <condition_variable>
 #include <cstddef>
 #include <functional>
+#include <latch>
 #include <memory>
 #include <mutex>
 #include <optional>
@@ -139,6 +140,21 @@ class RecordingService : public OstrelReportingServiceProtocol {
   bool isHolding_ = false;
 };
 
+/// Stops the thread that calls `stopHere` until the test lets it go on.
+class StoppingPlace {
+ public:
+  void stopHere() {
+    hasStopped_.count_down();
+    goOn_.wait();
+  }
+  void waitUntilStopped() const { hasStopped_.wait(); }
+  void letGo() { goOn_.count_down(); }
+
+ private:
+  std::latch hasStopped_{1};
+  std::latch goOn_{1};
+};
+
 /// One listener on a socket of its own, served by a thread. Each connection is accepted
 /// for `service`, and what becomes of it is written down.
 class UnixSocketListener : public testing::Test, public IPCListenerDelegate {
@@ -148,7 +164,7 @@ class UnixSocketListener : public testing::Test, public IPCListenerDelegate {
   void serve(ListenerLimits limits = {}) {
     auto opened = UnixSocketIPCListener::open(
         path, peers,
-        {limits, misuse, /*disposal=*/nullptr, /*heap=*/nullptr, identityOf});
+        {limits, misuse, /*disposal=*/nullptr, /*heap=*/nullptr, identityOf, now});
     ASSERT_TRUE(opened.value) << opened.error->description;
     listener = *std::move(opened.value);
     listener->setDelegate(this);
@@ -203,6 +219,7 @@ class UnixSocketListener : public testing::Test, public IPCListenerDelegate {
   const std::shared_ptr<MisuseLog> misuse = std::make_shared<MisuseLog>();
   bool isRefusing = false;                             // All connections. Before `serve`.
   std::function<PeerIdentity(int socket)> identityOf;  // Empty: the kernel's.
+  std::function<PeerConnection::Clock::time_point()> now;  // Empty: steady time.
   const std::shared_ptr<RecordingService> service = std::make_shared<RecordingService>();
   std::unique_ptr<UnixSocketIPCListener> listener;
   std::thread thread;

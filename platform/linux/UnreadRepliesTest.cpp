@@ -1,13 +1,22 @@
 // How many replies a client may leave unread while the others of its user do so too.
 #include <gtest/gtest.h>
 
+#include <chrono>
+#include <deque>
+#include <map>
+#include <memory>
+#include <mutex>
 #include <optional>
 #include <string>
+#include <vector>
 
 #include "platform/linux/PeerChannelTestSupport.h"
+#include "platform/linux/UnixSocketIPCListenerTestSupport.h"
 
 namespace ostrel {
 namespace {
+
+using testing_support::RawClient;
 
 class UnreadReplies : public testing_support::ChannelsOfAUser {
  protected:
@@ -74,6 +83,184 @@ TEST_F(UnreadReplies, ThatAreDroppedCountNoMore) {
   channel_.close();
   EXPECT_EQ(channel_.mostUnreadBytes(), kMost);
 }
+
+/// Clients of one user that read nothing, before a service that answers when the test
+/// says so: while the listener's thread is stopped, so that nothing is written meanwhile.
+class ListenerUnreadReplies : public testing_support::UnixSocketListener {
+ protected:
+  ListenerUnreadReplies() {
+    // However long a test takes, nobody has waited for a client.
+    now = [] { return PeerConnection::Clock::time_point(std::chrono::hours(1)); };
+    serve();
+  }
+  ~ListenerUnreadReplies() override { stop(); }
+
+  bool listenerShouldAcceptNewConnection(
+      IPCListener&, const std::shared_ptr<IPCConnection>& connection) override {
+    connection->setExportedObject(answering);
+    connection->resume();
+    return true;
+  }
+
+  /// The number of a new client with two requests under way.
+  std::size_t connect() {
+    clients.push_back(std::make_unique<RawClient>(path));
+    const std::size_t number = clients.size() - 1;
+    wire::Request message = testing_support::messageRequest(1, "x");
+    message.category = MessageCategory{static_cast<std::uint32_t>(number)};
+    for (int i = 0; i < 2; ++i) clients.back()->send(message);
+    EXPECT_TRUE(
+        testing_support::eventually([&] { return answering->waiting(number) == 2; }));
+    return number;
+  }
+  void stopListener() {
+    stopper.emplace(path);
+    stopper->send(testing_support::createRequest(1, 7));
+    answering->place.waitUntilStopped();
+  }
+  void letListenerGo() { answering->place.letGo(); }
+
+  /// One reply, or two with so many bytes together.
+  void answerOnce(std::size_t client, std::size_t bytes) {
+    answering->reply(client, bytes);
+  }
+  void answer(std::size_t client, std::size_t bytes) {
+    answerOnce(client, bytes / 2);
+    answerOnce(client, bytes - bytes / 2);
+  }
+  /// Whether it gets replies with so many bytes. Otherwise it is cut off before or told
+  /// that it is.
+  bool gets(std::size_t client, std::size_t bytes) {
+    while (bytes != 0) {
+      const auto item = clients[client]->receive();
+      if (!item || item->size() + wire::kFrameHeaderSize > bytes) return false;
+      bytes -= item->size() + wire::kFrameHeaderSize;
+    }
+    return true;
+  }
+  std::size_t cutOff() const {
+    return misuse->counts()[static_cast<std::size_t>(MisuseLog::Kind::kCutOff)];
+  }
+
+  class Service final : public testing_support::RecordingService {
+   public:
+    void createReportingSession(ReporterID, BoolReply reply) override {
+      place.stopHere();
+      reply(true);
+    }
+    void sendMessage(Dictionary, MessageCategory category, MessageType,
+                     std::optional<ReporterIDs>, ErrorReply reply) override {
+      const std::lock_guard lock(mutex_);
+      replies_[static_cast<std::size_t>(category)].push_back(std::move(reply));
+    }
+
+    std::size_t waiting(std::size_t client) {
+      const std::lock_guard lock(mutex_);
+      return replies_[client].size();
+    }
+    void reply(std::size_t client, std::size_t frameBytes) {
+      ErrorReply reply;
+      {
+        const std::lock_guard lock(mutex_);
+        reply = std::move(replies_[client].front());
+        replies_[client].pop_front();
+      }
+      reply(ErrorObject{"", 0, textForFrameOf(frameBytes)});
+    }
+
+    testing_support::StoppingPlace place;
+
+   private:
+    // A longer text has a longer head.
+    static std::string textForFrameOf(std::size_t bytes) {
+      for (std::size_t head = 0; head < 32; ++head) {
+        std::string text(bytes - head, 'x');
+        std::string frame;
+        wire::appendReply(frame, 1, ErrorObject{"", 0, text});
+        if (frame.size() == bytes) return text;
+      }
+      ADD_FAILURE() << "no frame has " << bytes << " bytes";
+      return "";
+    }
+
+    std::mutex mutex_;
+    std::map<std::size_t, std::deque<ErrorReply>> replies_;
+  };
+
+  const std::shared_ptr<Service> answering = std::make_shared<Service>();
+  std::vector<std::unique_ptr<RawClient>> clients;
+  std::optional<RawClient> stopper;
+};
+
+TEST_F(ListenerUnreadReplies, OfAClientAreTakenUpToItsLimit) {
+  const std::size_t below = connect();
+  const std::size_t at = connect();
+  const std::size_t beyond = connect();
+
+  stopListener();
+  answer(below, limits::kUnreadReplyBytes - 1);
+  answer(at, limits::kUnreadReplyBytes);
+  answer(beyond, limits::kUnreadReplyBytes + 1);
+  letListenerGo();
+
+  EXPECT_TRUE(gets(below, limits::kUnreadReplyBytes - 1));
+  EXPECT_TRUE(gets(at, limits::kUnreadReplyBytes));
+  EXPECT_FALSE(gets(beyond, limits::kUnreadReplyBytes + 1));
+  EXPECT_EQ(cutOff(), 1u);
+}
+
+/// By how much they are more than the limit.
+class ListenerUnreadRepliesAround : public ListenerUnreadReplies,
+                                    public testing::WithParamInterface<int> {
+ protected:
+  static std::size_t around(std::size_t limit) {
+    return limit + static_cast<std::size_t>(GetParam());
+  }
+  /// Clients with so many bytes unread between them, each within its limit.
+  void connectThoseWithMany() {
+    for (std::size_t i = 0; i < kThoseWithMany; ++i) connect();
+  }
+  void answerThoseWithMany(std::size_t bytes) {
+    for (std::size_t i = 0; i < kThoseWithMany; ++i) answer(i, bytes / kThoseWithMany);
+    ASSERT_EQ(bytes % kThoseWithMany, 0u);
+  }
+
+  static constexpr std::size_t kThoseWithMany = 4;
+};
+
+TEST_P(ListenerUnreadRepliesAround, ThatOfTheUserLeaveAClientLittleBeyondIt) {
+  constexpr std::size_t kFirst = 2 * limits::kUnreadReplyBytesInNeed;
+  constexpr std::size_t kOthers = limits::kUnreadReplyBytesOfUser - kFirst;
+  connectThoseWithMany();
+  const std::size_t client = connect();
+
+  stopListener();
+  answerThoseWithMany(kOthers);
+  // Alone it may be large; the next one finds what there is.
+  answerOnce(client, around(kFirst));
+  answerOnce(client, 100);
+  letListenerGo();
+
+  EXPECT_EQ(gets(client, around(kFirst) + 100), GetParam() <= 0);
+  EXPECT_EQ(cutOff(), GetParam() <= 0 ? 0u : 1u);
+}
+
+TEST_P(ListenerUnreadRepliesAround, WhatAClientHasInNeedAreTakenUpToThat) {
+  connectThoseWithMany();
+  const std::size_t oneMore = connect();
+  const std::size_t client = connect();
+
+  stopListener();
+  answerThoseWithMany(limits::kUnreadReplyBytesOfUser);
+  answerOnce(oneMore, 100);
+  answer(client, around(limits::kUnreadReplyBytesInNeed));
+  letListenerGo();
+
+  EXPECT_EQ(gets(client, around(limits::kUnreadReplyBytesInNeed)), GetParam() <= 0);
+  EXPECT_EQ(cutOff(), GetParam() <= 0 ? 0u : 1u);
+}
+
+INSTANTIATE_TEST_SUITE_P(Each, ListenerUnreadRepliesAround, testing::Values(-1, 0, 1));
 
 }  // namespace
 }  // namespace ostrel
