@@ -6,32 +6,29 @@
 
 #include <algorithm>
 #include <atomic>
-#include <cstdlib>
 #include <future>
 #include <iostream>
 #include <limits>
-#include <sstream>
 
 #include "ostrel/OstrelReportingClient.h"
 #include "tests/hostile/Behaviours.h"
+#include "tests/hostile/ProcessUsage.h"
 #include "tests/integration/ServiceUnderTest.h"
 
 namespace ostrel {
 namespace {
 
 using namespace std::chrono_literals;
+using hostile::kMemoryIsBounded;
+using hostile::kMostResidentKiB;
+using hostile::numberIn;
+using hostile::Usage;
+using hostile::usageOf;
 using std::chrono::steady_clock;
 using testing::HasSubstr;
 using testing::Not;
 using testing_support::ChildProcess;
 
-#ifdef OSTREL_SANITIZED
-// Sanitizers keep several times the memory of what they watch, and what was freed too.
-constexpr bool kMemoryIsBounded = false;
-#else
-constexpr bool kMemoryIsBounded = true;
-#endif
-constexpr std::size_t kMostResidentKiB = 96 * 1024;
 // With all at once, and with sessions that start as fast as a client can make them. That
 // it is 96 MiB here too is the aim. On a machine that is busy with other work too, where
 // the service's threads of low priority lag behind, up to 108 were seen.
@@ -48,35 +45,6 @@ constexpr std::size_t kMostThreads = 16;
 // Of a reply to a client that behaves, on a machine that is busy with other tests too.
 constexpr auto kLongestReply = 10s;
 
-struct Usage {
-  std::size_t descriptors = 0;
-  std::size_t threads = 0;
-  std::size_t peakResidentKiB = 0;
-};
-
-Usage usageOf(pid_t pid) {
-  const std::string process = "/proc/" + std::to_string(pid);
-  Usage usage;
-  for ([[maybe_unused]] const auto& each :
-       std::filesystem::directory_iterator(process + "/fd")) {
-    ++usage.descriptors;
-  }
-  std::ifstream status(process + "/status");
-  for (std::string line; std::getline(status, line);) {
-    std::istringstream words(line);
-    std::string name;
-    std::size_t value = 0;
-    words >> name >> value;
-    if (name == "Threads:") usage.threads = value;
-    if (name == "VmHWM:") usage.peakResidentKiB = value;
-  }
-  return usage;
-}
-
-double numberIn(const char* variable, double usual) {
-  const char* value = std::getenv(variable);
-  return value != nullptr ? std::atof(value) : usual;
-}
 /// How long everything at once goes on, and each behaviour alone.
 double secondsAtOnce() { return numberIn("OSTREL_HOSTILE_SECONDS", 1); }
 /// What 99 of 100 replies take at most beside all at once, in milliseconds; of an
