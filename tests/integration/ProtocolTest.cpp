@@ -366,6 +366,35 @@ TEST_F(Protocol, RefusesMessagesWhileReportingIsSwitchedOff) {
   EXPECT_THAT(service.rows(kMessages), ElementsAre("NULL|7|1|{\"text\":\"accepted\"}"));
 }
 
+TEST_F(Protocol, SendsNothingAfterARestartOfWhatIsSwitchedOff) {
+  {
+    RecordingClient client = connect();
+    switchReporting(client, /*on=*/false);
+    client->killService(/*reply=*/nullptr);
+  }
+  EXPECT_EQ(service.process().wait(), 2);
+  service.start();
+  RecordingClient client = connect();
+
+  // As the service manager does when the service is ready.
+  ASSERT_EQ(service.ostrelctl({"notify"}), 0);
+  ASSERT_TRUE(eventually([&] {
+    send(client, "switched?", ReporterIDs{});
+    return client.takeReplies().back() == "send com.orbisk.audio.reporting 1";
+  }));
+  client->createReportingSession(kReporter, client.boolean("create"));
+  client->startReportingSessionForID(kReporter, client.boolean("start"));
+  send(client, "to all", std::nullopt);
+  send(client, "to one", ReporterIDs{kReporter});
+
+  EXPECT_THAT(client.takeReplies(), ElementsAre("create true", "start false",
+                                                "send com.orbisk.audio.reporting 1",
+                                                "send com.orbisk.audio.reporting 1"));
+  EXPECT_EQ(service.terminate(), 0);
+  EXPECT_THAT(service.rows("SELECT id FROM telemetry_messages"), IsEmpty());
+  EXPECT_THAT(service.rows("SELECT id FROM telemetry_sessions"), IsEmpty());
+}
+
 TEST_F(Protocol, GoesOnWithAStartedSessionOnceReportingIsOnAgain) {
   RecordingClient client = connect();
   createStarted(client, kReporter);
