@@ -4,6 +4,8 @@
 
 #include <atomic>
 #include <mutex>
+#include <set>
+#include <string>
 #include <thread>
 #include <vector>
 
@@ -97,6 +99,32 @@ TEST(MessageTypeName, NamesEachCode) {
 TEST(MessageTypeName, IsUndefinedForCodesWithoutAName) {
   EXPECT_EQ(MessageTypeName(MessageType{6}), "Undefined");
   EXPECT_EQ(MessageTypeName(MessageType{65534}), "Undefined");
+}
+
+TEST(MessageNames, AreFewWhateverCodesThereAre) {
+  constexpr std::size_t kDomains = 7;  // Without, of five names, and of none.
+  constexpr std::size_t kKinds = 12;
+  constexpr std::size_t kTypes = 8;
+  constexpr std::uint32_t kSomeDomains[] = {0,          0x00010000, 0x08000000,
+                                            0x10000000, 0x20000000, 0x40000000,
+                                            0x80000000, 0xFFFF0000};
+  std::set<std::string> serviceTypes;
+  std::set<std::string> types;
+  std::set<std::string> categories;
+  std::set<const void*> names;
+  for (std::uint32_t code = 0; code <= 0xFFFF; ++code) {
+    serviceTypes.emplace(ServiceTypeName(static_cast<ServiceType>(code)));
+    types.emplace(MessageTypeName(static_cast<MessageType>(code)));
+    for (const std::uint32_t domain : kSomeDomains) {
+      categories.insert(category(domain | code));
+      names.insert(&messageNames(MessageCategory{domain | code},
+                                 static_cast<MessageType>(code * 7)));
+    }
+  }
+  EXPECT_EQ(serviceTypes.size(), 13u);
+  EXPECT_EQ(types.size(), kTypes);
+  EXPECT_EQ(categories.size(), kDomains * kKinds);
+  EXPECT_LE(names.size(), kDomains * kKinds * kTypes);
 }
 
 TEST(HostApplicationID, IsUnknownWithoutAnApplication) {
