@@ -111,7 +111,8 @@ JSONObject counters(const Tool& tool) {
   for (const JSONObject& row : *rows.value) {
     const JSONNode* key = find(row, "key");
     const JSONNode* value = find(row, "value");
-    if (key != nullptr && key->string() != nullptr && value != nullptr) {
+    if (key != nullptr && key->string() != nullptr && value != nullptr &&
+        value->number()) {
       counts.push_back({*key->string(), *value});
     }
   }

@@ -366,7 +366,7 @@ class ToolStoreTest : public ToolTest {
 TEST_F(ToolStoreTest, ShowsWhatTheServiceCounts) {
   store_->run(
       "CREATE TABLE service_status (key TEXT PRIMARY KEY, value);"
-      "INSERT INTO service_status VALUES ('analytics_dropped', 3)");
+      "INSERT INTO service_status VALUES ('store_id', 'ab'), ('analytics_dropped', 3)");
   service_->onRequest = [this] { service_->reporterIDsReplies.at(0)({}); };
   EXPECT_EQ(run({"status", "--json"}), 0);
   EXPECT_THAT(takeOutput(), HasSubstr("\"counters\":{\"analytics_dropped\":3}"));

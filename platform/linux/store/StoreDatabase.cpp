@@ -26,6 +26,7 @@
 #include "platform/Logging.h"
 #include "platform/linux/FileDescriptor.h"
 #include "platform/linux/Limits.h"
+#include "platform/linux/store/StoreIdentity.h"
 #include "platform/linux/store/StoreRowTables.h"
 #include "platform/linux/store/StoreStatement.h"
 
@@ -130,6 +131,7 @@ struct StoreDatabase::Statements {
   StoreStatement removePower;
   StoreStatement removeSessions;
   StoreStatement addToStatus;
+  StoreStatement nameStore;
 
   struct Source {
     StoreStatement Statements::*statement;
@@ -190,6 +192,9 @@ const StoreDatabase::Statements::Source StoreDatabase::Statements::kSources[] = 
     {&Statements::addToStatus,
      "INSERT INTO service_status (key, value) VALUES (?, ?) "
      "ON CONFLICT (key) DO UPDATE SET value = value + excluded.value"},
+    {&Statements::nameStore,
+     "INSERT INTO service_status (key, value) VALUES (?, lower(hex(randomblob(16)))) "
+     "ON CONFLICT (key) DO NOTHING"},
 };
 
 StoreDatabase::StoreDatabase(std::string path, const char* vfs)
@@ -581,6 +586,11 @@ StoreDatabase::Result StoreDatabase::setStatus(std::string_view key, std::int64_
 StoreDatabase::Result StoreDatabase::addToStatus(std::string_view key,
                                                  std::int64_t value) {
   return resultOf(statements_->addToStatus.run(key, value), "update the status");
+}
+
+StoreDatabase::Result StoreDatabase::nameStore() {
+  return resultOf(statements_->nameStore.run(std::string_view(kStoreIdentityKey)),
+                  "name the store");
 }
 
 StoreDatabase::Result StoreDatabase::readFingerprint(std::int64_t& fingerprint) {

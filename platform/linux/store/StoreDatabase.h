@@ -118,6 +118,9 @@ class StoreDatabase {
   /// Adds to a value of the status that outlives the process.
   Result addToStatus(std::string_view key, std::int64_t value);
 
+  /// Gives the store its name, unless it has one.
+  Result nameStore();
+
   /// A number that differs before and after any insertion.
   Result readFingerprint(std::int64_t& fingerprint);
 

@@ -343,6 +343,7 @@ StoreWriter::Result StoreWriter::writeStatus() {
   std::uint64_t sum = 1;
   for (const auto& [key, value] : rare) sum += value;
   if (sum == writtenStatus_) return std::nullopt;
+  if (Result failed = database_.nameStore()) return failed;
   for (const auto& [key, value] : rare) {
     if (Result failed = database_.setStatus(key, static_cast<std::int64_t>(value))) {
       return failed;
