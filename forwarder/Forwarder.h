@@ -1,0 +1,96 @@
+#pragma once
+
+#include <chrono>
+#include <cstddef>
+#include <cstdint>
+#include <optional>
+#include <string>
+
+#include "forwarder/ForwardMark.h"
+#include "forwarder/ForwarderSettings.h"
+#include "forwarder/ReportSource.h"
+#include "forwarder/RetryPauses.h"
+#include "forwarder/Transport.h"
+#include "forwarder/Verdict.h"
+#include "platform/Clock.h"
+#include "platform/Random.h"
+
+namespace ostrel {
+
+/// What the forwarder waits for. One thread.
+class Waits {
+ public:
+  virtual ~Waits() = default;
+
+  // Each is false when the process is to end.
+
+  /// Until the store may hold more than it did.
+  virtual bool forChange() = 0;
+  virtual bool forTime(std::chrono::milliseconds pause) = 0;
+};
+
+/// All of them outlive the forwarder.
+struct ForwarderParts {
+  ReportSource& source;
+  Transport& transport;
+  MarkKeeper& marks;
+  Waits& waits;
+  const Clock& clock;
+  Random& random;
+};
+
+/// Posts what a store holds to a collector, in order and in batches, each message at
+/// least once. One thread.
+///
+/// | the collector                   | the forwarder                                    |
+/// |---------------------------------|--------------------------------------------------|
+/// | takes a batch                   | moves its mark                                   |
+/// | refuses a batch as such         | tries half of it; one message alone is parked    |
+/// | refuses for now, or is not there| waits, longer each time, and tries again         |
+class Forwarder {
+ public:
+  /// Of one request; a record is larger than the texts it is made of.
+  static constexpr std::size_t kMostReports = 512;
+  static constexpr std::size_t kMostBytes = 1024 * 1024;
+  /// A collector that refuses so many messages in a row, one by one, may be one that
+  /// refuses everything: from then on each costs a pause.
+  static constexpr int kParkedAtOnce = 10;
+
+  Forwarder(const ForwarderParts& parts, NamesAndValues resource, ForwardMark mark);
+
+  /// Forwards what there is and what comes, until the process is to end.
+  void run();
+
+  /// Forwards what there is. Without success when some of it was not taken, or at the
+  /// first thing that takes patience; the error is a sentence for people.
+  Success runOnce();
+
+  const ForwardMark& mark() const { return mark_; }
+
+ private:
+  struct Next {
+    enum class Kind { kGoOn, kWaitForChange, kPause, kEnd };
+    Kind kind = Kind::kGoOn;
+    std::chrono::milliseconds pause{};
+  };
+
+  Next step();
+  void beginStore(const std::string& store);
+  Next act(const ReportBatch& batch, std::size_t requestBytes, const Verdict& verdict);
+  Next take(const ReportBatch& batch, const Verdict& verdict);
+  Next refuse(const ReportBatch& batch, std::size_t requestBytes, const Verdict& verdict);
+  Next park(const ReportBatch& batch, const Verdict& verdict);
+  Next later(const std::string& sentence, std::optional<std::chrono::milliseconds> asked);
+  void moveMark(const ReportBatch& batch);
+
+  const ForwarderParts parts_;
+  const NamesAndValues resource_;
+  ForwardMark mark_;
+  RetryPauses pauses_;
+  BatchSize size_{kMostReports, kMostBytes};
+  int parkedInARow_ = 0;
+  std::string loggedFault_;
+  std::string loggedMarkFault_;
+};
+
+}  // namespace ostrel
