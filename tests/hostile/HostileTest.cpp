@@ -100,6 +100,8 @@ class GoodClient {
 
   template <typename T, typename Call>
   void ask(Call call) {
+    // The service may have gone, and each wait is long.
+    if (result_.unanswered != 0) return;
     const auto answered = std::make_shared<std::promise<bool>>();
     const auto begin = steady_clock::now();
     call([answered](const reporting::Reply<T>& reply) {
