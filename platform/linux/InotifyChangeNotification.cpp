@@ -30,6 +30,10 @@ using std::chrono::steady_clock;
 constexpr std::uint32_t kEvents =
     IN_CLOSE_WRITE | IN_MOVED_TO | IN_ATTRIB | IN_DELETE_SELF | IN_MOVE_SELF;
 
+// What comes in this time is looked at together: a flood costs no more than that, however
+// often a file is touched and whatever its name.
+constexpr milliseconds kPauseOfReading{10};
+
 // Whoever replaces the directory is given this long to do it himself.
 constexpr milliseconds kFirstRetry{50};
 constexpr milliseconds kSecondRetry{1000};
@@ -102,11 +106,15 @@ bool InotifyChangeNotification::watch() {
 }
 
 void InotifyChangeNotification::run() {
-  for (;;) {
-    pollfd descriptors[] = {{inotify_.get(), POLLIN, 0}, {stopEvent_.get(), POLLIN, 0}};
-    ::poll(descriptors, std::size(descriptors), waitMilliseconds());
-    if (descriptors[1].revents != 0) return;
-    readEvents();
+  for (bool isFlood = false;;) {
+    pollfd descriptors[] = {{stopEvent_.get(), POLLIN, 0}, {inotify_.get(), POLLIN, 0}};
+    if (isFlood) {
+      ::poll(descriptors, /*nfds=*/1, static_cast<int>(kPauseOfReading.count()));
+    } else {
+      ::poll(descriptors, std::size(descriptors), waitMilliseconds());
+    }
+    if (descriptors[0].revents != 0) return;
+    isFlood = readEvents();
     if (watch_ < 0 && steady_clock::now() >= retryAt_) watchAgain();
     handOn();
   }
@@ -125,11 +133,12 @@ int InotifyChangeNotification::waitMilliseconds() {
   return static_cast<int>(std::max(left, milliseconds(0)).count());
 }
 
-void InotifyChangeNotification::readEvents() {
+// False when there was none.
+bool InotifyChangeNotification::readEvents() {
   alignas(inotify_event) std::array<char, 16384> buffer;
-  for (;;) {
+  for (bool isAny = false;; isAny = true) {
     const ssize_t size = ::read(inotify_.get(), buffer.data(), buffer.size());
-    if (size <= 0) return;
+    if (size <= 0) return isAny;
     for (const char* at = buffer.data(); at < buffer.data() + size;) {
       const auto& event = *reinterpret_cast<const inotify_event*>(at);
       at += sizeof(inotify_event) + event.len;

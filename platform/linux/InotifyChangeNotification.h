@@ -17,9 +17,9 @@ namespace ostrel {
 /// is missing, also when somebody removes it later; a file that is found in it then
 /// counts as posted.
 ///
-/// The first post of a name is handed on at once, those that follow within
-/// `kShortestInterval` as one at its end. The thread, which is started by the first
-/// registration, sleeps between posts.
+/// The first post of a name is handed on at once or 10 ms after another's, those that
+/// follow within `kShortestInterval` as one at its end. The thread, which is started by
+/// the first registration, sleeps between posts.
 class InotifyChangeNotification final : public ChangeNotification {
  public:
   static constexpr std::chrono::milliseconds kShortestInterval{100};
@@ -52,7 +52,7 @@ class InotifyChangeNotification final : public ChangeNotification {
   bool watch();
   void run();
   int waitMilliseconds();
-  void readEvents();
+  bool readEvents();
   void post(std::string_view name);
   void postAll();
   void postExisting();

@@ -161,27 +161,44 @@ TEST_F(InotifyChangeNotificationPosts, AreRefusedWithoutADirectory) {
   EXPECT_NE(notification.registerDispatch("a", queue_, [](int) {}).status, 0);
 }
 
+// How often the notifications' thread went to sleep.
+long switches() {
+  long sum = 0;
+  for (const auto& task : std::filesystem::directory_iterator("/proc/self/task")) {
+    std::ifstream comm(task.path() / "comm");
+    std::string name;
+    std::getline(comm, name);
+    if (name != "notifications") continue;
+    std::ifstream status(task.path() / "status");
+    for (std::string line; std::getline(status, line);) {
+      if (line.rfind("voluntary_ctxt_switches:", 0) == 0) {
+        sum += std::stol(line.substr(line.find('\t')));
+      }
+    }
+  }
+  return sum;
+}
+
+TEST_F(InotifyChangeNotificationPosts, CostFewWakeUpsHoweverManyThereAre) {
+  add("com.example.a", queue_);
+  write(file());
+  ASSERT_TRUE(queue_->waitFor(1));
+  const long before = switches();
+  const auto begin = std::chrono::steady_clock::now();
+  // Those that nobody listens to as well.
+  for (int i = 0; i < 5000; ++i) {
+    ::utimensat(AT_FDCWD, file().c_str(), nullptr, 0);
+    if (i % 50 == 0) write(file(std::to_string(i)));
+  }
+  // It looks a hundred times a second, and sleeps twice for each look at most.
+  const std::chrono::duration<double> took = std::chrono::steady_clock::now() - begin;
+  EXPECT_LE(static_cast<double>(switches() - before), 200 * took.count() + 20);
+}
+
 TEST_F(InotifyChangeNotificationPosts, CostNoWakeUpWhileThereAreNone) {
   add("com.example.a", queue_);
   write(file());
   ASSERT_TRUE(queue_->waitFor(1));
-  // How often the thread went to sleep.
-  const auto switches = [] {
-    long sum = 0;
-    for (const auto& task : std::filesystem::directory_iterator("/proc/self/task")) {
-      std::ifstream comm(task.path() / "comm");
-      std::string name;
-      std::getline(comm, name);
-      if (name != "notifications") continue;
-      std::ifstream status(task.path() / "status");
-      for (std::string line; std::getline(status, line);) {
-        if (line.rfind("voluntary_ctxt_switches:", 0) == 0) {
-          sum += std::stol(line.substr(line.find('\t')));
-        }
-      }
-    }
-    return sum;
-  };
   // The thread may still be on its way to sleep: wait until it stays there.
   long before = switches();
   int quietIntervals = 0;
