@@ -197,9 +197,8 @@ int StoreOwners::removeOfLargest(std::int64_t rows, std::int64_t& removed) {
 int StoreOwners::removeOf(std::int64_t user, RowKind kind, std::int64_t rows,
                           std::int64_t& removed) {
   Statements::OfKind& ofKind = statements_->ofKind[indexOf(kind)];
-  int code = ofKind.lastID.begin();
-  const std::int64_t newest = ofKind.lastID.integer(0);
-  ofKind.lastID.reset();
+  std::int64_t newest = 0;
+  int code = newestOf(kind, newest);
   if (code != SQLITE_ROW) return code;
   for (int i = 0; i < kMostLookedAt && rows > 0; ++i) {
     OwnedRows owned;
@@ -232,9 +231,8 @@ int StoreOwners::removeSessionsOf(std::int64_t user, std::int64_t rows,
   // The oldest has gone already, and is not forgotten yet: any may have messages.
   if (hasMessages && !before) return SQLITE_OK;
   Statements::OfKind& ofKind = statements_->ofKind[indexOf(RowKind::kSessions)];
-  code = ofKind.lastID.begin();
-  const std::int64_t newest = ofKind.lastID.integer(0);
-  ofKind.lastID.reset();
+  std::int64_t newest = 0;
+  code = newestOf(RowKind::kSessions, newest);
   if (code != SQLITE_ROW) return code;
   for (int i = 0; i < kMostLookedAt && rows > 0; ++i) {
     OwnedRows owned;
@@ -290,6 +288,14 @@ int StoreOwners::forgetRemoved(RowKind kind) {
     if (code != SQLITE_OK) return code;
   }
   return SQLITE_OK;
+}
+
+int StoreOwners::newestOf(RowKind kind, std::int64_t& id) {
+  StoreStatement& statement = statements_->ofKind[indexOf(kind)].lastID;
+  const int code = statement.begin();
+  id = statement.integer(0);
+  statement.reset();
+  return code;
 }
 
 int StoreOwners::oldestOf(std::int64_t user, RowKind kind, std::int64_t after,

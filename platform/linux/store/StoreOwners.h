@@ -61,6 +61,8 @@ class StoreOwners {
   int removeOf(std::int64_t user, RowKind kind, std::int64_t rows, std::int64_t& removed);
   int removeSessionsOf(std::int64_t user, std::int64_t rows, std::int64_t& removed);
   int forgetRemoved(RowKind kind);
+  // SQLITE_ROW with what is found, else none was.
+  int newestOf(RowKind kind, std::int64_t& id);
   int oldestOf(std::int64_t user, RowKind kind, std::int64_t after, OwnedRows& rows);
   static void read(StoreStatement& statement, RowKind kind, OwnedRows& rows);
   // Of `rows` those from `first` on are left; with so many bytes.
