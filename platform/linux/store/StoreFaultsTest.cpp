@@ -19,6 +19,7 @@
 #include "platform/linux/store/StoreTelemetryBackend.h"
 #include "platform/linux/store/StoreTesting.h"
 #include "platform/linux/store/StoreWattlogSink.h"
+#include "platform/linux/store/StoreWriter.h"
 
 namespace ostrel {
 namespace {
@@ -427,6 +428,47 @@ TEST_F(StoreFaults, GivesUpTheOldestInALongFaultAndCountsThem) {
                 "SELECT count(*) > 5000, max(reporter_id) FROM telemetry_sessions WHERE "
                 "ended_at NOT NULL"),
             "1|39999");
+}
+
+// From the n-th call on all fail: the commit among them, which may have been made.
+TEST_F(StoreFaults, HasNothingTwiceThoughPartOfACommitWasGivenUp) {
+  FaultVFS& vfs = FaultVFS::instance();
+  const auto messageIn = [](int number) {
+    StoreBatch batch;
+    batch.push_back({/*time=*/1, LoneMessage{Dictionary(), Dictionary(), 1, 1,
+                                             Dictionary{{"i", Value(number)}}}});
+    return batch;
+  };
+  FaultPlan plan;
+  plan.isForEver = true;
+  std::int64_t failed = 1;
+  int timesMade = 0;
+  for (plan.after = 0; plan.after < 1000 && failed != 0; ++plan.after) {
+    SCOPED_TRACE(plan.after);
+    vfs.clearPlan();
+    fs::remove_all(stateDirectory());
+    StoreCounters counters;
+    StoreWriter writer(path(), FaultVFS::kName, StoreRetention(), counters);
+    writer.recover();
+    ASSERT_FALSE(writer.fault());
+    vfs.setPlan(plan);
+    std::vector<StoreBatch> batches;
+    for (int i = 1; i <= 2; ++i) batches.push_back(messageIn(i));
+    writer.add(std::move(batches));
+    writer.commit();
+    failed = vfs.failed();
+    if (writer.fault()) writer.keepAtMost(1);
+    vfs.clearPlan();
+    writer.recover();
+    writer.commit();
+    writer.close();
+    const std::vector<std::string> all = numbers();
+    if (all.size() == 2 && failed != 0) ++timesMade;
+    EXPECT_EQ(all, all.size() == 2 ? (std::vector<std::string>{"1", "2"})
+                                   : std::vector<std::string>{"2"});
+  }
+  EXPECT_EQ(failed, 0) << "a commit has more calls than were tried";
+  EXPECT_GT(timesMade, 0);
 }
 
 // The n-th call below the store fails.

@@ -476,11 +476,25 @@ void StoreWriter::keepAtMost(std::size_t count) {
     counters_.lost.fetch_add(pending_[batches].size(), std::memory_order_relaxed);
   }
   if (batches == 0) return;
-  doubt_.reset();
+  if (doubt_) leaveOutOfDoubt(batches);
   pending_.erase(pending_.begin(),
                  pending_.begin() + static_cast<std::ptrdiff_t>(batches));
   uncommittedBytes_ = 0;
   for (const StoreBatch& batch : pending_) uncommittedBytes_ += payloadBytesOf(batch);
+}
+
+// The first batches, which are given up. The others are not written again if the commit
+// was made.
+void StoreWriter::leaveOutOfDoubt(std::size_t batches) {
+  doubt_->batches -= std::min(doubt_->batches, batches);
+  for (std::size_t i = 0; i < batches; ++i) {
+    for (const StoreOperation& operation : pending_[i]) {
+      const auto* const end = std::get_if<SessionEnd>(&operation.what);
+      if (end == nullptr) continue;
+      std::erase_if(doubt_->rows,
+                    [&](const auto& row) { return row.first == end->session.get(); });
+    }
+  }
 }
 
 ErrorObject StoreWriter::errorOf(const StoreFault& fault) {

@@ -83,6 +83,7 @@ class StoreWriter {
   Result openOrReplace();
   Result setAside(const StoreFault& fault);
   Result resolveDoubt();
+  void leaveOutOfDoubt(std::size_t batches);
   std::vector<StoreBatch> takeDone(std::size_t batches);
   Result writePending();
   Result write(StoreOperation& operation);
