@@ -59,7 +59,7 @@ constexpr std::size_t kStrandsOfBatch = 64;
 constexpr int kUrgentInARow = 16;
 /// So many steps for a strand wait for more.
 constexpr int kStepsHeld = 64;
-/// So many strands a thread takes at once, where there are more than that for each.
+/// So many strands a thread takes beside the first at most: half of its part of a line.
 constexpr std::size_t kStrandsInHand = 32;
 constexpr std::size_t kMostThreads =
     std::max({ThreadPoolWorkQueues::kMostInteractiveThreads,
