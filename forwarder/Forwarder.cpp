@@ -56,23 +56,39 @@ Success Forwarder::runOnce() {
 }
 
 Forwarder::Next Forwarder::step() {
-  auto read = parts_.source.reportsAfter(mark_.through, size_);
+  auto read = parts_.source.reportsAfter(mark_.through, {mostReports_, kMostTextBytes});
   if (!read.value) return later(read.error->description, std::nullopt);
-  const ReportBatch& batch = *read.value;
+  ReportBatch& batch = *read.value;
   if (batch.store.empty()) return {Next::Kind::kWaitForChange, {}};
   if (batch.store != mark_.store || batch.newestID < mark_.through) {
     beginStore(batch.store);
     return {};
   }
   if (batch.reports.empty()) return {Next::Kind::kWaitForChange, {}};
+  const std::string request = requestOf(batch);
+  return act(batch, request, post(request));
+}
 
+/// Takes out of the batch what there is no room for.
+std::string Forwarder::requestOf(ReportBatch& batch) {
   std::vector<std::string> records;
+  std::size_t bytes = 0;
   for (const Report& report : batch.reports) {
-    records.push_back(logRecordJSON(report, batch.store));
+    std::string record = logRecordJSON(report, batch.store);
+    bytes += record.size();
+    if (!records.empty() && bytes > mostRecordBytes_) break;
+    records.push_back(std::move(record));
   }
-  const std::string request = logsRequestJSON(resource_, OSTREL_VERSION, records);
+  if (records.size() < batch.reports.size()) {
+    batch.reports.resize(records.size());
+    mostReports_ = records.size();  // The next may be twice as many.
+  }
+  return logsRequestJSON(resource_, OSTREL_VERSION, records);
+}
+
+Verdict Forwarder::post(const std::string& request) {
   const Reply reply = parts_.transport.post(request);
-  return act(batch, request.size(), verdictOn(reply, parts_.clock.now()));
+  return verdictOn(reply, parts_.clock.now());
 }
 
 // Another store than before, or the same with its end cut off.
@@ -85,17 +101,18 @@ void Forwarder::beginStore(const std::string& store) {
   mark_.through = 0;
 }
 
-Forwarder::Next Forwarder::act(const ReportBatch& batch, std::size_t requestBytes,
+Forwarder::Next Forwarder::act(const ReportBatch& batch, const std::string& request,
                                const Verdict& verdict) {
   switch (verdict.kind) {
     case Verdict::Kind::kTaken:
       return take(batch, verdict);
     case Verdict::Kind::kRefused:
     case Verdict::Kind::kTooLarge:
-      return refuse(batch, requestBytes, verdict);
+      return refuse(batch, request.size(), verdict);
+    case Verdict::Kind::kBroken:
+      return bearFailure(batch, request, verdict);
     case Verdict::Kind::kLater:
-      return later("the collector does not take anything now: " + verdict.reason,
-                   verdict.pauseAsked);
+      return wait(verdict);
     case Verdict::Kind::kInterrupted:
       break;
   }
@@ -118,7 +135,7 @@ Forwarder::Next Forwarder::take(const ReportBatch& batch, const Verdict& verdict
   mark_.forwarded += count - rejected;
   moveMark(batch);
   parkedInARow_ = 0;
-  size_.reports = std::min(2 * size_.reports, kMostReports);
+  mostReports_ = std::min(2 * mostReports_, kMostReports);
   pauses_.reset();
   return {};
 }
@@ -129,11 +146,47 @@ Forwarder::Next Forwarder::refuse(const ReportBatch& batch, std::size_t requestB
                                   const Verdict& verdict) {
   const std::size_t count = batch.reports.size();
   if (count == 1) return park(batch, verdict);
-  size_.reports = count / 2;
+  mostReports_ = count / 2;
   if (verdict.kind == Verdict::Kind::kTooLarge) {
-    size_.bytes = std::min(size_.bytes, requestBytes / 2);
+    mostRecordBytes_ = std::min(mostRecordBytes_, requestBytes / 2);
   }
   return {};
+}
+
+Forwarder::Next Forwarder::wait(const Verdict& verdict) {
+  return later("the collector does not take anything now: " + verdict.reason,
+               verdict.pauseAsked);
+}
+
+// A failure may be the collector's own, which will pass, or come of a message, which will
+// not. It is the message's when it comes every time, though another is taken before and
+// it comes once more after that.
+Forwarder::Next Forwarder::bearFailure(const ReportBatch& batch,
+                                       const std::string& request,
+                                       const Verdict& verdict) {
+  if (batch.reports.size() > 1) {
+    mostReports_ = batch.reports.size() / 2;
+    return wait(verdict);
+  }
+  if (++failuresOfFirst_ < kFailuresOfSuspect || !takesAnother(batch)) {
+    return wait(verdict);
+  }
+  const Verdict again = post(request);
+  return again.kind == Verdict::Kind::kBroken ? park(batch, again)
+                                              : act(batch, request, again);
+}
+
+/// Sends one of the messages that follow. It comes again in its turn.
+bool Forwarder::takesAnother(const ReportBatch& batch) {
+  constexpr BatchSize kFew{16, kMostTextBytes};
+  auto following = parts_.source.reportsAfter(batch.reports.back().id, kFew);
+  if (!following.value || following.value->store != batch.store) return false;
+  std::vector<Report>& reports = following.value->reports;
+  if (reports.empty()) return false;
+  const auto drawn = parts_.random.uniform(static_cast<std::uint32_t>(reports.size()));
+  const std::string record = logRecordJSON(reports[drawn], batch.store);
+  return post(logsRequestJSON(resource_, OSTREL_VERSION, {record})).kind ==
+         Verdict::Kind::kTaken;
 }
 
 Forwarder::Next Forwarder::park(const ReportBatch& batch, const Verdict& verdict) {
@@ -166,6 +219,7 @@ void Forwarder::moveMark(const ReportBatch& batch) {
     mark_.dropped += dropped;
   }
   mark_.through = batch.reports.back().id;
+  failuresOfFirst_ = 0;
   const Success saved = parts_.marks.save(mark_);
   if (saved.succeeded) {
     loggedMarkFault_.clear();

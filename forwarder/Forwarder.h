@@ -46,15 +46,23 @@ struct ForwarderParts {
 /// |---------------------------------|--------------------------------------------------|
 /// | takes a batch                   | moves its mark                                   |
 /// | refuses a batch as such         | tries half of it; one message alone is parked    |
-/// | refuses for now, or is not there| waits, longer each time, and tries again         |
+/// | fails                           | waits, and tries half of it; one message alone |
+/// |                                 | that it fails on again and again, while it takes |
+/// |                                 | another, is parked | | refuses for now, or is not
+/// there| waits, longer each time, and tries again         |
 class Forwarder {
  public:
-  /// Of one request; a record is larger than the texts it is made of.
+  /// Of one request. One record is sent however large it is.
   static constexpr std::size_t kMostReports = 512;
-  static constexpr std::size_t kMostBytes = 1024 * 1024;
+  static constexpr std::size_t kMostRecordBytes = 2 * 1024 * 1024;
+  /// Of the texts that are read for it.
+  static constexpr std::size_t kMostTextBytes = 1024 * 1024;
   /// A collector that refuses so many messages in a row, one by one, may be one that
   /// refuses everything: from then on each costs a pause.
   static constexpr int kParkedAtOnce = 10;
+  /// How often a collector has to fail on one message alone before it is suspected. With
+  /// the pauses between them that takes an hour.
+  static constexpr int kFailuresOfSuspect = 8;
 
   Forwarder(const ForwarderParts& parts, NamesAndValues resource, ForwardMark mark);
 
@@ -75,10 +83,16 @@ class Forwarder {
   };
 
   Next step();
+  std::string requestOf(ReportBatch& batch);
+  Verdict post(const std::string& request);
   void beginStore(const std::string& store);
-  Next act(const ReportBatch& batch, std::size_t requestBytes, const Verdict& verdict);
+  Next act(const ReportBatch& batch, const std::string& request, const Verdict& verdict);
   Next take(const ReportBatch& batch, const Verdict& verdict);
   Next refuse(const ReportBatch& batch, std::size_t requestBytes, const Verdict& verdict);
+  Next wait(const Verdict& verdict);
+  Next bearFailure(const ReportBatch& batch, const std::string& request,
+                   const Verdict& verdict);
+  bool takesAnother(const ReportBatch& batch);
   Next park(const ReportBatch& batch, const Verdict& verdict);
   Next later(const std::string& sentence, std::optional<std::chrono::milliseconds> asked);
   void moveMark(const ReportBatch& batch);
@@ -87,8 +101,10 @@ class Forwarder {
   const NamesAndValues resource_;
   ForwardMark mark_;
   RetryPauses pauses_;
-  BatchSize size_{kMostReports, kMostBytes};
+  std::size_t mostReports_ = kMostReports;
+  std::size_t mostRecordBytes_ = kMostRecordBytes;
   int parkedInARow_ = 0;
+  int failuresOfFirst_ = 0;  // While it was sent alone.
   std::string loggedFault_;
   std::string loggedMarkFault_;
 };

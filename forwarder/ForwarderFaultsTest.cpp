@@ -314,6 +314,8 @@ const Fault kFaults[] = {
     {"AsksForATimeThatIsPast", alwaysStatus(503, "Sun, 06 Nov 1994 08:49:37 GMT"), {}},
     {"AsksForADate", retryAtDate, {}},
     {"RefusesSomeMessages", poison(97, 400), [](int number) { return number % 97 == 0; }},
+    {"FailsOnAMessage", poison(300, 500), [](int number) { return number % 300 == 0; },
+     minutes(300)},
     {"RefusesEveryOther", poison(2, 400), [](int number) { return number % 2 == 0; }},
     {"RefusesLargeRequests", tooLarge, {}},
     {"RefusesALargeMessage", oneTooLarge, [](int number) { return number == 200; }},

@@ -66,10 +66,21 @@ TEST_F(ForwarderTest, SendsWhatThereIsInBatches) {
   EXPECT_EQ(marks_.saved.forwarded, 1100);
 }
 
-TEST_F(ForwarderTest, SendsNoMoreThanAMebibyteAtOnce) {
+TEST_F(ForwarderTest, ReadsNoMoreThanAMebibyteAtOnce) {
   for (int i = 0; i < 5; ++i) source_.add(std::string(500'000, 'x'));
   run();
   EXPECT_EQ(transport_.sizes, (std::vector<std::size_t>{3, 2}));
+}
+
+TEST_F(ForwarderTest, SendsNoMoreThanTwoMebibytesAtOnce) {
+  // Each takes six times as much when it is sent.
+  for (int i = 0; i < 12; ++i) source_.add(std::string(80'000, '\x01'));
+  run();
+  EXPECT_EQ(taken_.size(), 12u);
+  for (const std::size_t bytes : transport_.bytes) {
+    EXPECT_LE(bytes, Forwarder::kMostRecordBytes + 1000);
+  }
+  EXPECT_EQ(transport_.sizes, (std::vector<std::size_t>{4, 4, 4}));
 }
 
 TEST_F(ForwarderTest, GoesOnWhereItStopped) {
@@ -138,12 +149,12 @@ TEST_F(ForwarderTest, PausesForEachMessageOfACollectorThatRefusesAll) {
 }
 
 TEST_F(ForwarderTest, FindsASizeThatTheCollectorTakes) {
-  add(1000);
+  add(300);
   transport_.answer = [this](const ReceivedRequest& request) {
     return request.bytes > 20'000 ? FakeTransport::status(413) : take(request);
   };
   run();
-  EXPECT_EQ(taken_.size(), 1000u);
+  EXPECT_EQ(taken_.size(), 300u);
   EXPECT_EQ(marks_.saved.parked, 0);
 }
 
@@ -168,6 +179,43 @@ TEST_F(ForwarderTest, ParksAMessageThatIsTooLargeAlone) {
   run();
   EXPECT_EQ(taken_.size(), 20u);
   EXPECT_EQ(marks_.saved.parked, 1);
+}
+
+TEST_F(ForwarderTest, ParksAMessageThatTheCollectorFailsOnAgainAndAgain) {
+  add(100);
+  source_.add("poison");
+  add(100);
+  refusePoison(500);
+  run();
+  EXPECT_EQ(taken_.size(), 200u);
+  EXPECT_EQ(marks_.saved.parked, 1);
+  EXPECT_GE(waits_.pauses.size(), 1u * Forwarder::kFailuresOfSuspect);
+  EXPECT_LE(taken_.repeated(), 1u);
+}
+
+TEST_F(ForwarderTest, ParksNothingForACollectorThatFailsOnAll) {
+  add(100);
+  int attempts = 0;
+  transport_.answer = [&](const ReceivedRequest& request) {
+    return ++attempts < 200 ? FakeTransport::status(500) : take(request);
+  };
+  run();
+  EXPECT_EQ(taken_.size(), 100u);
+  EXPECT_EQ(marks_.saved.parked, 0);
+}
+
+TEST_F(ForwarderTest, WaitsWithTheLastMessageUntilAnotherShowsWhoseFaultItIs) {
+  source_.add("poison");
+  refusePoison(500);
+  waits_.mostPauses = 50;
+  run();
+  EXPECT_EQ(marks_.saved.parked, 0);
+  add(1);
+  waits_.pauses.clear();
+  waits_.mostPauses = 1'000'000;
+  run();
+  EXPECT_EQ(marks_.saved.parked, 1);
+  EXPECT_EQ(taken_.size(), 1u);
 }
 
 TEST_F(ForwarderTest, CountsWhatTheCollectorTookOut) {

@@ -93,7 +93,7 @@ Outcome<ReportBatch> StoreReportSource::reportsAfter(std::int64_t id, BatchSize 
   if (success.succeeded) {
     const std::string where = "SELECT * FROM (" + statement(id, most) +
                               ") WHERE before < " + std::to_string(most.bytes) +
-                              " OR before = 0 ORDER BY id";
+                              " ORDER BY id";
     success = reader.query(where, [&](const auto&, StoreReader::Row row) {
       batch.reports.push_back(reportOf(row));
     });

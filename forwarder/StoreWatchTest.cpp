@@ -2,8 +2,11 @@
 
 #include <gtest/gtest.h>
 #include <sys/eventfd.h>
+#include <unistd.h>
 
+#include <atomic>
 #include <filesystem>
+#include <fstream>
 #include <thread>
 
 #include "platform/linux/TestSupport.h"
@@ -13,6 +16,7 @@ namespace {
 
 using std::chrono::hours;
 using std::chrono::milliseconds;
+using testing_support::eventually;
 using testing_support::TemporaryDirectory;
 
 class StoreWatchTest : public ::testing::Test {
@@ -23,6 +27,13 @@ class StoreWatchTest : public ::testing::Test {
   void end() {
     const std::uint64_t one = 1;
     ASSERT_EQ(::write(end_.get(), &one, sizeof one), 8);
+  }
+
+  static bool sleeps(pid_t thread) {
+    std::ifstream file("/proc/self/task/" + std::to_string(thread) + "/stat");
+    std::string text;
+    std::getline(file, text);
+    return text.find(") S ") != std::string::npos;
   }
 
   const TemporaryDirectory directory_;
@@ -75,8 +86,17 @@ TEST_F(StoreWatchTest, SeesNoOtherFilesAndNoReaders) {
   write("reports.db-shm");
   directory_.write("a/b/reports.db-wal", "");  // As a reader makes it.
   std::filesystem::remove(directory_ / "a/b/reports.db-wal");
+  std::atomic<bool> isOver = false;
+  std::atomic<pid_t> thread = 0;
+  std::thread waiting([&] {
+    thread = ::gettid();
+    watch.forChange();
+    isOver = true;
+  });
+  EXPECT_TRUE(eventually([&] { return isOver || (thread != 0 && sleeps(thread)); }));
+  EXPECT_FALSE(isOver);
   end();
-  EXPECT_FALSE(watch.forChange());
+  waiting.join();
 }
 
 TEST_F(StoreWatchTest, EndsWhileItWaits) {

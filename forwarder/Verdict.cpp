@@ -40,6 +40,8 @@ Verdict::Kind kindOf(int status) {
       return Verdict::Kind::kRefused;
     case 413:
       return Verdict::Kind::kTooLarge;
+    case 500:
+      return Verdict::Kind::kBroken;
     default:
       return Verdict::Kind::kLater;
   }
@@ -55,7 +57,7 @@ Verdict verdictOn(const Reply& reply, Date now) {
   }
   verdict.kind = kindOf(reply.status);
   if (verdict.kind == Verdict::Kind::kTaken) verdict.rejected = rejectedIn(reply.body);
-  if (verdict.kind == Verdict::Kind::kLater) {
+  if (verdict.kind == Verdict::Kind::kLater || verdict.kind == Verdict::Kind::kBroken) {
     verdict.pauseAsked = pauseAsked(reply.retryAfter, now);
   }
   verdict.reason = reply.status == 0

@@ -16,6 +16,7 @@ struct Verdict {
     kTaken,
     kRefused,   // Something in it will never be taken.
     kTooLarge,  // The same; less at once may be.
+    kBroken,    // The collector failed, and what in the batch it failed on is not told.
     kLater,     // It may be taken at another time, or when somebody mended something.
     kInterrupted,
   };

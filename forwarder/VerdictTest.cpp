@@ -25,8 +25,9 @@ TEST(Verdict, GoesByTheStatus) {
     EXPECT_EQ(verdictOf(status).kind, Kind::kRefused) << status;
   }
   EXPECT_EQ(verdictOf(413).kind, Kind::kTooLarge);
+  EXPECT_EQ(verdictOf(500).kind, Kind::kBroken);
   for (const int status : {0, 100, 301, 302, 307, 308, 401, 403, 404, 405, 408, 415, 429,
-                           500, 502, 503, 504, 999}) {
+                           501, 502, 503, 504, 999}) {
     EXPECT_EQ(verdictOf(status).kind, Kind::kLater) << status;
   }
 }
@@ -54,6 +55,7 @@ TEST(Verdict, SaysWhatPauseIsAskedFor) {
   EXPECT_EQ(verdictOf(429, "", "7").pauseAsked, milliseconds(7000));
   EXPECT_EQ(verdictOf(503, "", "Thu, 01 Jan 1970 00:00:09 GMT").pauseAsked,
             milliseconds(9000));
+  EXPECT_EQ(verdictOf(500, "", "7").pauseAsked, milliseconds(7000));
   EXPECT_EQ(verdictOf(503, "", "soon").pauseAsked, std::nullopt);
   EXPECT_EQ(verdictOf(200, "", "7").pauseAsked, std::nullopt);
 }
