@@ -61,7 +61,7 @@ class Forwarder {
   /// refuses everything: from then on each costs a pause.
   static constexpr int kParkedAtOnce = 10;
   /// How often a collector has to fail on one message alone before it is suspected. With
-  /// the pauses between them that takes an hour.
+  /// the pauses between them that takes minutes, or an hour where it was searched for.
   static constexpr int kFailuresOfSuspect = 8;
 
   Forwarder(const ForwarderParts& parts, NamesAndValues resource, ForwardMark mark);

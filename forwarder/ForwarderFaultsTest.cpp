@@ -314,8 +314,7 @@ const Fault kFaults[] = {
     {"AsksForATimeThatIsPast", alwaysStatus(503, "Sun, 06 Nov 1994 08:49:37 GMT"), {}},
     {"AsksForADate", retryAtDate, {}},
     {"RefusesSomeMessages", poison(97, 400), [](int number) { return number % 97 == 0; }},
-    {"FailsOnAMessage", poison(300, 500), [](int number) { return number % 300 == 0; },
-     minutes(300)},
+    {"FailsOnAMessage", poison(300, 500), [](int number) { return number % 300 == 0; }},
     {"RefusesEveryOther", poison(2, 400), [](int number) { return number % 2 == 0; }},
     {"RefusesLargeRequests", tooLarge, {}},
     {"RefusesALargeMessage", oneTooLarge, [](int number) { return number == 200; }},
@@ -349,6 +348,8 @@ TEST_P(CollectorThat, CostsNothingThatItDidNotRefuse) {
 
   world.run(fault.make(world));
 
+  const auto drained = std::chrono::duration_cast<minutes>(world.elapsed());
+  RecordProperty("minutes", static_cast<int>(drained.count()));
   ASSERT_EQ(world.sent.size(), static_cast<std::size_t>(kMessages));
   std::size_t missing = 0;
   for (std::size_t i = 0; i < world.sent.size(); ++i) {
@@ -360,8 +361,8 @@ TEST_P(CollectorThat, CostsNothingThatItDidNotRefuse) {
   EXPECT_EQ(world.marks.saved.parked + world.marks.saved.rejected,
             static_cast<std::int64_t>(missing));
   EXPECT_EQ(world.marks.saved.dropped, 0);
-  EXPECT_GE(world.elapsed(), kHour);
-  EXPECT_LE(world.elapsed(), fault.longest);
+  EXPECT_GE(drained, kHour);
+  EXPECT_LE(drained, fault.longest);
 }
 
 INSTANTIATE_TEST_SUITE_P(ForAnHour, CollectorThat, ::testing::ValuesIn(kFaults),
