@@ -56,7 +56,7 @@ class CurlTransport::Handles {
     addHeader("Expect:");
     for (const auto& [name, value] : settings.headers) {
       // A name that ends in ";" is sent with an empty value.
-      addHeader(value.empty() ? name + ';' : name + ": " + value);
+      addHeader(std::string(name).append(value.empty() ? ";" : ": ").append(value));
     }
     setUp(settings);
     setUpTLS(settings);

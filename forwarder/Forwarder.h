@@ -42,14 +42,13 @@ struct ForwarderParts {
 /// Posts what a store holds to a collector, in order and in batches, each message at
 /// least once. One thread.
 ///
-/// | the collector                   | the forwarder                                    |
-/// |---------------------------------|--------------------------------------------------|
-/// | takes a batch                   | moves its mark                                   |
-/// | refuses a batch as such         | tries half of it; one message alone is parked    |
-/// | fails                           | waits, and tries half of it; one message alone |
-/// |                                 | that it fails on again and again, while it takes |
-/// |                                 | another, is parked | | refuses for now, or is not
-/// there| waits, longer each time, and tries again         |
+/// | the collector               | the forwarder                                       |
+/// |-----------------------------|-----------------------------------------------------|
+/// | takes a batch               | moves its mark                                      |
+/// | refuses a batch as such     | tries half of it; one message alone is parked       |
+/// | fails on a batch            | waits, then tries half of it; one message alone is  |
+/// |                             | parked when it is what the collector fails on       |
+/// | refuses for now, or is away | waits, longer each time, and tries it again         |
 class Forwarder {
  public:
   /// Of one request. One record is sent however large it is.

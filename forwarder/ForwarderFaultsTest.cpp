@@ -286,7 +286,7 @@ FakeTransport::Answer killed(World& world) {
 FakeTransport::Answer markIsNotKept(World& world) {
   return [&world](const ReceivedRequest& request) {
     world.marks.fails = world.isFaulty();
-    const Reply reply = world.take(request);
+    Reply reply = world.take(request);
     if (!world.isFaulty() || world.random.uniform(50) != 0) return reply;
     return world.kill();
   };

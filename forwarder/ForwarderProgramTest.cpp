@@ -310,7 +310,7 @@ class ForwarderOverTLS : public ForwarderProgramTest {
   /// Sends to a server with this certificate; gives the exit status.
   int sendTo(const std::string& certificate) {
     const ChildProcess server(
-        {"python3", OSTREL_FORWARDER_SOURCES "/tls_server.py",
+        {"python3", std::string(OSTREL_FORWARDER_SOURCES) + "/tls_server.py",
          *this / (certificate + ".pem"), *this / (certificate + ".key"), *this / "port",
          *this / "received"},
         *this / "server.txt");
