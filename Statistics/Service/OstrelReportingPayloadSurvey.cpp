@@ -22,10 +22,11 @@ std::uint64_t blanksIn8(const char* text) {
 }
 
 // Keys are short: a call of `memchr` takes longer than the search. Up to `readableEnd`
-// there are bytes, be it other ones than of the text.
+// there are bytes, be it other ones than of the text; null: nothing is known of any.
 bool holdsBlank(std::string_view text, const char* readableEnd) {
   if (text.size() < 8) {
-    if (std::endian::native == std::endian::little && readableEnd - text.data() >= 8) {
+    const bool hasWord = readableEnd != nullptr && readableEnd - text.data() >= 8;
+    if (std::endian::native == std::endian::little && hasWord) {
       const std::uint64_t ofText = (std::uint64_t{1} << (8 * text.size())) - 1;
       return (blanksIn8(text.data()) & ofText) != 0;
     }
@@ -59,7 +60,7 @@ PayloadSurvey::PayloadSurvey(const Dictionary& payload) : begin_(payload.value()
   const DictionaryView entries = payload.view();
   const ValueBuffer& owner = payload.owner();
   const auto* const readableEnd =
-      reinterpret_cast<const char*>(owner.data() + owner.size());
+      owner ? reinterpret_cast<const char*>(owner.data() + owner.size()) : nullptr;
   ValueView last = payload.value();
   for (const auto& [key, value] : entries) {
     last = value;

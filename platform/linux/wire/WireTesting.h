@@ -3,8 +3,8 @@
 
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <cstdint>
-#include <cstring>
 #include <initializer_list>
 #include <memory>
 #include <optional>
@@ -37,8 +37,8 @@ class ExactBytes {
       : bytes_(std::make_unique<std::uint8_t[]>(bytes.size() + behind.size())),
         size_(bytes.size()),
         readable_(bytes.size() + behind.size()) {
-    std::memcpy(bytes_.get(), bytes.data(), size_);
-    std::memcpy(bytes_.get() + size_, behind.data(), behind.size());
+    std::copy(bytes.begin(), bytes.end(), bytes_.get());
+    std::copy(behind.begin(), behind.end(), bytes_.get() + size_);
   }
   std::span<const std::uint8_t> span() const { return {bytes_.get(), size_}; }
   const std::uint8_t* readableEnd() const { return bytes_.get() + readable_; }
