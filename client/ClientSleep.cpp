@@ -5,9 +5,7 @@
 #include "client/ClientSleep.h"
 
 #include <sys/epoll.h>
-#include <sys/eventfd.h>
 #include <sys/timerfd.h>
-#include <unistd.h>
 
 #include <algorithm>
 #include <cerrno>
@@ -30,17 +28,18 @@ bool change(int poll, int operation, int descriptor, std::uint32_t events) {
 }  // namespace
 
 Outcome<ClientSleep> ClientSleep::make() {
+  auto wake = WakeEvent::make();
+  if (!wake.value) return {{}, std::move(wake.error)};
   OwnedDescriptor poll(::epoll_create1(EPOLL_CLOEXEC));
-  OwnedDescriptor event(::eventfd(/*initval=*/0, EFD_CLOEXEC | EFD_NONBLOCK));
   OwnedDescriptor timer(::timerfd_create(CLOCK_MONOTONIC, TFD_CLOEXEC | TFD_NONBLOCK));
-  if (!poll || !event || !timer ||
-      !change(poll.get(), EPOLL_CTL_ADD, event.get(), EPOLLIN | EPOLLET) ||
+  if (!poll || !timer ||
+      !change(poll.get(), EPOLL_CTL_ADD, wake.value->descriptor(), EPOLLIN | EPOLLET) ||
       !change(poll.get(), EPOLL_CTL_ADD, timer.get(), EPOLLIN | EPOLLET)) {
     return {{},
             ErrorObject{std::string(kPOSIXErrorDomain), errno,
-                        std::string("cannot make an event: ") + std::strerror(errno)}};
+                        std::string("cannot wait: ") + std::strerror(errno)}};
   }
-  return {ClientSleep(std::move(poll), std::move(event), std::move(timer)), {}};
+  return {ClientSleep(std::move(poll), *std::move(wake.value), std::move(timer)), {}};
 }
 
 bool ClientSleep::watch(int socket) {
@@ -50,13 +49,6 @@ bool ClientSleep::watch(int socket) {
 
 void ClientSleep::forget(int socket) {
   ::epoll_ctl(poll_.get(), EPOLL_CTL_DEL, socket, /*event=*/nullptr);
-}
-
-void ClientSleep::wake() {
-  const std::uint64_t one = 1;
-  // Only a full counter refuses, and then the thread is woken already.
-  while (::write(event_.get(), &one, sizeof one) < 0 && errno == EINTR) {
-  }
 }
 
 ClientSleep::Clock::time_point ClientSleep::endOfWait(Clock::time_point time) const {
@@ -96,7 +88,7 @@ void ClientSleep::setEvents(int socket, bool wantsToWrite) {
 
 void ClientSleep::close() {
   poll_.reset();
-  event_.reset();
+  wake_.close();
   timer_.reset();
 }
 

@@ -1,6 +1,7 @@
 #pragma once
 
 #include <chrono>
+#include <utility>
 
 #include "client/ClientSocket.h"
 #include "platform/Outcome.h"
@@ -25,7 +26,7 @@ class ClientSleep {
   void forget(int socket);
 
   /// Ends a wait of the client's thread, or its next one at once. Any thread.
-  void wake();
+  void wake() { wake_.wake(); }
 
   /// When a wait until `time` would end at the latest.
   Clock::time_point endOfWait(Clock::time_point time) const;
@@ -39,14 +40,14 @@ class ClientSleep {
   void close();
 
  private:
-  ClientSleep(OwnedDescriptor poll, OwnedDescriptor event, OwnedDescriptor timer)
-      : poll_(std::move(poll)), event_(std::move(event)), timer_(std::move(timer)) {}
+  ClientSleep(OwnedDescriptor poll, WakeEvent wake, OwnedDescriptor timer)
+      : poll_(std::move(poll)), wake_(std::move(wake)), timer_(std::move(timer)) {}
 
   void setTimer(Clock::time_point time);
   void setEvents(int socket, bool wantsToWrite);
 
   OwnedDescriptor poll_;
-  OwnedDescriptor event_;
+  WakeEvent wake_;
   OwnedDescriptor timer_;
   Clock::time_point timerEnd_ = Clock::time_point::max();
   bool waitsForRoom_ = false;
