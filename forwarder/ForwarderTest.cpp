@@ -30,6 +30,14 @@ class ForwarderTest : public ::testing::Test {
   void add(int count) {
     for (int i = 0; i < count; ++i) source_.add("plain");
   }
+  /// The collector takes every request and says that it took so many messages out.
+  void sayRejected(const std::string& count) {
+    transport_.answer = [count](const ReceivedRequest&) {
+      Reply reply = FakeTransport::status(200);
+      reply.body = R"({"partialSuccess":{"rejectedLogRecords":")" + count + "\"}}";
+      return reply;
+    };
+  }
   Reply take(const ReceivedRequest& request) {
     taken_.take(request);
     return FakeTransport::status(200);
@@ -220,11 +228,7 @@ TEST_F(ForwarderTest, WaitsWithTheLastMessageUntilAnotherShowsWhoseFaultItIs) {
 
 TEST_F(ForwarderTest, CountsWhatTheCollectorTookOut) {
   add(10);
-  transport_.answer = [](const ReceivedRequest&) {
-    Reply reply = FakeTransport::status(200);
-    reply.body = R"({"partialSuccess":{"rejectedLogRecords":"3"}})";
-    return reply;
-  };
+  sayRejected("3");
   run();
   EXPECT_EQ(marks_.saved.forwarded, 7);
   EXPECT_EQ(marks_.saved.rejected, 3);
@@ -233,11 +237,7 @@ TEST_F(ForwarderTest, CountsWhatTheCollectorTookOut) {
 
 TEST_F(ForwarderTest, CountsNoMoreTakenOutThanWasSent) {
   add(10);
-  transport_.answer = [](const ReceivedRequest&) {
-    Reply reply = FakeTransport::status(200);
-    reply.body = R"({"partialSuccess":{"rejectedLogRecords":"9223372036854775807"}})";
-    return reply;
-  };
+  sayRejected("9223372036854775807");
   run();
   EXPECT_EQ(marks_.saved.forwarded, 0);
   EXPECT_EQ(marks_.saved.rejected, 10);
