@@ -2,27 +2,18 @@
 
 #include <cstddef>
 #include <cstdint>
-#include <optional>
 #include <string>
 #include <vector>
 
-#include "ostrelctl/JSONNode.h"
+#include "ostrelctl/StoreReader.h"
 #include "platform/Outcome.h"
 
 namespace ostrel {
 
 /// One message as the store holds it, with what is known of its session.
-struct Report {
-  std::int64_t id = 0;
-  /// The session's row; none for a message without one.
-  std::optional<std::int64_t> sessionID;
-  std::optional<std::int64_t> reporterID;
-  std::int64_t category = 0;
-  std::int64_t type = 0;
-  JSONNode payload;
+struct Report : RecordedMessage {
   JSONNode userInfo;
   std::string hierarchyToken;  // Empty for none.
-  std::int64_t createdAt = 0;  // Microseconds since 1970.
 };
 
 /// Messages that follow each other in a store.

@@ -13,19 +13,8 @@
 namespace ostrel {
 namespace {
 
-std::string textOf(const JSONNode& column) {
-  return column.string() != nullptr ? *column.string() : std::string();
-}
-
 std::int64_t integerOf(const JSONNode& column) {
   return column.signedInteger().value_or(0);
-}
-
-/// What a JSON column holds; as plain text when that is not JSON.
-JSONNode jsonOf(JSONNode column) {
-  if (column.string() == nullptr) return column;
-  auto parsed = parseJSON(*column.string());
-  return parsed.value ? *std::move(parsed.value) : std::move(column);
 }
 
 const JSONNode* memberOf(const JSONNode& node, std::string_view key) {
@@ -51,19 +40,19 @@ Report reportOf(StoreReader::Row& row) {
   report.id = integerOf(row[0]);
   report.sessionID = row[1].signedInteger();
   report.reporterID = row[2].signedInteger();
-  report.hierarchyToken = textOf(row[3]);
+  report.hierarchyToken = textColumn(row[3]);
   // A message without a session says itself what belongs to one.
-  const JSONNode info = jsonOf(std::move(row[4]));
+  const JSONNode info = jsonColumn(std::move(row[4]));
   if (const JSONNode* reporter = memberOf(info, kTelvarSessionInfoSessionID)) {
     report.reporterID = reporter->signedInteger();
   }
   if (const JSONNode* token = memberOf(info, kTelvarSessionInfoHierarchyToken)) {
-    report.hierarchyToken = textOf(*token);
+    report.hierarchyToken = textColumn(*token);
   }
-  report.userInfo = jsonOf(std::move(row[5]));
+  report.userInfo = jsonColumn(std::move(row[5]));
   report.category = integerOf(row[6]);
   report.type = integerOf(row[7]);
-  report.payload = jsonOf(std::move(row[8]));
+  report.payload = jsonColumn(std::move(row[8]));
   report.createdAt = integerOf(row[9]);
   return report;
 }
@@ -78,10 +67,12 @@ Outcome<ReportBatch> StoreReportSource::reportsAfter(std::int64_t id, BatchSize 
   StoreReader& reader = **opened.value;
 
   ReportBatch batch;
-  Success success = reader.query(
-      std::string("SELECT value FROM service_status WHERE key = '") + kStoreIdentityKey +
-          "'",
-      [&](const auto&, const StoreReader::Row& row) { batch.store = textOf(row[0]); });
+  Success success =
+      reader.query(std::string("SELECT value FROM service_status WHERE key = '") +
+                       kStoreIdentityKey + "'",
+                   [&](const auto&, const StoreReader::Row& row) {
+                     batch.store = textColumn(row[0]);
+                   });
   // One that has no name yet gets it with its next commit.
   if (success.succeeded && batch.store.empty()) return {std::move(batch), {}};
   if (success.succeeded) {

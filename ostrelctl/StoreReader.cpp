@@ -114,7 +114,8 @@ StoreReader::Row currentRow(sqlite3_stmt* statement) {
   return row;
 }
 
-/// What a JSON column holds; as plain text when that is not JSON.
+}  // namespace
+
 JSONNode jsonColumn(JSONNode column) {
   const std::string* text = column.string();
   if (text == nullptr) return column;
@@ -125,8 +126,6 @@ JSONNode jsonColumn(JSONNode column) {
 std::string textColumn(const JSONNode& column) {
   return column.string() != nullptr ? *column.string() : std::string();
 }
-
-}  // namespace
 
 Outcome<std::shared_ptr<StoreReader>> StoreReader::open(const std::string& path) {
   struct stat status {};

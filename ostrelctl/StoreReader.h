@@ -18,6 +18,11 @@ namespace ostrel {
 /// Microseconds since 1970-01-01T00:00:00Z.
 using StoreTime = std::int64_t;
 
+/// What a JSON column holds; as plain text when that is not JSON.
+JSONNode jsonColumn(JSONNode column);
+/// What a text column holds; empty for null.
+std::string textColumn(const JSONNode& column);
+
 /// One session as the store holds it. Infos are JSON.
 struct RecordedSession {
   std::int64_t id = 0;
