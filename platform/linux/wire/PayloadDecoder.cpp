@@ -64,7 +64,26 @@ struct TextGlance {
   bool isASCII;
 };
 
-// `size` bytes at `at`, `end` the end of all bytes.
+// Texts up to this size have it in their first byte.
+constexpr std::size_t kShortText = 23;
+constexpr Byte kShortTextHead = kTextString << 5;
+
+// Of a text of `size` bytes, `kShortText` at most, behind whose beginning are a word's
+// bytes or more.
+[[gnu::always_inline]] inline TextGlance glanceAtShort(const Byte* at, std::size_t size) {
+  constexpr std::size_t kWord = sizeof(std::uint64_t);
+  if (size < kWord) {
+    const std::uint64_t word =
+        littleEndian(loadWord(at)) & ((std::uint64_t{1} << (8 * size)) - 1);
+    return {word, 0, (word & kHighBits) == 0};
+  }
+  const std::uint64_t first = loadWord(at);
+  const std::uint64_t last = loadWord(at + size - kWord);
+  const std::uint64_t between = loadWord(at + std::min(kWord, size - kWord));
+  return {first, last, ((first | between | last) & kHighBits) == 0};
+}
+
+// Of any text: `size` bytes at `at`, `end` the end of all bytes.
 [[gnu::always_inline]] inline TextGlance glance(const Byte* at, std::size_t size,
                                                 const Byte* end) {
   if (size >= sizeof(std::uint64_t)) {
@@ -76,23 +95,17 @@ struct TextGlance {
     }
     return {first, last, (high & kHighBits) == 0};
   }
-  std::uint64_t word = 0;
-  if (static_cast<std::size_t>(end - at) >= sizeof word) [[likely]] {
-    const std::uint64_t mask = (std::uint64_t{1} << (8 * size)) - 1;
-    word = littleEndian(loadWord(at)) & mask;
-  } else {
-    for (std::size_t i = 0; i < size; ++i) word |= std::uint64_t{at[i]} << (8 * i);
+  if (static_cast<std::size_t>(end - at) >= sizeof(std::uint64_t)) [[likely]] {
+    return glanceAtShort(at, size);
   }
+  std::uint64_t word = 0;
+  for (std::size_t i = 0; i < size; ++i) word |= std::uint64_t{at[i]} << (8 * i);
   return {word, 0, (word & kHighBits) == 0};
 }
 
 [[gnu::always_inline]] inline std::uint32_t mix(std::uint64_t a, std::uint64_t b) {
   return static_cast<std::uint32_t>(((a ^ std::rotl(b, 29)) * 0x9E3779B97F4A7C15) >> 32);
 }
-
-// Texts up to this size have it in their first byte.
-constexpr std::size_t kShortText = 23;
-constexpr Byte kShortTextHead = kTextString << 5;
 
 // The longest plain entry, and the word that is read of a text's last bytes.
 constexpr std::size_t kPlainEntryRoom = 2 * (1 + kShortText) + sizeof(std::uint64_t);
@@ -115,21 +128,6 @@ constexpr auto kPlainSizes = [] {
   sizes[kFalseItem] = sizes[kTrueItem] = 1;
   return sizes;
 }();
-
-// As `glance`, of a text of `size` bytes, `kShortText` at most, behind whose beginning
-// are a word's bytes or more.
-[[gnu::always_inline]] inline TextGlance glanceAtShort(const Byte* at, std::size_t size) {
-  constexpr std::size_t kWord = sizeof(std::uint64_t);
-  if (size < kWord) {
-    const std::uint64_t word =
-        littleEndian(loadWord(at)) & ((std::uint64_t{1} << (8 * size)) - 1);
-    return {word, 0, (word & kHighBits) == 0};
-  }
-  const std::uint64_t first = loadWord(at);
-  const std::uint64_t last = loadWord(at + size - kWord);
-  const std::uint64_t between = loadWord(at + std::min(kWord, size - kWord));
-  return {first, last, ((first | between | last) & kHighBits) == 0};
-}
 
 // The size of the plain item at `at`, behind which there is room for one. 0: another.
 [[gnu::always_inline]] inline std::size_t plainSize(const Byte* at) {
