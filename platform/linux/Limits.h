@@ -233,8 +233,9 @@ inline constexpr std::chrono::seconds kUnreadPatience{3};
 /// [UnixSocketListener.AcceptsAgainOnceThereAreDescriptors]
 inline constexpr std::chrono::milliseconds kAcceptBackOff{100};
 
-/// How often one kind of misuse by one user is logged.
-/// [MisuseLog.LogsAKindOfAUserAgainAfterTheInterval]
+/// How often one kind of misuse by one user is logged, or its use of others' sessions.
+/// [MisuseLog.LogsAKindOfAUserAgainAfterTheInterval,
+/// UsesOfOthers.AreToldOnceAMinuteForEachUserAndCountedEachTime]
 inline constexpr std::chrono::seconds kMisuseLogInterval{60};
 
 // What a session collects

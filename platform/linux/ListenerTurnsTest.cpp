@@ -146,7 +146,7 @@ class PeerConnectionTurn : public testing::Test {
 
   std::unique_ptr<PeerConnection> connect(const ListenerLimits& limits) {
     auto connection = std::make_unique<PeerConnection>(1, std::move(ours), PeerIdentity(),
-                                                       channel, limits, misuse);
+                                                       channel, limits, misuse, owners);
     connection->setExportedObject(service);
     return connection;
   }
@@ -171,6 +171,7 @@ class PeerConnectionTurn : public testing::Test {
       1, std::make_shared<LoopWaker>(), user,
       PeerChannel::Limits{limits::kQueuedBytes, limits::kUnreadReplyBytes});
   MisuseLog misuse;
+  SessionOwners owners;
   const std::shared_ptr<RecordingService> service = std::make_shared<RecordingService>();
   std::vector<std::uint8_t> buffer = std::vector<std::uint8_t>(64 * 1024);
 };

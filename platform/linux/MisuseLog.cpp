@@ -16,6 +16,7 @@ constexpr std::array<Wording, MisuseLog::kKinds> kWordings{{
     {"connections_refused", "is not let in"},
     {"sessions_refused", "gets no session"},
     {"configurations_cut", "has no room for entries of a configuration"},
+    {"sessions_of_others_used", "uses a session of another user"},
 }};
 
 const Wording& wordingOf(MisuseLog::Kind kind) {
@@ -26,19 +27,32 @@ const Wording& wordingOf(MisuseLog::Kind kind) {
 
 void MisuseLog::note(std::uint32_t user, Kind kind, std::string_view reason,
                      Clock::time_point now) {
-  bool mayLog = false;
-  {
-    const std::lock_guard lock(mutex_);
-    ++counts_[static_cast<std::size_t>(kind)];
-    Clock::time_point& mayLogAgain = mayLogAgain_[{user, kind}];
-    mayLog = now >= mayLogAgain;
-    if (mayLog) mayLogAgain = now + limits::kMisuseLogInterval;
-  }
-  if (mayLog) {
+  if (count(user, kind, /*count=*/1, now)) {
     OSTREL_LOG_ERROR(processLogScope, "a client of user %u %@: %@", user,
                      wordingOf(kind).sentence, reason);
   }
   if (counted_) counted_();
+}
+
+void MisuseLog::noteUses(std::uint32_t user, std::uint64_t uses, const UseOfOthers& use,
+                         Clock::time_point now) {
+  if (count(user, Kind::kUseOfOthers, uses, now)) {
+    OSTREL_LOG_DEFAULT(
+        processLogScope,
+        "a client of user %u %@: it %@ %lli, which a client of user %u made", user,
+        wordingOf(Kind::kUseOfOthers).sentence, use.deed, use.session, use.maker);
+  }
+  if (counted_) counted_();
+}
+
+bool MisuseLog::count(std::uint32_t user, Kind kind, std::uint64_t count,
+                      Clock::time_point now) {
+  const std::lock_guard lock(mutex_);
+  counts_[static_cast<std::size_t>(kind)] += count;
+  Clock::time_point& mayLogAgain = mayLogAgain_[{user, kind}];
+  if (now < mayLogAgain) return false;
+  mayLogAgain = now + limits::kMisuseLogInterval;
+  return true;
 }
 
 MisuseLog::Counts MisuseLog::counts() const {

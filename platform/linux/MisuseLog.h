@@ -10,10 +10,12 @@
 #include <string_view>
 #include <utility>
 
+#include "Statistics/OstrelReportingTypes.h"
+
 namespace ostrel {
 
-/// What clients were cut short of: counted each time, logged once a minute for each
-/// user. Any thread.
+/// What clients were cut short of, and what they may do and others might want to know:
+/// counted each time, logged once a minute for each user. Any thread.
 class MisuseLog {
  public:
   using Clock = std::chrono::steady_clock;
@@ -22,9 +24,17 @@ class MisuseLog {
     kCutOff,
     kConnectionRefused,
     kSessionRefused,
-    kUserInfoRefused
+    kUserInfoRefused,
+    kUseOfOthers
   };
-  static constexpr std::size_t kKinds = 4;
+  static constexpr std::size_t kKinds = 5;
+
+  /// Of a session of another user's client.
+  struct UseOfOthers {
+    std::string_view deed;  // As "stops".
+    ReporterID session{};
+    std::uint32_t maker = 0;  // The user.
+  };
 
   using Counts = std::array<std::uint64_t, kKinds>;
 
@@ -36,6 +46,10 @@ class MisuseLog {
   void note(std::uint32_t user, Kind kind, std::string_view reason,
             Clock::time_point now);
 
+  /// `count` uses by a client of `user`, the first of which was `use`.
+  void noteUses(std::uint32_t user, std::uint64_t count, const UseOfOthers& use,
+                Clock::time_point now);
+
   /// By kind, since the service began.
   Counts counts() const;
 
@@ -43,6 +57,9 @@ class MisuseLog {
   static std::string_view keyOf(Kind kind);
 
  private:
+  /// Whether it is time to log it.
+  bool count(std::uint32_t user, Kind kind, std::uint64_t count, Clock::time_point now);
+
   const std::function<void()> counted_;
 
   mutable std::mutex mutex_;

@@ -81,5 +81,24 @@ TEST(MisuseLog, CountsAllAndTellsOfEach) {
   EXPECT_EQ(told, 6);
 }
 
+TEST(MisuseLog, TellsOfUsesOfOthersSessionsOnceAnIntervalAndCountsThem) {
+  const CapturedLog log;
+  int told = 0;
+  MisuseLog misuse([&told] { ++told; });
+  const auto noteAt = [&](std::chrono::nanoseconds time, std::uint64_t count) {
+    misuse.noteUses(1000, count, {"stops", ReporterID{-7}, 1001}, kNow + time);
+  };
+  noteAt(0ns, 3);
+  noteAt(limits::kMisuseLogInterval - 1ns, 40);
+  EXPECT_THAT(log.lines(LogLevel::kDefault),
+              ElementsAre(HasSubstr("a client of user 1000 uses a session of another "
+                                    "user: it stops -7, which a client of user 1001 "
+                                    "made")));
+  noteAt(limits::kMisuseLogInterval, 1);
+  EXPECT_THAT(log.lines(LogLevel::kDefault), SizeIs(2));
+  EXPECT_EQ(misuse.counts(), (MisuseLog::Counts{0, 0, 0, 0, 44}));
+  EXPECT_EQ(told, 3);
+}
+
 }  // namespace
 }  // namespace ostrel

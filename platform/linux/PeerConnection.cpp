@@ -100,13 +100,16 @@ std::size_t wholeFrames(std::span<const std::uint8_t> bytes, std::size_t mostByt
 
 PeerConnection::PeerConnection(ID id, FileDescriptor socket, PeerIdentity peer,
                                std::shared_ptr<PeerChannel> channel,
-                               const ListenerLimits& limits, MisuseLog& misuse)
+                               const ListenerLimits& limits, MisuseLog& misuse,
+                               SessionOwners& owners)
     : id_(id),
       socket_(std::move(socket)),
       peer_(peer),
       channel_(std::move(channel)),
       limits_(limits),
       misuse_(misuse),
+      owners_(owners),
+      self_{id, peer.user},
       readBytes_(kFirstReadBytes) {}
 
 std::string PeerConnection::description() const {
@@ -257,6 +260,7 @@ std::size_t PeerConnection::announce(std::span<const std::uint8_t> frames) {
   // Of several to one session the first is enough.
   const bool isAnother = std::exchange(lastAnnounced_, id) != id;
   object_->expectMessage(isAnother ? id : kNoReporter);
+  if (isAnother && owners_.areKept()) owners_.fetchAhead(id);
   return size;
 }
 
@@ -265,7 +269,10 @@ std::size_t PeerConnection::announce(std::span<const std::uint8_t> frames) {
 bool PeerConnection::countSession(const wire::Request& request) {
   const ReporterID id = request.reporterID;
   if (request.operation == wire::Operation::kDestroyReportingSession) {
-    if (id != kNoReporter && sessions_.erase(id)) channel_->giveSessions(1);
+    if (id != kNoReporter && sessions_.erase(id)) {
+      channel_->giveSessions(1);
+      owners_.remove(id, self_);
+    }
     return true;
   }
   if (request.operation != wire::Operation::kCreateReportingSession) return true;
@@ -276,7 +283,37 @@ bool PeerConnection::countSession(const wire::Request& request) {
     return false;
   }
   sessions_.insert(id);
+  owners_.enter(id, self_);
   return true;
+}
+
+void PeerConnection::enterSessions() {
+  sessions_.forEach([this](ReporterID id) { owners_.enter(id, self_); });
+}
+
+// Whoever may connect may do that. To set the type of a session and to destroy it is left
+// to the client that made it, and what is for all sessions is for nobody's.
+void PeerConnection::noteUseOfOthers(const wire::Request& request) {
+  switch (request.operation) {
+    case wire::Operation::kSetConfiguration:
+      return noteUseOfOthers(request.reporterID, "configures");
+    case wire::Operation::kStartReportingSessionForID:
+      return noteUseOfOthers(request.reporterID, "starts");
+    case wire::Operation::kStopReportingSessionForID:
+      return noteUseOfOthers(request.reporterID, "stops");
+    case wire::Operation::kSendMessage:
+      if (!request.reporterIDs) return;
+      for (const ReporterID id : *request.reporterIDs) noteUseOfOthers(id, "sends to");
+      return;
+    default:
+      return;
+  }
+}
+
+void PeerConnection::noteUseOfOthers(ReporterID id, std::string_view deed) {
+  const SessionOwners::Owner* const owner = owners_.find(id);
+  if (owner == nullptr || owner == &self_ || owner->user == peer_.user) return;
+  if (usesOfOthers_.count++ == 0) usesOfOthers_.first = {deed, id, owner->user};
 }
 
 void PeerConnection::checkNextFrame(std::span<const std::uint8_t> bytes) {
@@ -338,6 +375,7 @@ std::size_t PeerConnection::carryOut(ValueBuffer& input,
     dispatchRefusedSession(*object_, channel_, request);
     return 0;
   }
+  if (owners_.areKept()) noteUseOfOthers(request);
   const std::size_t used = request.dictionary ? item.size() : 0;
   uncharged_ += cost;
   if (cost > limits_.mostReservedBytes) {
@@ -428,6 +466,9 @@ std::shared_ptr<void> PeerConnection::invalidate() {
                              (ending_ == Ending::kRefused && isResumed_);
   if (isInterrupted && interrupted_) interrupted_();
   if (invalidated_) invalidated_();
+  if (owners_.areKept()) {
+    sessions_.forEach([this](ReporterID id) { owners_.remove(id, self_); });
+  }
   interrupted_ = nullptr;
   invalidated_ = nullptr;
   struct Estate {

@@ -8,6 +8,7 @@
 #include <span>
 #include <string>
 #include <string_view>
+#include <utility>
 
 #include "platform/IPCListener.h"
 #include "platform/Value.h"
@@ -16,6 +17,7 @@
 #include "platform/linux/MisuseLog.h"
 #include "platform/linux/PeerChannel.h"
 #include "platform/linux/ReporterIDSet.h"
+#include "platform/linux/SessionOwners.h"
 #include "platform/linux/wire/Frame.h"
 
 namespace ostrel {
@@ -67,7 +69,7 @@ class PeerConnection final : public IPCConnection {
 
   PeerConnection(ID id, FileDescriptor socket, PeerIdentity peer,
                  std::shared_ptr<PeerChannel> channel, const ListenerLimits& limits,
-                 MisuseLog& misuse);
+                 MisuseLog& misuse, SessionOwners& owners);
 
   ProcessID processIdentifier() const override { return peer_.pid; }
   std::string description() const override;
@@ -111,6 +113,17 @@ class PeerConnection final : public IPCConnection {
 
   /// The client's sessions.
   std::size_t sessions() const { return sessions_.size(); }
+  /// Tells whose they are, once that is kept.
+  void enterSessions();
+
+  /// How often the client used sessions of other users' clients, and the first time of
+  /// these.
+  struct Uses {
+    std::uint64_t count = 0;
+    MisuseLog::UseOfOthers first;
+  };
+  /// Since the last call.
+  Uses takeUsesOfOthers() { return std::exchange(usesOfOthers_, {}); }
 
   Ending ending() const { return ending_; }
   std::string_view endingReason() const { return reason_; }
@@ -133,6 +146,8 @@ class PeerConnection final : public IPCConnection {
   std::size_t costOf(const wire::Request& request, std::size_t bytes) const;
   std::size_t carryOut(ValueBuffer& input, std::span<const std::uint8_t> item);
   bool countSession(const wire::Request& request);
+  void noteUseOfOthers(const wire::Request& request);
+  void noteUseOfOthers(ReporterID id, std::string_view deed);
   void checkNextFrame(std::span<const std::uint8_t> bytes);
   std::size_t unreadBytesToPause() const;
   bool holdBackIfFull();
@@ -144,7 +159,10 @@ class PeerConnection final : public IPCConnection {
   const std::shared_ptr<PeerChannel> channel_;
   const ListenerLimits& limits_;
   MisuseLog& misuse_;
+  SessionOwners& owners_;
+  const SessionOwners::Owner self_;
   ReporterIDSet sessions_;
+  Uses usesOfOthers_;
 
   std::shared_ptr<OstrelReportingServiceProtocol> object_;
   std::function<void()> interrupted_;

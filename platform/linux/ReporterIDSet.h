@@ -17,6 +17,13 @@ class ReporterIDSet {
   bool insert(ReporterID id);
   /// False when it is not there.
   bool erase(ReporterID id);
+  /// Calls `use` with each but 0.
+  template <typename Use>
+  void forEach(const Use& use) const {
+    for (const ReporterID id : slots_) {
+      if (id != ReporterID{0}) use(id);
+    }
+  }
 
  private:
   std::size_t home(ReporterID id) const;

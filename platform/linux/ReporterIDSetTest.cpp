@@ -58,5 +58,18 @@ TEST(ReporterIDSet, DoesAsASetOfTheLibraryDoes) {
   }
 }
 
+TEST(ReporterIDSet, GoesThroughAllButZero) {
+  ReporterIDSet set;
+  set.forEach([](ReporterID) { FAIL() << "it is empty"; });
+  std::set<ReporterID> expected;
+  for (std::int64_t id = -50; id < 50; ++id) {
+    set.insert(ReporterID{id});
+    if (id != 0) expected.insert(ReporterID{id});
+  }
+  std::set<ReporterID> found;
+  set.forEach([&](ReporterID id) { EXPECT_TRUE(found.insert(id).second); });
+  EXPECT_EQ(found, expected);
+}
+
 }  // namespace
 }  // namespace ostrel

@@ -238,6 +238,9 @@ std::uint64_t UnixSocketIPCListener::takeTurn(std::uint64_t id) {
   line_.leave(found->second.place);
   const auto connection = found->second.connection;
   std::uint64_t work = connection->takeTurn(buffer_);
+  if (const auto uses = connection->takeUsesOfOthers(); uses.count != 0) {
+    misuse_->noteUses(connection->peer().user, uses.count, uses.first, now_());
+  }
   if (connection->ending() != PeerConnection::Ending::kNone) {
     work += kWorkOfEnding +
             std::min(connection->sessions(), kManySessions) * kWorkOfSessionsEnd;
@@ -427,6 +430,8 @@ std::uint64_t UnixSocketIPCListener::acceptSome() {
 void UnixSocketIPCListener::accept(FileDescriptor socket) {
   const PeerIdentity peer = identityOf_(socket.get());
   if (!isWithinLimits(peer, socket.get())) return;
+  if (peer.user != firstUser_.value_or(peer.user) && !owners_.areKept()) keepOwners();
+  firstUser_ = firstUser_.value_or(peer.user);
   User& user = users_[peer.user];
   if (!user.account) {
     user.account = std::make_shared<UserAccount>(limits_.ofUser, service_, peer.user);
@@ -440,7 +445,7 @@ void UnixSocketIPCListener::accept(FileDescriptor socket) {
                           limits_.reservedQueuedBytes, limits_.mostReservedBytes},
       process);
   auto connection = std::make_shared<PeerConnection>(
-      id, std::move(socket), peer, std::move(channel), limits_, *misuse_);
+      id, std::move(socket), peer, std::move(channel), limits_, *misuse_, owners_);
   Watched& watched = connections_[id];
   watched.connection = connection;
   watched.process = process;
@@ -454,6 +459,14 @@ void UnixSocketIPCListener::accept(FileDescriptor socket) {
     return;
   }
   watch(*connection);
+}
+
+// From the second user on: a service with one user's clients alone never asks.
+void UnixSocketIPCListener::keepOwners() {
+  std::size_t sessions = 0;
+  for (const auto& [id, each] : connections_) sessions += each.connection->sessions();
+  owners_.keep(sessions);
+  for (const auto& [id, each] : connections_) each.connection->enterSessions();
 }
 
 // What a connection that has gone left under way still counts for its process.

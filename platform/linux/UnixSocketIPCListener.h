@@ -21,6 +21,7 @@
 #include "platform/linux/PeerConnection.h"
 #include "platform/linux/PeerRegistry.h"
 #include "platform/linux/ServiceSocket.h"
+#include "platform/linux/SessionOwners.h"
 #include "platform/linux/TerminationSignals.h"
 #include "platform/linux/UserAccount.h"
 
@@ -90,6 +91,7 @@ class UnixSocketIPCListener final : public IPCListener {
   std::uint64_t acceptSome();
   void accept(FileDescriptor socket);
   bool watchOwnDescriptors();
+  void keepOwners();
   bool isWithinLimits(const PeerIdentity& peer, int socket);
   void handleEvent(std::uint64_t id, std::uint32_t events);
   void handleWork();
@@ -131,6 +133,9 @@ class UnixSocketIPCListener final : public IPCListener {
     bool isListedImpatient = false;  // In `impatient_`.
     FairLine::Place place;
   };
+  // Before the connections, which it names.
+  SessionOwners owners_;
+  std::optional<std::uint32_t> firstUser_;
   std::unordered_map<PeerConnection::ID, Watched> connections_;
   const std::shared_ptr<ServiceAccount> service_;
   std::map<std::uint32_t, User> users_;
