@@ -8,6 +8,7 @@
 #include <memory>
 #include <mutex>
 #include <string>
+#include <thread>
 #include <vector>
 
 #include "platform/linux/UnixSocketIPCListenerTestSupport.h"
@@ -287,11 +288,15 @@ class ListenerOfUsers : public ListenerShares {
   std::unique_ptr<RawClient> clientOf(std::uint32_t user) {
     userOfNext = user;
     auto client = std::make_unique<RawClient>(path);
+    ask(*client);
+    return client;
+  }
+  /// A question, and thus a look at all users.
+  static void ask(RawClient& client) {
     wire::Request question = createRequest(1, 7);
     question.operation = wire::Operation::kReporterIDValid;
-    client->send(question);
-    EXPECT_TRUE(client->receive());
-    return client;
+    client.send(question);
+    EXPECT_TRUE(client.receive());
   }
 
   std::atomic<std::uint32_t> userOfNext{0};
@@ -379,6 +384,124 @@ TEST_F(ListenerOfUsers, TakesNoMoreUserInfosOfWhoHasMany) {
     EXPECT_EQ(entriesAfter(*one, 11, textOf(10)), most < kMost ? 0u : 1u) << most;
     EXPECT_EQ(entriesAfter(*three, 3, textOf(100)), 1u) << "who has little may";
   }
+}
+
+/// Users that come and go.
+class ListenerOfUsersThatLeave : public ListenerOfUsers {
+ protected:
+  ListenerOfUsersThatLeave() {
+    now = [] { return PeerConnection::Clock::time_point(std::chrono::hours(1)); };
+  }
+  ~ListenerOfUsersThatLeave() override { stop(); }
+
+  /// Whether the listener knows so many soon, `staying` among them.
+  bool knowsSoon(std::size_t users) {
+    for (int i = 0; i < 500 && listener->users() != users; ++i) {
+      std::this_thread::sleep_for(std::chrono::milliseconds(10));
+      // What other threads let go is seen at the next look.
+      if (staying) ask(*staying);
+    }
+    return listener->users() == users;
+  }
+
+  std::unique_ptr<RawClient> staying;
+};
+
+TEST_F(ListenerOfUsersThatLeave, AreForgottenWithTheirLastConnection) {
+  constexpr std::uint32_t kUsers = 1000;
+  constexpr std::uint32_t kAtATime = 100;  // As descriptors allow.
+  serve();
+  EXPECT_EQ(listener->users(), 0u);
+  {
+    const auto one = clientOf(1);
+    auto two = clientOf(1);
+    two.reset();
+    ask(*one);
+    EXPECT_EQ(listener->users(), 1u) << "a connection is left";
+  }
+  EXPECT_TRUE(knowsSoon(0)) << "without a further look";
+
+  staying = clientOf(1);
+  for (std::uint32_t user = 2; user < kUsers + 2;) {
+    std::vector<std::unique_ptr<RawClient>> clients;
+    for (std::uint32_t i = 0; i < kAtATime; ++i, ++user) {
+      clients.push_back(clientOf(user));
+      clients.back()->send(createRequest(1, user));
+      EXPECT_TRUE(clients.back()->receive());
+    }
+    EXPECT_EQ(listener->users(), kAtATime + 1);
+    clients.clear();
+    EXPECT_TRUE(knowsSoon(1));
+  }
+}
+
+TEST_F(ListenerOfUsersThatLeave, AreKnownWhileAnythingOfThemIsUnderWay) {
+  ListenerLimits limits;
+  limits.ofUser.queuedBytes = 10 * limits::kRequestBytes;
+  limits.ofUser.reservedQueuedBytes = 0;
+  limits.reservedQueuedBytes = 0;
+  serve(limits);
+  auto client = clientOf(5);
+  service->holdReplies();
+  std::size_t taken = service->calls().size();
+  for (int i = 0; i < 10; ++i) client->send(createRequest(0, 7));
+  ASSERT_TRUE(service->waitForCalls(taken += 10));
+  const std::size_t before = eventsAfter(1).size();
+  client.reset();
+  eventsAfter(before + 2);
+
+  userOfNext = 5;
+  auto again = std::make_unique<RawClient>(path);
+  // The one that goes beyond is still taken.
+  for (int i = 0; i < 2; ++i) again->send(createRequest(0, 7));
+  EXPECT_EQ(callsWhileHeld(taken + 1), taken + 1) << "it has what it left behind";
+  EXPECT_EQ(listener->users(), 1u);
+  service->releaseReplies();
+  EXPECT_TRUE(service->waitForCalls(taken + 2));
+  again.reset();
+  EXPECT_TRUE(knowsSoon(0));
+}
+
+TEST_F(ListenerOfUsersThatLeave, AreStillToldOfOnceAMinute) {
+  const testing_support::CapturedLog log;
+  serve();
+  for (int i = 0; i < 3; ++i) {
+    const auto client = clientOf(5);
+    client->send(std::string(4, '\0'));
+    EXPECT_EQ(client->receiveClosing(), "a frame is empty");
+    EXPECT_TRUE(knowsSoon(0));
+  }
+  EXPECT_EQ(misuse->counts()[static_cast<std::size_t>(MisuseLog::Kind::kCutOff)], 3u);
+  std::size_t told = 0;
+  for (const std::string& line : log.lines(LogLevel::kError)) {
+    if (line.find("is cut off") != std::string::npos) ++told;
+  }
+  EXPECT_EQ(told, 1u);
+}
+
+TEST_F(ListenerOfUsersThatLeave, ComeAndGoWhileOtherThreadsAnswerThem) {
+  serve();
+  staying = clientOf(9);
+  std::atomic<bool> isOver{false};
+  std::thread answering([&] {
+    while (!isOver) {
+      service->holdReplies();
+      std::this_thread::yield();
+      service->releaseReplies();
+    }
+  });
+  for (std::uint32_t i = 0; i < 600; ++i) {
+    userOfNext = i % 3;
+    RawClient client(path);
+    client.send(messageRequest(1, std::string(500, 'x')));
+    if (i % 2 == 0) {
+      EXPECT_TRUE(client.receive());
+    }
+  }
+  isOver = true;
+  answering.join();
+  service->releaseReplies();
+  EXPECT_TRUE(knowsSoon(1));
 }
 
 struct Malformed {

@@ -1,10 +1,15 @@
 #include "platform/linux/MisuseLog.h"
 
+#include <algorithm>
+
 #include "platform/Logging.h"
 #include "platform/linux/Limits.h"
 
 namespace ostrel {
 namespace {
+
+// Those whose time is over are left out where there are so many.
+constexpr std::size_t kFewHeldBack = 64;
 
 struct Wording {
   std::string_view key;  // Of the service's status.
@@ -49,10 +54,19 @@ bool MisuseLog::count(std::uint32_t user, Kind kind, std::uint64_t count,
                       Clock::time_point now) {
   const std::lock_guard lock(mutex_);
   counts_[static_cast<std::size_t>(kind)] += count;
+  if (mayLogAgain_.size() >= mostHeldBack_) {
+    std::erase_if(mayLogAgain_, [now](const auto& each) { return now >= each.second; });
+    mostHeldBack_ = std::max(kFewHeldBack, 2 * mayLogAgain_.size());
+  }
   Clock::time_point& mayLogAgain = mayLogAgain_[{user, kind}];
   if (now < mayLogAgain) return false;
   mayLogAgain = now + limits::kMisuseLogInterval;
   return true;
+}
+
+std::size_t MisuseLog::heldBack() const {
+  const std::lock_guard lock(mutex_);
+  return mayLogAgain_.size();
 }
 
 MisuseLog::Counts MisuseLog::counts() const {

@@ -53,6 +53,9 @@ class MisuseLog {
   /// By kind, since the service began.
   Counts counts() const;
 
+  /// How many kinds of users it holds back from the log, or has not looked at since.
+  std::size_t heldBack() const;
+
   /// How a kind is called in the service's status.
   static std::string_view keyOf(Kind kind);
 
@@ -66,6 +69,7 @@ class MisuseLog {
   // Guarded by `mutex_`.
   Counts counts_{};
   std::map<std::pair<std::uint32_t, Kind>, Clock::time_point> mayLogAgain_;
+  std::size_t mostHeldBack_ = 0;  // Then it is looked through.
 };
 
 }  // namespace ostrel

@@ -100,5 +100,28 @@ TEST(MisuseLog, TellsOfUsesOfOthersSessionsOnceAnIntervalAndCountsThem) {
   EXPECT_EQ(told, 3);
 }
 
+TEST(MisuseLog, ForgetsUsersWhoseTimeIsOver) {
+  constexpr std::uint32_t kUsers = 1000;
+  const CapturedLog log;
+  MisuseLog misuse;
+  for (std::uint32_t user = 0; user < kUsers; ++user) {
+    noteAll(misuse, {{user, Kind::kCutOff, "x"}, {user, Kind::kCutOff, "x"}});
+  }
+  EXPECT_EQ(misuse.heldBack(), kUsers);
+  EXPECT_THAT(log.lines(LogLevel::kError), SizeIs(kUsers)) << "a line for each";
+  // All of them again, and as many others: it looks through them on the way.
+  for (std::uint32_t user = 0; user < 2 * kUsers; ++user) {
+    misuse.note(user, Kind::kCutOff, "x", kNow + limits::kMisuseLogInterval);
+  }
+  EXPECT_THAT(log.lines(LogLevel::kError), SizeIs(3 * kUsers));
+  for (std::uint32_t user = 0; user < 3 * kUsers; ++user) {
+    misuse.note(user % 2, Kind::kSessionRefused, "x",
+                kNow + 2 * limits::kMisuseLogInterval);
+    misuse.note(3 * kUsers + user, Kind::kCutOff, "x",
+                kNow + 2 * limits::kMisuseLogInterval);
+  }
+  EXPECT_EQ(misuse.heldBack(), 3 * kUsers + 2);
+}
+
 }  // namespace
 }  // namespace ostrel

@@ -389,8 +389,7 @@ void UnixSocketIPCListener::end(PeerConnection& connection) {
   found->second.process->changeHalfFrames(found->second.halfFrameBytes, /*now=*/0);
   connections_.erase(found);
   peers_->peerDisconnected(ended->peer().pid, ended->id());
-  const auto user = users_.find(ended->peer().user);
-  if (user != users_.end()) --user->second.connections;
+  noteLeaving(ended->peer().user);
   const bool isLarge = disposal_ != nullptr && ended->sessions() > kManySessions;
   (isLarge ? largeEstates_ : estates_).push_back(ended->invalidate());
 }
@@ -399,9 +398,47 @@ void UnixSocketIPCListener::end(PeerConnection& connection) {
 // else holds their sessions any more.
 void UnixSocketIPCListener::giveUpEstates() {
   estates_.clear();
+  forgetUsers();
   if (largeEstates_.empty()) return;
   disposal_->asyncAfter(std::chrono::nanoseconds(0),
                         [estates = std::exchange(largeEstates_, {})] {});
+}
+
+UnixSocketIPCListener::User& UnixSocketIPCListener::knownUser(std::uint32_t number) {
+  User& user = users_[number];
+  if (!user.account) {
+    user.account = std::make_shared<UserAccount>(limits_.ofUser, service_, number);
+    usersKnown_ = users_.size();
+  }
+  return user;
+}
+
+void UnixSocketIPCListener::noteLeaving(std::uint32_t number) {
+  const auto user = users_.find(number);
+  if (user == users_.end() || --user->second.connections != 0) return;
+  if (!std::exchange(user->second.isListedLeaving, true)) leaving_.push_back(number);
+}
+
+// What a user's clients left under way or kept counts for those that come after them; an
+// account without any of that is like a new one.
+void UnixSocketIPCListener::forgetUsers() {
+  if (leaving_.empty()) return;
+  std::erase_if(leaving_, [this](std::uint32_t number) { return mayForget(number); });
+  usersKnown_ = users_.size();
+}
+
+// Whether it needs no further look: forgotten, or back.
+bool UnixSocketIPCListener::mayForget(std::uint32_t number) {
+  const auto found = users_.find(number);
+  User& user = found->second;
+  if (user.connections != 0) {
+    user.isListedLeaving = false;
+    return true;
+  }
+  // Other threads have references only from those that there are.
+  if (user.account.use_count() != 1 || !user.account->isIdle()) return false;
+  users_.erase(found);
+  return true;
 }
 
 std::uint64_t UnixSocketIPCListener::acceptSome() {
@@ -432,10 +469,7 @@ void UnixSocketIPCListener::accept(FileDescriptor socket) {
   if (!isWithinLimits(peer, socket.get())) return;
   if (peer.user != firstUser_.value_or(peer.user) && !owners_.areKept()) keepOwners();
   firstUser_ = firstUser_.value_or(peer.user);
-  User& user = users_[peer.user];
-  if (!user.account) {
-    user.account = std::make_shared<UserAccount>(limits_.ofUser, service_, peer.user);
-  }
+  User& user = knownUser(peer.user);
   const PeerConnection::ID id = nextID_++;
   peers_->peerConnected(peer.pid, id, processOf(socket.get(), peer.pid));
   const auto process = user.processAccount(peer.pid);

@@ -2,6 +2,7 @@
 
 #include <sys/epoll.h>
 
+#include <atomic>
 #include <cstdint>
 #include <functional>
 #include <map>
@@ -68,11 +69,15 @@ class UnixSocketIPCListener final : public IPCListener {
   /// Lets `resume` return. Any thread.
   void stop() { signals_.raise(); }
 
+  /// Users that have connections, or anything left under way or kept. Any thread.
+  std::size_t users() const { return usersKnown_; }
+
  private:
   using Clock = PeerConnection::Clock;
   struct Watched;
   struct User {
     std::size_t connections = 0;
+    bool isListedLeaving = false;  // In `leaving_`.
     std::shared_ptr<UserAccount> account;
     /// Those of processes that have gone are left out now and then.
     std::unordered_map<ProcessID, std::weak_ptr<ProcessAccount>> processes;
@@ -96,6 +101,10 @@ class UnixSocketIPCListener final : public IPCListener {
   void handleEvent(std::uint64_t id, std::uint32_t events);
   void handleWork();
   void giveUpEstates();
+  User& knownUser(std::uint32_t number);
+  void noteLeaving(std::uint32_t number);
+  void forgetUsers();
+  bool mayForget(std::uint32_t number);
   void noteDeadline(Clock::time_point deadline);
   void handleDeadlines(Clock::time_point now);
   int millisecondsToWait() const;
@@ -139,6 +148,8 @@ class UnixSocketIPCListener final : public IPCListener {
   std::unordered_map<PeerConnection::ID, Watched> connections_;
   const std::shared_ptr<ServiceAccount> service_;
   std::map<std::uint32_t, User> users_;
+  std::atomic<std::size_t> usersKnown_{0};
+  std::vector<std::uint32_t> leaving_;  // Users whose last connection has ended.
   std::vector<PeerConnection::ID> heldBack_;
   std::vector<PeerConnection::ID> impatient_;
   PeerConnection::ID nextID_;

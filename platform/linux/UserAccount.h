@@ -164,6 +164,14 @@ class UserAccount {
   /// it is to be told.
   bool adapt() noexcept { return queued_.limitTo(most(MemoryKind::kQueued)); }
 
+  /// Whether anything of the user's is left: nobody but who asks holds the account, so
+  /// that nothing can be added either.
+  bool isIdle() const {
+    return queued_.used() == 0 && unreadBytes_ == 0 && halfFrameBytes_ == 0 &&
+           busyProcesses_ == 0 && largeRequests_ == 0 && sessions_.used() == 0 &&
+           keptBytes_.used() == 0 && userInfos_.use_count() == 1;
+  }
+
   /// Who bears the user infos of sessions.
   std::shared_ptr<PayloadAccount> accountOfInfos() const { return userInfos_; }
 

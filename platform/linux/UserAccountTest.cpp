@@ -306,5 +306,30 @@ TEST_F(MemoryOfUsers, IsWhatEachMayHaveAgainWhenItIsLess) {
   EXPECT_FALSE(big.queued().isExceeded());
 }
 
+TEST(UserAccount, IsIdleWhileNothingOfTheUserIsLeft) {
+  UserAccount account({1000, 10, 1000}, serviceWith(10, 1000));
+  const auto expectBusyBetween = [&](const auto& begin, const auto& end) {
+    EXPECT_TRUE(account.isIdle());
+    begin();
+    EXPECT_FALSE(account.isIdle());
+    end();
+    EXPECT_TRUE(account.isIdle());
+  };
+  expectBusyBetween([&] { account.queued().take(1); }, [&] { account.queued().give(1); });
+  expectBusyBetween([&] { account.takeSession(); }, [&] { account.giveSessions(1); });
+  expectBusyBetween([&] { account.keep(1); }, [&] { account.discard(1); });
+  expectBusyBetween([&] { account.changeUnread(/*before=*/0, /*now=*/1); },
+                    [&] { account.changeUnread(/*before=*/1, /*now=*/0); });
+  expectBusyBetween([&] { account.changeHalfFrames(/*before=*/0, /*now=*/1); },
+                    [&] { account.changeHalfFrames(/*before=*/1, /*now=*/0); });
+  expectBusyBetween([&] { account.addBusyProcess(); },
+                    [&] { account.removeBusyProcess(); });
+  expectBusyBetween([&] { account.addLargeRequest(); },
+                    [&] { account.removeLargeRequest(); });
+  // Whoever has it may charge it.
+  std::shared_ptr<PayloadAccount> infos;
+  expectBusyBetween([&] { infos = account.accountOfInfos(); }, [&] { infos.reset(); });
+}
+
 }  // namespace
 }  // namespace ostrel
