@@ -19,7 +19,7 @@ class PeerRegistry {
   struct Peer {
     bool wasConnected = false;  // The other two mean something.
     bool isConnected = false;   // Not any more: its id may be another's by now.
-    FileDescriptor descriptor;  // Readable once the process has ended. May be none.
+    FileDescriptor descriptor;  // Readable once the process has ended. None: unknown.
   };
 
   using Key = std::uint64_t;

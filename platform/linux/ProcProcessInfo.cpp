@@ -43,8 +43,8 @@ std::optional<std::string> ProcProcessInfo::commandName(ProcessID pid) const {
   if (pid <= 0) return std::nullopt;
   PeerRegistry::Peer peer = peers_->takePeer(pid);
   if (peer.wasConnected && !peer.isConnected) return std::nullopt;
-  FileDescriptor process = std::move(peer.descriptor);
-  if (!process) process = openProcess(pid);
+  FileDescriptor process =
+      peer.wasConnected ? std::move(peer.descriptor) : openProcess(pid);
   if (!process) return std::nullopt;
   std::optional<std::string> name = readCommandName(pid);
   // A process that still lives had the id all along.

@@ -24,7 +24,8 @@ class ProcProcessInfo final : public ProcessInfo {
   std::string processName() const override;
 
   /// For a client, to be asked once for each of its connections. None for an id
-  /// of 0 or below, for a name that is not UTF-8, and once the client is gone.
+  /// of 0 or below, for a name that is not UTF-8, once the client is gone, and where
+  /// there is no descriptor of its process.
   std::optional<std::string> commandName(ProcessID pid) const override;
 
   /// Never returns.

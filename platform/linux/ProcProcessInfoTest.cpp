@@ -75,6 +75,14 @@ TEST(ProcProcessInfo, DoesNotNameAClientThatHasDisconnected) {
   EXPECT_EQ(ProcProcessInfo(peers).commandName(sleeper.pid()), std::nullopt);
 }
 
+TEST(ProcProcessInfo, DoesNotNameAClientWhoseProcessIsNotKnown) {
+  testing_support::ChildProcess another({"sleep", "60"});
+  const auto peers = std::make_shared<PeerRegistry>();
+  peers->peerConnected(another.pid(), /*connection=*/1, FileDescriptor());
+
+  EXPECT_EQ(ProcProcessInfo(peers).commandName(another.pid()), std::nullopt);
+}
+
 TEST(ProcProcessInfo, PassesOverANameThatIsNotText) {
   TemporaryDirectory proc;
   testing_support::ChildProcess sleeper({"sleep", "60"});

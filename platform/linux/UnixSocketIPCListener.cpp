@@ -7,6 +7,7 @@
 // out.
 #include "platform/linux/UnixSocketIPCListener.h"
 
+#include <poll.h>
 #include <sys/epoll.h>
 #include <sys/socket.h>
 
@@ -69,14 +70,25 @@ PeerIdentity kernelsIdentityOf(int socket) {
   return {credentials.pid, credentials.uid};
 }
 
-// The process that connected, even if its id has become another's since.
+bool hasHungUp(int socket) {
+  pollfd waited{socket, 0, 0};
+  return ::poll(&waited, 1, /*timeout=*/0) != 0;
+}
+
+// The process that connected, even if its id has become another's since; none when that
+// cannot be had.
 FileDescriptor processOf(int socket, ProcessID pid) {
   int descriptor = -1;
   socklen_t size = sizeof descriptor;
   if (::getsockopt(socket, SOL_SOCKET, SO_PEERPIDFD, &descriptor, &size) == 0) {
     return FileDescriptor(descriptor);
   }
-  return pid > 0 ? openProcess(pid) : FileDescriptor();
+  // Its process has gone, or there are no descriptors.
+  if (errno != ENOPROTOOPT || pid <= 0) return {};
+  // Kernels before 6.5 tell the id alone. Whose end is still open had it just now, unless
+  // the client left it to another process and ended.
+  FileDescriptor process = openProcess(pid);
+  return hasHungUp(socket) ? FileDescriptor() : std::move(process);
 }
 
 void sendClosing(int socket, std::string_view reason) {
