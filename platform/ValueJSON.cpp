@@ -8,6 +8,7 @@
 #include <charconv>
 #include <cmath>
 #include <cstring>
+#include <limits>
 #include <memory_resource>
 #include <vector>
 
@@ -39,10 +40,11 @@ Head readHead(const std::uint8_t* at) {
   return head;
 }
 
-// Gathers the text and appends it to the string in pieces.
+// Gathers the text and appends it to the string in pieces, as long as it is not too long.
 class Output {
  public:
-  explicit Output(std::string& out) : out_(out), start_(out.size()) {}
+  Output(std::string& out, std::size_t most)
+      : out_(out), start_(out.size()), left_(most) {}
 
   void character(char c) {
     room(1);
@@ -99,11 +101,17 @@ class Output {
   }
 
   void finish() {
-    out_.append(buffer_.data(), used_);
+    isTooLong_ |= used_ > left_;
+    if (!isTooLong_) {
+      out_.append(buffer_.data(), used_);
+      left_ -= used_;
+    }
     used_ = 0;
   }
 
   void cancel() { out_.resize(start_); }
+
+  bool isTooLong() const { return isTooLong_; }
 
  private:
   static constexpr std::size_t kSize = 1024;
@@ -145,16 +153,18 @@ class Output {
 
   std::string& out_;
   const std::size_t start_;
+  std::size_t left_;
+  bool isTooLong_ = false;
   std::size_t used_ = 0;
   std::array<char, kSize> buffer_;
 };
 
-enum Code { kNotFinite = 1, kKeyIsNotText = 2, kDateOutOfRange = 3 };
+enum Code { kNotFinite = 1, kKeyIsNotText = 2, kDateOutOfRange = 3, kTooLong = 4 };
 
 ErrorObject makeError(Code code) {
-  constexpr const char* kThings[] = {"", "a number that is not finite",
-                                     "a key that is not text",
-                                     "a date outside the years 0000 to 9999"};
+  constexpr const char* kThings[] = {
+      "", "a number that is not finite", "a key that is not text",
+      "a date outside the years 0000 to 9999", "what would be too long a text"};
   return {std::string(kGeneralErrorDomain), code,
           std::string(kThings[code]) + " has no form in JSON"};
 }
@@ -166,8 +176,9 @@ Code codeOf(Date date) {
 
 class Writer {
  public:
-  Writer(std::string& out, JSONLayout layout, JSONStrictness strictness, int indent)
-      : output_(out),
+  Writer(std::string& out, JSONLayout layout, JSONStrictness strictness, int indent,
+         std::size_t mostBytes)
+      : output_(out, mostBytes),
         isPretty_(layout == JSONLayout::kPretty),
         isLenient_(strictness == JSONStrictness::kLenient),
         indent_(indent) {}
@@ -176,7 +187,7 @@ class Writer {
     open_.reserve(kUsualNesting);
     at_ = value.data();
     item();
-    while (!open_.empty() && !error_) {
+    while (!open_.empty() && !error_ && !output_.isTooLong()) {
       Open& top = open_.back();
       if (top.left == 0) {
         close();
@@ -192,11 +203,9 @@ class Writer {
       if (top.isDictionary) key();
       if (!error_) item();  // Ends the life of `top`.
     }
-    if (error_) {
-      output_.cancel();
-    } else {
-      output_.finish();
-    }
+    if (!error_) output_.finish();
+    if (output_.isTooLong()) error_ = makeError(kTooLong);
+    if (error_) output_.cancel();
     return error_;
   }
 
@@ -365,7 +374,14 @@ std::optional<ErrorObject> findJSONError(ValueView value) {
 std::optional<ErrorObject> appendJSON(std::string& out, ValueView value,
                                       JSONLayout layout, JSONStrictness strictness,
                                       int indent) {
-  return Writer(out, layout, strictness, indent).write(value);
+  return appendJSON(out, value, layout, strictness, indent,
+                    std::numeric_limits<std::size_t>::max());
+}
+
+std::optional<ErrorObject> appendJSON(std::string& out, ValueView value,
+                                      JSONLayout layout, JSONStrictness strictness,
+                                      int indent, std::size_t mostBytes) {
+  return Writer(out, layout, strictness, indent, mostBytes).write(value);
 }
 
 }  // namespace ostrel

@@ -1,5 +1,6 @@
 #pragma once
 
+#include <cstddef>
 #include <optional>
 #include <string>
 
@@ -24,6 +25,11 @@ enum class JSONStrictness {
 std::optional<ErrorObject> appendJSON(std::string& out, ValueView value,
                                       JSONLayout layout, JSONStrictness strictness,
                                       int indent);
+/// As above, where more than `mostBytes` are an error: no more than these are put
+/// together.
+std::optional<ErrorObject> appendJSON(std::string& out, ValueView value,
+                                      JSONLayout layout, JSONStrictness strictness,
+                                      int indent, std::size_t mostBytes);
 
 /// The error that `appendJSON` with `kError` would give, found without making the
 /// text. Safe at any nesting.

@@ -49,6 +49,27 @@ TEST(ValueJSON, WritesScalars) {
   EXPECT_EQ(compact(Value(Date{1769860800.25})), "\"2026-01-31T12:00:00.250Z\"");
 }
 
+TEST(ValueJSON, WritesAsManyBytesAsItMayAndElseNone) {
+  const Value value(Dictionary{{"a", 1}, {"b", std::string(3000, '\n')}, {"c", "end"}});
+  const std::string whole = compact(value);
+  for (const std::size_t most : {whole.size() + 1, whole.size()}) {
+    std::string out = "before";
+    EXPECT_EQ(appendJSON(out, value, JSONLayout::kCompact, JSONStrictness::kError,
+                         /*indent=*/0, most),
+              std::nullopt);
+    EXPECT_EQ(out, "before" + whole);
+  }
+  for (const std::size_t most : {whole.size() - 1, std::size_t{2000}, std::size_t{0}}) {
+    std::string out = "before";
+    const auto error = appendJSON(out, value, JSONLayout::kCompact,
+                                  JSONStrictness::kError, /*indent=*/0, most);
+    ASSERT_TRUE(error);
+    EXPECT_EQ(error->description, "what would be too long a text has no form in JSON");
+    EXPECT_EQ(out, "before");
+    EXPECT_LT(out.capacity(), most + 2048);
+  }
+}
+
 TEST(ValueJSON, WritesIntegersExactlyOverBothRanges) {
   EXPECT_EQ(compact(Value(0)), "0");
   EXPECT_EQ(compact(Value(-1)), "-1");

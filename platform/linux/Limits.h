@@ -342,6 +342,14 @@ inline constexpr std::int64_t kDiskPercentKeptFree = 5;
 /// [OwnersOfRows.HaveTheirRowsOnANearlyFullDiskWhereTheStoreIsSmall]
 inline constexpr std::int64_t kStoreBytesInNeed = 16 * 1024 * 1024;
 
+/// Of the texts of one row, which SQLite puts together in memory: what it takes as a row
+/// in any case, less the row's other columns. Only the summary of a session of many
+/// hundred MiB may be more, where its characters take up to six in JSON. A row beyond it
+/// is not stored, which is logged and counted, and those beside it are.
+/// [StoreLongRows.AreStoredUpToTheLimit,
+/// StoreLongRows.BeyondTheLimitAreToldAsLostAndCostNoOther]
+inline constexpr std::size_t kStoreRowBytes = 999'999'000;
+
 /// How old a row may become.
 /// [StoreTest.RemovesRowsThatAreTooOld]
 inline constexpr std::chrono::hours kStoreAge{24 * 30};

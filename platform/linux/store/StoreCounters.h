@@ -14,7 +14,8 @@ struct StoreCounters {
   std::atomic<std::uint64_t> accepted{0};  // Messages and events taken.
   std::atomic<std::uint64_t> written{0};   // Of these, durable.
   std::atomic<std::uint64_t> refused{0};   // Messages answered with an error.
-  std::atomic<std::uint64_t> lost{0};      // Taken, then given up in a long fault.
+  // Taken, then given up: in a long fault, or of rows that are too long.
+  std::atomic<std::uint64_t> lost{0};
   std::atomic<std::uint64_t> droppedAnalytics{0};  // Events.
   std::atomic<std::uint64_t> droppedPower{0};      // Events.
   std::atomic<std::uint64_t> failures{0};          // Of the file, as they were found.

@@ -12,6 +12,13 @@
 
 namespace ostrel {
 
+/// Empties a text that is used again. What a very long one took is given back.
+inline void emptyText(std::string& text) {
+  constexpr std::size_t kKept = 2 * 1024 * 1024;
+  text.clear();
+  if (text.capacity() > kKept) text = std::string();
+}
+
 /// A piece of a batch's text. Not there: NULL.
 struct RowText {
   std::size_t begin = 0;
@@ -52,7 +59,7 @@ struct RowBatch {
   }
   bool empty() const { return messages.empty() && analytics.empty(); }
   void clear() {
-    text.clear();
+    emptyText(text);
     messages.clear();
     analytics.clear();
   }

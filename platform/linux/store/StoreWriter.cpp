@@ -60,6 +60,47 @@ void appendLenientJSON(std::string& out, const Dictionary& value) {
 
 }  // namespace
 
+// The texts of one row, added to others. They are taken away again if together they are
+// longer than a row's may be.
+class StoreWriter::RowTexts {
+ public:
+  RowTexts(std::string& text, std::size_t most)
+      : text_(text), begin_(text.size()), most_(most) {}
+
+  RowText plain(std::string_view piece) {
+    return add([&](std::size_t room) {
+      if (piece.size() > room) return false;
+      text_ += piece;
+      return true;
+    });
+  }
+  RowText json(const Dictionary& value) {
+    return add([&](std::size_t room) {
+      return !appendJSON(text_, value.value(), JSONLayout::kCompact,
+                         JSONStrictness::kLenient, /*indent=*/0, room);
+    });
+  }
+
+  std::string_view of(RowText piece) const {
+    return std::string_view(text_).substr(piece.begin, piece.size);
+  }
+  bool areTooLong() const { return areTooLong_; }
+
+ private:
+  template <typename Append>
+  RowText add(const Append& append) {
+    const std::size_t begin = text_.size();
+    if (!areTooLong_) areTooLong_ = !append(most_ - (begin - begin_));
+    if (areTooLong_) text_.resize(begin_);
+    return {begin, text_.size() - begin, !areTooLong_};
+  }
+
+  std::string& text_;
+  const std::size_t begin_;
+  const std::size_t most_;
+  bool areTooLong_ = false;
+};
+
 StoreWriter::StoreWriter(std::string path, const char* vfs,
                          const StoreRetention& retention, StoreCounters& counters,
                          StatusCounts otherCounts)
@@ -157,25 +198,9 @@ StoreWriter::Result StoreWriter::writePending() {
 StoreWriter::Result StoreWriter::write(StoreOperation& operation) {
   const std::int64_t time = operation.time;
   return std::visit(
-      Overloaded{[&](SessionMessage& message) -> Result {
-                   if (Result failed = insertSession(*message.session)) return failed;
-                   if (operation.user == PayloadAccount::kNobody) {
-                     operation.user = message.session->user;
-                   }
-                   rows_.messages.push_back({message.session->row, RowText(), RowText(),
-                                             message.category, message.type,
-                                             json(message.payload), time,
-                                             userOf(operation, message.payload)});
-                   return std::nullopt;
-                 },
+      Overloaded{[&](SessionMessage& message) { return write(operation, message); },
                  [&](AnalyticsEvent& event) { return write(operation, event); },
-                 [&](LoneMessage& message) -> Result {
-                   rows_.messages.push_back({std::nullopt, json(message.sessionInfo),
-                                             json(message.userInfo), message.category,
-                                             message.type, json(message.payload), time,
-                                             userOf(operation, message.payload)});
-                   return std::nullopt;
-                 },
+                 [&](LoneMessage& message) { return write(operation, message); },
                  [&](PowerEvent& event) { return write(operation, event); },
                  [&](StatusChange&) -> Result { return std::nullopt; },
                  [&](SessionBegin& begin) { return insertSession(*begin.session); },
@@ -188,6 +213,45 @@ StoreWriter::Result StoreWriter::write(StoreOperation& operation) {
                    return database_.setEndedAt(end.session->row, time);
                  }},
       operation.what);
+}
+
+StoreWriter::Result StoreWriter::write(StoreOperation& operation,
+                                       SessionMessage& message) {
+  if (Result failed = insertSession(*message.session)) return failed;
+  if (operation.user == PayloadAccount::kNobody) operation.user = message.session->user;
+  RowTexts texts(rows_.text, retention_.rowBytes);
+  MessageRow row;
+  row.session = message.session->row;
+  row.category = message.category;
+  row.type = message.type;
+  row.payload = texts.json(message.payload);
+  row.createdAt = operation.time;
+  row.user = userOf(operation, message.payload);
+  if (texts.areTooLong()) {
+    lose(operation, counters_.lost);
+  } else {
+    rows_.messages.push_back(row);
+  }
+  return std::nullopt;
+}
+
+StoreWriter::Result StoreWriter::write(StoreOperation& operation,
+                                       const LoneMessage& message) {
+  RowTexts texts(rows_.text, retention_.rowBytes);
+  MessageRow row;
+  row.sessionInfo = texts.json(message.sessionInfo);
+  row.userInfo = texts.json(message.userInfo);
+  row.category = message.category;
+  row.type = message.type;
+  row.payload = texts.json(message.payload);
+  row.createdAt = operation.time;
+  row.user = userOf(operation, message.payload);
+  if (texts.areTooLong()) {
+    lose(operation, counters_.lost);
+  } else {
+    rows_.messages.push_back(row);
+  }
+  return std::nullopt;
 }
 
 StoreWriter::Result StoreWriter::write(StoreOperation& operation, AnalyticsEvent& event) {
@@ -204,31 +268,55 @@ StoreWriter::Result StoreWriter::write(StoreOperation& operation, AnalyticsEvent
     if (event.payload) uncommittedBytes_ += event.payload->value().bytes().size();
   }
   if (!event.payload) return std::nullopt;
+  RowTexts texts(rows_.text, retention_.rowBytes);
   AnalyticsRow row;
-  row.name = {rows_.text.size(), event.name.size(), /*isThere=*/true};
-  rows_.text += event.name;
-  row.payload = json(*event.payload);
+  row.name = texts.plain(event.name);
+  row.payload = texts.json(*event.payload);
   row.createdAt = operation.time;
   row.user = userOf(operation, *event.payload);
-  rows_.analytics.push_back(row);
+  if (texts.areTooLong()) {
+    lose(operation, counters_.droppedAnalytics);
+  } else {
+    rows_.analytics.push_back(row);
+  }
   return std::nullopt;
 }
 
-StoreWriter::Result StoreWriter::write(const StoreOperation& operation,
+StoreWriter::Result StoreWriter::write(StoreOperation& operation,
                                        const PowerEvent& event) {
   text_.clear();
-  appendLenientJSON(text_, event.event);
-  const std::size_t end = text_.size();
-  if (event.attachment) appendLenientJSON(text_, *event.attachment);
-  const std::string_view text(text_);
+  RowTexts texts(text_, retention_.rowBytes);
+  const RowText name = texts.plain(event.name);
+  const RowText content = texts.json(event.event);
+  RowText attachment;
+  if (event.attachment) attachment = texts.json(*event.attachment);
+  if (texts.areTooLong()) {
+    lose(operation, counters_.droppedPower);
+    return std::nullopt;
+  }
   StoreDatabase::PowerRow row;
   row.clientID = event.clientID;
-  row.name = event.name;
-  row.event = text.substr(0, end);
-  if (event.attachment) row.attachment = text.substr(end);
+  row.name = texts.of(name);
+  row.event = texts.of(content);
+  if (event.attachment) row.attachment = texts.of(attachment);
   row.createdAt = operation.time;
   row.user = userOf(operation, event.event);
-  return database_.insertPowerEvent(row);
+  Result failed = database_.insertPowerEvent(row);
+  emptyText(text_);
+  return failed;
+}
+
+// Not tried again: nothing is left of it.
+void StoreWriter::lose(StoreOperation& operation, std::atomic<std::uint64_t>& counter) {
+  OSTREL_LOG_ERROR(processLogScope,
+                   "a row is lost: its texts are longer than the %llu bytes that the "
+                   "store takes of one",
+                   retention_.rowBytes);
+  counter.fetch_add(1, std::memory_order_relaxed);
+  uncommittedBytes_ -= std::min(uncommittedBytes_, operation.payloadBytes());
+  operation.what = StatusChange();
+  emptyText(text_);
+  if (rows_.empty()) rows_.clear();
 }
 
 StoreWriter::Result StoreWriter::insertSession(StoreSession& session) {
@@ -256,12 +344,6 @@ StoreWriter::Result StoreWriter::insertSession(StoreSession& session) {
   session.file = file_;
   uncommittedSessions_.push_back(&session);
   return std::nullopt;
-}
-
-RowText StoreWriter::json(const Dictionary& value) {
-  const std::size_t begin = rows_.text.size();
-  appendLenientJSON(rows_.text, value);
-  return {begin, rows_.text.size() - begin, /*isThere=*/true};
 }
 
 StoreWriter::Result StoreWriter::writeRows(bool evenIfFew) {

@@ -23,6 +23,8 @@ struct StoreRetention {
   /// many bytes.
   std::int64_t percentKeptFree = limits::kDiskPercentKeptFree;
   std::int64_t bytesInNeed = limits::kStoreBytesInNeed;
+  /// Of the texts of one row; beyond it the row is lost.
+  std::size_t rowBytes = limits::kStoreRowBytes;
 };
 
 /// Writes operations to the database and bears its faults. What was handed over
@@ -73,6 +75,8 @@ class StoreWriter {
     std::size_t operation = 0;
   };
 
+  class RowTexts;
+
   // A commit that failed and may have been made all the same.
   struct DoubtfulCommit {
     std::int64_t fingerprint;  // Of the store with it.
@@ -87,8 +91,11 @@ class StoreWriter {
   std::vector<StoreBatch> takeDone(std::size_t batches);
   Result writePending();
   Result write(StoreOperation& operation);
+  Result write(StoreOperation& operation, SessionMessage& message);
+  Result write(StoreOperation& operation, const LoneMessage& message);
   Result write(StoreOperation& operation, AnalyticsEvent& event);
-  Result write(const StoreOperation& operation, const PowerEvent& event);
+  Result write(StoreOperation& operation, const PowerEvent& event);
+  void lose(StoreOperation& operation, std::atomic<std::uint64_t>& counter);
   Result insertSession(StoreSession& session);
   Result writeRows(bool evenIfFew);
   Result writeStatus();
@@ -100,8 +107,6 @@ class StoreWriter {
   void rollback();
   static void completeFlushes(std::vector<StoreBatch>& batches,
                               const std::optional<ErrorObject>& error);
-
-  RowText json(const Dictionary& value);
 
   StoreDatabase database_;
   const StoreRetention retention_;
