@@ -17,6 +17,7 @@
 #include <system_error>
 
 #include "platform/Logging.h"
+#include "platform/linux/Burden.h"
 #include "platform/linux/Places.h"
 #include "platform/linux/Threads.h"
 
@@ -33,6 +34,20 @@ constexpr std::uint32_t kEvents =
 // What comes in this time is looked at together: a flood costs no more than that, however
 // often a file is touched and whatever its name.
 constexpr milliseconds kPauseOfReading{10};
+
+// Counts a post until the last step has run that came of it.
+class PostUnderWay final : public Burden {
+ public:
+  explicit PostUnderWay(std::shared_ptr<std::atomic<int>> count)
+      : Burden(PayloadAccount::kNobody), count_(std::move(count)) {
+    ++*count_;
+  }
+
+ private:
+  ~PostUnderWay() override { --*count_; }
+
+  const std::shared_ptr<std::atomic<int>> count_;
+};
 
 // Whoever replaces the directory is given this long to do it himself.
 constexpr milliseconds kFirstRetry{50};
@@ -182,8 +197,12 @@ void InotifyChangeNotification::handOn() {
   const std::lock_guard lock(mutex_);
   for (Registered& one : registered_) {
     if (!one.isPosted || now < one.quietUntil) continue;
-    one.isPosted = false;
     one.quietUntil = now + kShortestInterval;
+    if (*one.underWay >= kMostUnderWay && now < one.behindUntil) continue;
+    one.behindUntil = now + kIntervalBehind;
+    one.isPosted = false;
+    const BurdenShare underWay(new PostUnderWay(one.underWay));
+    const Burden::Scope bearing(underWay.get());
     one.queue->async([handler = one.handler, token = one.token] { (*handler)(token); });
   }
 }

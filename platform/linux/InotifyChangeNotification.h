@@ -1,6 +1,8 @@
 #pragma once
 
+#include <atomic>
 #include <chrono>
+#include <memory>
 #include <mutex>
 #include <string>
 #include <string_view>
@@ -18,11 +20,15 @@ namespace ostrel {
 /// counts as posted.
 ///
 /// The first post of a name is handed on at once or 10 ms after another's, those that
-/// follow within `kShortestInterval` as one at its end. The thread, which is started by
-/// the first registration, sleeps between posts.
+/// follow within `kShortestInterval` as one at its end. While steps that earlier ones
+/// queued have not run, of `kMostUnderWay` of them, it is one in `kIntervalBehind`: such
+/// steps may be one for each session, and wait for as long as its start takes. The
+/// thread, which is started by the first registration, sleeps between posts.
 class InotifyChangeNotification final : public ChangeNotification {
  public:
   static constexpr std::chrono::milliseconds kShortestInterval{100};
+  static constexpr int kMostUnderWay = 4;
+  static constexpr std::chrono::milliseconds kIntervalBehind{2000};
 
   /// The directory above `directory` need not exist either.
   explicit InotifyChangeNotification(std::string directory);
@@ -45,6 +51,8 @@ class InotifyChangeNotification final : public ChangeNotification {
     std::shared_ptr<WorkQueue> queue;
     std::shared_ptr<const Handler> handler;
     Time quietUntil{};
+    Time behindUntil{};
+    std::shared_ptr<std::atomic<int>> underWay = std::make_shared<std::atomic<int>>(0);
     bool isPosted = false;
   };
 

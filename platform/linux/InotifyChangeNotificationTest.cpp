@@ -8,6 +8,7 @@
 #include <fstream>
 #include <sstream>
 
+#include "platform/linux/Burden.h"
 #include "platform/linux/TestSupport.h"
 
 namespace ostrel {
@@ -106,6 +107,62 @@ TEST_F(InotifyChangeNotificationPosts, ThatComeTogetherArriveAsFew) {
   const auto intervals = (std::chrono::steady_clock::now() - begin) /
                          InotifyChangeNotification::kShortestInterval;
   EXPECT_LE(queue_->count(), 2 + intervals);
+}
+
+/// Runs steps where they are queued, and has none of what came of them run until told.
+class HeldSteps {
+ public:
+  void hold() {
+    const std::lock_guard lock(mutex_);
+    shares_.push_back(BurdenShare::current());
+  }
+  std::size_t count() {
+    const std::lock_guard lock(mutex_);
+    return shares_.size();
+  }
+  bool waitFor(std::size_t count) {
+    return testing_support::eventually([&] { return this->count() >= count; });
+  }
+  void run() {
+    const std::lock_guard lock(mutex_);
+    for (BurdenShare& share : shares_) share = BurdenShare();
+  }
+
+ private:
+  std::mutex mutex_;
+  std::vector<BurdenShare> shares_;
+};
+
+TEST_F(InotifyChangeNotificationPosts, AreFewerWhileWhatCameOfEarlierOnesWaits) {
+  constexpr auto kMost = InotifyChangeNotification::kMostUnderWay;
+  HeldSteps steps;
+  notification_.registerDispatch("com.example.a", queue_, [&](int) { steps.hold(); });
+  std::chrono::steady_clock::time_point last;
+  for (std::size_t i = 1; i <= kMost; ++i) {
+    last = std::chrono::steady_clock::now();
+    write(file());
+    ASSERT_TRUE(steps.waitFor(i));
+  }
+  // It arrives all the same, late.
+  write(file());
+  ASSERT_TRUE(steps.waitFor(kMost + 1));
+  EXPECT_GE(std::chrono::steady_clock::now() - last,
+            InotifyChangeNotification::kIntervalBehind);
+  EXPECT_EQ(steps.count(), static_cast<std::size_t>(kMost) + 1);
+}
+
+TEST_F(InotifyChangeNotificationPosts, AreAsOftenAgainOnceThatHasRun) {
+  constexpr auto kMost = InotifyChangeNotification::kMostUnderWay;
+  HeldSteps steps;
+  notification_.registerDispatch("com.example.a", queue_, [&](int) { steps.hold(); });
+  const auto begin = std::chrono::steady_clock::now();
+  for (std::size_t i = 1; i <= 2 * kMost; ++i) {
+    write(file());
+    ASSERT_TRUE(steps.waitFor(i));
+    steps.run();
+  }
+  EXPECT_LT(std::chrono::steady_clock::now() - begin,
+            kMost * InotifyChangeNotification::kIntervalBehind);
 }
 
 TEST_F(InotifyChangeNotificationPosts, GoOnInADirectoryThatWasRemadeByOthers) {
