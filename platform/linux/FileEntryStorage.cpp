@@ -19,6 +19,7 @@
 
 #include "platform/KeptBytes.h"
 #include "platform/Logging.h"
+#include "platform/linux/ExtentList.h"
 #include "platform/linux/Limits.h"
 #include "platform/linux/Share.h"
 
@@ -30,9 +31,9 @@ namespace {
 constexpr std::size_t kFirstChunk = 1024;
 constexpr std::size_t kLargestChunk = 128 * 1024;
 
-// A list is short as long as to know where its entries are takes no more than a chunk.
+// A list is short as long as what names the places of its entries is no more than a
+// chunk.
 constexpr std::size_t kExtentsOfShortList = kFirstChunk / sizeof(SpillFile::Extent);
-constexpr std::size_t kFirstExtents = 16;
 
 // What readers have in memory, but for an entry that is larger alone.
 constexpr std::size_t kLargestExtent = 2 * kLargestChunk;
@@ -72,30 +73,6 @@ class FileEntryStorage::Memory {
   const std::unique_ptr<std::uint8_t[]> bytes_;
 };
 
-/// A list's part of the file.
-class FileEntryStorage::Spilled {
- public:
-  explicit Spilled(std::shared_ptr<State> state) : state_(std::move(state)) {
-    extents_.reserve(kFirstExtents);
-  }
-  Spilled(const Spilled&) = delete;
-  Spilled& operator=(const Spilled&) = delete;
-  ~Spilled() { state_->file.release(extents_); }
-
-  // The list's.
-  bool write(std::span<const Bytes> parts) {
-    const auto extent = state_->file.write(parts);
-    if (!extent) return false;
-    extents_.push_back(*extent);
-    return true;
-  }
-  const std::vector<SpillFile::Extent>& extents() const { return extents_; }
-
- private:
-  const std::shared_ptr<State> state_;
-  std::vector<SpillFile::Extent> extents_;
-};
-
 class FileEntryStorage::EntriesSnapshot final : public StoredEntries::Snapshot {
  public:
   struct Part {
@@ -104,24 +81,18 @@ class FileEntryStorage::EntriesSnapshot final : public StoredEntries::Snapshot {
   };
 
   EntriesSnapshot(ReporterID session, std::shared_ptr<State> state,
-                  std::shared_ptr<const Spilled> spilled, std::vector<Part> parts)
+                  std::shared_ptr<const ExtentList> spilled, std::vector<Part> parts)
       : session_(session),
         state_(std::move(state)),
         spilled_(std::move(spilled)),
-        extents_(spilled_ ? spilled_->extents() : std::vector<SpillFile::Extent>()),
+        view_(spilled_ ? spilled_->view() : ExtentList::View()),
         parts_(std::move(parts)) {}
 
   bool forEachRun(const StoredEntries::RunCallback& callback) const override {
-    std::size_t room = 0;
-    for (const SpillFile::Extent& extent : extents_) room = std::max(room, extent.size);
-    const std::unique_ptr<std::uint8_t[]> buffer(new std::uint8_t[room]);
-    for (const SpillFile::Extent& extent : extents_) {
-      if (const auto error = state_->file.read(extent, buffer.get())) {
-        OSTREL_LOG_ERROR(processLogScope, "%lli: cannot read the session's list back: %@",
-                         session_, *error);
-        return false;
-      }
-      callback({buffer.get(), extent.size});
+    if (const auto error = view_.forEach(callback)) {
+      OSTREL_LOG_ERROR(processLogScope, "%lli: cannot read the session's list back: %@",
+                       session_, *error);
+      return false;
     }
     for (const Part& part : parts_) callback({part.memory->data(), part.size});
     return true;
@@ -130,8 +101,8 @@ class FileEntryStorage::EntriesSnapshot final : public StoredEntries::Snapshot {
  private:
   const ReporterID session_;
   const std::shared_ptr<State> state_;
-  const std::shared_ptr<const Spilled> spilled_;  // Keeps the extents.
-  const std::vector<SpillFile::Extent> extents_;
+  const std::shared_ptr<const ExtentList> spilled_;  // Keeps what the view shows.
+  const ExtentList::View view_;
   const std::vector<Part> parts_;
 };
 
@@ -209,8 +180,7 @@ class FileEntryStorage::Entries final : public StoredEntries {
   // at once, which is at hand, and not first into a chunk of its own, which is far away
   // among those of a hundred thousand lists.
   bool isShort() const {
-    return chunks_.empty() &&
-           (!spilled_ || spilled_->extents().size() < kExtentsOfShortList);
+    return chunks_.empty() && (!spilled_ || spilled_->size() < kExtentsOfShortList);
   }
 
   bool makeRoom(std::size_t bytes) {
@@ -285,7 +255,8 @@ class FileEntryStorage::Entries final : public StoredEntries {
 
   bool writeToFile(std::span<const Bytes> parts) {
     if (spilled_) return spilled_->write(parts);
-    auto spilled = std::make_shared<Spilled>(state_);
+    auto spilled =
+        std::make_shared<ExtentList>(std::shared_ptr<SpillFile>(state_, &state_->file));
     if (!spilled->write(parts)) return false;
     spilled_ = std::move(spilled);
     return true;
@@ -324,7 +295,7 @@ class FileEntryStorage::Entries final : public StoredEntries {
   const ReporterID session_;
   const std::shared_ptr<State> state_;
   std::vector<Chunk> chunks_;  // What comes after the file.
-  std::shared_ptr<Spilled> spilled_;
+  std::shared_ptr<ExtentList> spilled_;
   bool hasRefused_ = false;
 };
 

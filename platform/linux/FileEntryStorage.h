@@ -45,7 +45,6 @@ class FileEntryStorage final : public EntryStorage {
  private:
   struct State;
   class Memory;
-  class Spilled;
   class Entries;
   class EntriesSnapshot;
 

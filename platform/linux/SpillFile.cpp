@@ -328,16 +328,19 @@ std::optional<ErrorObject> SpillFile::read(Extent extent, std::uint8_t* to) {
   return std::nullopt;
 }
 
+bool SpillFile::releaseIfAll(std::size_t count) {
+  FileDescriptor last;  // Closed without the lock: a large file takes its time.
+  const std::lock_guard lock(mutex_);
+  if (count != extents_) return false;
+  last = dropExtents(count);
+  return true;
+}
+
 void SpillFile::release(std::span<const Extent> extents) {
-  if (extents.empty()) return;
+  if (extents.empty() || releaseIfAll(extents.size())) return;
   Holes holes;
   {
-    FileDescriptor last;  // Closed without the lock: a large file takes its time.
     const std::lock_guard lock(mutex_);
-    if (extents.size() == extents_) {
-      last = dropExtents(extents.size());
-      return;
-    }
     for (const Extent extent : extents) {
       if (const auto group = groupOf(extent)) {
         group->release(extent, holes);
@@ -349,6 +352,8 @@ void SpillFile::release(std::span<const Extent> extents) {
   }
   leave(holes, extents.size());
 }
+
+void SpillFile::forget(std::size_t count) { leave(Holes(), count); }
 
 // The extents, which kept the file open until now, are none any more. Without the lock,
 // as holes take their time too.

@@ -68,6 +68,11 @@ class SpillFile {
 
   /// Gives the extents' room on the disk back.
   void release(std::span<const Extent> extents);
+  /// Releases `count` extents if there are no others, and says so.
+  bool releaseIfAll(std::size_t count);
+  /// Releases as many extents, of which nobody knows any more where they are: their room
+  /// on the disk comes back with the file.
+  void forget(std::size_t count);
 
   /// Why the latest `write` that failed did so.
   std::optional<ErrorObject> latestError() const;
