@@ -4,6 +4,7 @@
 #include <cstddef>
 #include <memory>
 #include <unordered_map>
+#include <utility>
 
 #include "platform/ValueBuffer.h"
 
@@ -26,13 +27,16 @@ class KeptBytes {
   bool keep(const std::shared_ptr<PayloadAccount>& account, std::size_t bytes) {
     if (!account) return true;
     if (account == first_) return add(*account, ofFirst_, bytes);
+    std::shared_ptr<PayloadAccount> keeper = keeperOf(account);
     if (!first_) {
       if (!add(*account, ofFirst_, bytes)) return false;
       first_ = account;
+      keeperOfFirst_ = keeper.get();
       return true;
     }
+    if (keeper.get() == keeperOfFirst_) return add(*account, ofFirst_, bytes);
     if (!others_) others_ = std::make_unique<Sums>();
-    const auto sum = others_->try_emplace(account).first;
+    const auto sum = others_->try_emplace(std::move(keeper)).first;
     if (add(*account, sum->second, bytes)) return true;
     if (sum->second.taken == 0) others_->erase(sum);
     return false;
@@ -41,7 +45,8 @@ class KeptBytes {
   /// Takes back the latest `keep`.
   void undo(const std::shared_ptr<PayloadAccount>& account, std::size_t bytes) {
     if (!account) return;
-    Sum& sum = account == first_ ? ofFirst_ : others_->at(account);
+    const auto keeper = keeperOf(account);
+    Sum& sum = keeper.get() == keeperOfFirst_ ? ofFirst_ : others_->at(keeper);
     sum.used -= bytes;
     sum.taken -= bytes;
     account->discard(bytes);
@@ -85,8 +90,16 @@ class KeptBytes {
     return true;
   }
 
-  // Nearly all lists have entries of one account only.
+  static std::shared_ptr<PayloadAccount> keeperOf(
+      const std::shared_ptr<PayloadAccount>& account) {
+    auto keeper = account->accountOfKept();
+    return keeper ? keeper : account;
+  }
+
+  // Nearly all lists have entries of one account only. Of many of one user none but the
+  // first is held on to.
   std::shared_ptr<PayloadAccount> first_;
+  const PayloadAccount* keeperOfFirst_ = nullptr;
   Sum ofFirst_;
   std::unique_ptr<Sums> others_;
 };

@@ -107,6 +107,44 @@ TEST(KeptBytes, AreTakenBackOneByOne) {
   EXPECT_EQ(second->kept, 0u);
 }
 
+/// One connection of a user.
+class AccountOfUser final : public PayloadAccount {
+ public:
+  explicit AccountOfUser(std::shared_ptr<LimitedAccount> user) : user_(std::move(user)) {}
+  void charge(std::size_t) noexcept override {}
+  void relieve(std::size_t) noexcept override {}
+  bool keep(std::size_t bytes) noexcept override { return user_->keep(bytes); }
+  void discard(std::size_t bytes) noexcept override { user_->discard(bytes); }
+  std::shared_ptr<PayloadAccount> accountOfKept() noexcept override { return user_; }
+
+ private:
+  const std::shared_ptr<LimitedAccount> user_;
+};
+
+TEST(KeptBytes, HoldOnToNoneOfManyAccountsOfAUserButTheFirst) {
+  const auto user = std::make_shared<LimitedAccount>(kPlenty);
+  const auto other = std::make_shared<LimitedAccount>(kPlenty);
+  {
+    KeptBytes kept;
+    std::vector<std::weak_ptr<PayloadAccount>> accounts;
+    for (int i = 0; i < 1000; ++i) {
+      const auto account = std::make_shared<AccountOfUser>(i % 2 == 0 ? user : other);
+      accounts.push_back(account);
+      ASSERT_TRUE(kept.keep(account, kEntry));
+      ASSERT_TRUE(kept.keep(account, kEntry));
+      kept.undo(account, kEntry);
+    }
+    for (const auto& each : {user, other}) {
+      EXPECT_GE(each->kept, 500 * kEntry);
+      EXPECT_LE(each->kept, 500 * kEntry + 500 * kEntry / 64 + 2 * kUnit);
+    }
+    EXPECT_FALSE(accounts[0].expired());
+    for (std::size_t i = 1; i < accounts.size(); ++i) EXPECT_TRUE(accounts[i].expired());
+  }
+  EXPECT_EQ(user->kept, 0u);
+  EXPECT_EQ(other->kept, 0u);
+}
+
 TEST(KeptBytes, HoldOnToNoAccountThatRefusedAll) {
   const auto first = std::make_shared<LimitedAccount>(0);
   const auto second = std::make_shared<LimitedAccount>(kEntry);

@@ -32,6 +32,9 @@ class PayloadAccount {
   virtual bool keep(std::size_t bytes) noexcept = 0;
   /// Gives back what `keep` took. Any thread.
   virtual void discard(std::size_t bytes) noexcept = 0;
+  /// Whose `keep` and `discard` these are in the end, one for all accounts that have it
+  /// in common; none: its own. Any thread.
+  virtual std::shared_ptr<PayloadAccount> accountOfKept() noexcept { return nullptr; }
 
   /// Asks whether an entry of this client's may be merged into a dictionary that goes
   /// on when the message is gone. False: the entry is left out. Any thread, locks held.

@@ -46,6 +46,9 @@ class PeerChannel final : public PayloadAccount {
   void relieve(std::size_t bytes) noexcept override;
   bool keep(std::size_t bytes) noexcept override { return user_->keep(bytes); }
   void discard(std::size_t bytes) noexcept override { user_->discard(bytes); }
+  std::shared_ptr<PayloadAccount> accountOfKept() noexcept override {
+    return UserAccount::accountOfKept(user_);
+  }
   bool mayMerge(const Merged& then) noexcept override;
   std::shared_ptr<PayloadAccount> accountOfMerged() noexcept override {
     return user_->accountOfInfos();

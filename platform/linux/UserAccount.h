@@ -51,6 +51,23 @@ class UserInfos final : public PayloadAccount,
   std::atomic<std::size_t> bytes_{0};
 };
 
+class UserAccount;
+
+/// Bears what sessions' lists keep for a user's clients, which may be gone. Any thread.
+class KeptLists final : public PayloadAccount {
+ public:
+  explicit KeptLists(UserAccount& user) : user_(user) {}
+
+  std::int64_t user() const noexcept override;
+  void charge(std::size_t) noexcept override {}
+  void relieve(std::size_t) noexcept override {}
+  bool keep(std::size_t bytes) noexcept override;
+  void discard(std::size_t bytes) noexcept override;
+
+ private:
+  UserAccount& user_;
+};
+
 /// What one user's clients have under way and keep. Outlives the user's connections
 /// as long as a session's list or a request of theirs is left. Any thread.
 class UserAccount {
@@ -120,6 +137,12 @@ class UserAccount {
   }
   void discard(std::size_t bytes) noexcept {
     giveBoth(keptBytes_, service_->keptBytes, bytes);
+  }
+
+  /// The one that does so for `user` when its connections are gone.
+  static std::shared_ptr<PayloadAccount> accountOfKept(
+      const std::shared_ptr<UserAccount>& user) {
+    return {user, &user->keptLists_};
   }
 
   /// Reply bytes wait for their readers that did not, or the other way round.
@@ -224,12 +247,17 @@ class UserAccount {
   std::atomic<std::size_t> unreadBytes_{0};
   std::atomic<std::size_t> halfFrameBytes_{0};
   const std::shared_ptr<UserInfos> userInfos_;
+  KeptLists keptLists_{*this};
   const std::shared_ptr<ServiceAccount> service_;
   Share sessions_;
   // On a line of the cache of its own: sessions' threads write it, and the thread that
   // reads looks at the others with each message.
   alignas(64) Share keptBytes_;
 };
+
+inline std::int64_t KeptLists::user() const noexcept { return user_.number(); }
+inline bool KeptLists::keep(std::size_t bytes) noexcept { return user_.keep(bytes); }
+inline void KeptLists::discard(std::size_t bytes) noexcept { user_.discard(bytes); }
 
 /// What the connections of one process have in common: many of them have no more of what
 /// is reserved than one. Any thread.
