@@ -16,6 +16,9 @@ constexpr std::size_t kAssumedIDsReplyBytes = 16 * 1024;
 // An empty buffer of this capacity is kept for the next replies.
 constexpr std::size_t kKeptCapacity = 512;
 
+// No more than a fourth of what waits is written already.
+constexpr std::size_t kMostWrittenPart = 4;
+
 }  // namespace
 
 PeerChannel::PeerChannel(LoopWaker::ConnectionID id, std::shared_ptr<LoopWaker> waker,
@@ -137,8 +140,8 @@ bool PeerChannel::flush(int socket) {
     out_.clear();
     written_ = 0;
     if (out_.capacity() > kKeptCapacity) out_.shrink_to_fit();
-  } else if (written_ > out_.size() / 2) {
-    out_.erase(0, written_);
+  } else if (written_ > out_.size() / kMostWrittenPart) {
+    std::string(out_, written_).swap(out_);  // Without the room of what was written.
     written_ = 0;
   }
   updateUnread();

@@ -197,11 +197,36 @@ class FrameWriter : public ValueEncoder {
   void null() { out_.push_back(static_cast<char>(kNullItem)); }
 
   void reporterIDs(const ReporterIDs& ids) {
+    makeRoom(ids);
     beginArray(ids.size());
     for (const ReporterID id : ids) signedInteger(static_cast<std::int64_t>(id));
   }
 
  private:
+  // Many IDs may wait long for their reader, and a text that doubles until they fit is
+  // half empty then. An eighth more, as others may follow.
+  void makeRoom(const ReporterIDs& ids) {
+    if (ids.size() < kManyIDs) return;
+    std::size_t needed = out_.size() + kLargestHead;
+    for (const ReporterID id : ids) needed += headSize(static_cast<std::int64_t>(id));
+    if (needed <= out_.capacity()) return;
+    std::string larger;
+    larger.reserve(needed + needed / 8);
+    larger.append(out_);
+    out_.swap(larger);
+  }
+
+  // What an integer takes.
+  static std::size_t headSize(std::int64_t value) {
+    const auto argument = static_cast<std::uint64_t>(value < 0 ? ~value : value);
+    if (argument < 24) return 1;
+    if (argument <= 0xFF) return 2;
+    if (argument <= 0xFFFF) return 3;
+    return argument <= 0xFFFF'FFFF ? 5 : kLargestHead;
+  }
+  static constexpr std::size_t kLargestHead = 9;
+  static constexpr std::size_t kManyIDs = 64;
+
   std::string& out_;
   const std::size_t begin_;
 };
