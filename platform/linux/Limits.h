@@ -221,9 +221,14 @@ inline constexpr std::size_t kUnreadReplyBytesOfUser = 4 * 1024 * 1024;
 /// ListenerUnreadRepliesAround.WhatAClientHasInNeedAreTakenUpToThat]
 inline constexpr std::size_t kUnreadReplyBytesInNeed = 16 * 1024;
 
-/// How long a client with more than `kUnreadReplyBytesToPause` unread may read nothing at
-/// all before it is cut off.
-/// [UnixSocketListener.CutsOffAClientThatNeverReadsItsReplies]
+/// How long a client with more than `kUnreadReplyBytesToPause` unread, or more than
+/// `kUnreadReplyBytesInNeed` where its user has too much, may read nothing at all before
+/// it is cut off. A reply that is larger alone is sent whatever the others have; of those
+/// that are not taken, once they are twice the user's share, the one that has waited
+/// longest goes at once.
+/// [UnixSocketListener.CutsOffAClientThatNeverReadsItsReplies,
+/// UntakenReplies.AreCutOffBeyondTwiceTheUsersShareTheOldestFirst,
+/// UntakenReplies.EndAClientThatReadsNothingWhileItsUserHasTooMuch]
 inline constexpr std::chrono::seconds kUnreadPatience{3};
 
 // Refusals

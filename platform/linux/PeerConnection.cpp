@@ -440,11 +440,18 @@ void PeerConnection::write(Clock::time_point now) {
 
 void PeerConnection::checkPatience(Clock::time_point now) {
   if (!hasUnread_ || now < patienceEnds()) return;
-  if (channel_->unreadBytes() <= limits_.unreadReplyBytesToPause) {
+  if (channel_->unreadBytes() <=
+      std::min(limits_.unreadReplyBytesToPause, channel_->mostUnreadBytes())) {
     lastRead_ = now;
     return;
   }
   breakOff(Ending::kBrokenRules, "the replies are not read");
+}
+
+std::size_t PeerConnection::untakenBytes() const {
+  if (!hasUnread_) return 0;
+  const std::size_t unread = channel_->unreadBytes();
+  return unread > limits::kUnreadReplyBytesInNeed ? unread : 0;
 }
 
 void PeerConnection::breakOff(Ending ending, std::string_view reason) {

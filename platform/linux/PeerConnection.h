@@ -107,6 +107,11 @@ class PeerConnection final : public IPCConnection {
     return isHeldBack_ || isUnfinished_ ? 0 : pending_.size();
   }
   Clock::time_point pendingSince() const { return pendingSince_; }
+  /// Replies that the client did not take when they were written, where they are many:
+  /// more than it may have when its user's clients leave too much unread.
+  std::size_t untakenBytes() const;
+  /// When it last read a reply.
+  Clock::time_point lastRead() const { return lastRead_; }
   /// When `checkPatience` has something to say; none while the client reads.
   bool isImpatient() const { return hasUnread_; }
   Clock::time_point patienceEnds() const { return lastRead_ + limits_.unreadPatience; }

@@ -332,6 +332,7 @@ void UnixSocketIPCListener::settle(PeerConnection& connection) {
   }
   watch(connection);
   countHalfFrame(connection);
+  countUntaken(connection);
 }
 
 void UnixSocketIPCListener::cutOff(PeerConnection& connection) {
@@ -375,6 +376,36 @@ bool UnixSocketIPCListener::goesBefore(const Watched& one, const Watched& other)
   return one.connection->pendingSince() < other.connection->pendingSince();
 }
 
+// A reply may be large, and each connection has one at least. Where those that their
+// clients did not take are too many, who has read nothing for longest goes: whoever reads
+// is never taken for one who does not.
+void UnixSocketIPCListener::countUntaken(PeerConnection& connection) {
+  const auto found = connections_.find(connection.id());
+  if (found == connections_.end()) return;
+  const std::size_t now = connection.untakenBytes();
+  const std::size_t before = std::exchange(found->second.untakenBytes, now);
+  if (now == before) return;
+  const std::uint32_t id = connection.peer().user;
+  User& user = users_.at(id);
+  user.untakenBytes += now - before;
+  while (!user.account->mayLeaveUntaken(user.untakenBytes) && cutOffLongestUntaken(id)) {
+  }
+}
+
+bool UnixSocketIPCListener::cutOffLongestUntaken(std::uint32_t user) {
+  std::shared_ptr<PeerConnection> first;
+  for (const auto& [id, each] : connections_) {
+    if (each.untakenBytes == 0 || each.connection->peer().user != user) continue;
+    if (!first || each.connection->lastRead() < first->lastRead()) {
+      first = each.connection;
+    }
+  }
+  if (!first) return false;
+  first->breakOff(PeerConnection::Ending::kBrokenRules, "too many replies are unread");
+  cutOff(*first);
+  return true;
+}
+
 void UnixSocketIPCListener::watch(PeerConnection& connection) {
   Watched& watched = connections_.at(connection.id());
   epoll_event event{};
@@ -399,8 +430,10 @@ void UnixSocketIPCListener::end(PeerConnection& connection) {
   if (found == connections_.end()) return;
   const std::shared_ptr<PeerConnection> ended = std::move(found->second.connection);
   found->second.process->changeHalfFrames(found->second.halfFrameBytes, /*now=*/0);
+  const std::size_t untaken = found->second.untakenBytes;
   connections_.erase(found);
   peers_->peerDisconnected(ended->peer().pid, ended->id());
+  users_.at(ended->peer().user).untakenBytes -= untaken;
   noteLeaving(ended->peer().user);
   const bool isLarge = disposal_ != nullptr && ended->sessions() > kManySessions;
   (isLarge ? largeEstates_ : estates_).push_back(ended->invalidate());

@@ -78,6 +78,7 @@ class UnixSocketIPCListener final : public IPCListener {
   struct User {
     std::size_t connections = 0;
     bool isListedLeaving = false;  // In `leaving_`.
+    std::size_t untakenBytes = 0;  // Of all its connections.
     std::shared_ptr<UserAccount> account;
     /// Those of processes that have gone are left out now and then.
     std::unordered_map<ProcessID, std::weak_ptr<ProcessAccount>> processes;
@@ -117,6 +118,8 @@ class UnixSocketIPCListener final : public IPCListener {
   void countHalfFrame(PeerConnection& connection);
   bool cutOffOldestHalf(std::uint32_t user);
   bool cutOffHalfOfWhoHasMost();
+  void countUntaken(PeerConnection& connection);
+  bool cutOffLongestUntaken(std::uint32_t user);
   /// Which of two half frames is given up first.
   static bool goesBefore(const Watched& one, const Watched& other);
 
@@ -137,6 +140,7 @@ class UnixSocketIPCListener final : public IPCListener {
     std::shared_ptr<PeerConnection> connection;
     std::shared_ptr<ProcessAccount> process;
     std::size_t halfFrameBytes = 0;  // As its user's count has it.
+    std::size_t untakenBytes = 0;    // Likewise.
     std::uint32_t events = 0;        // As epoll knows them; 0: not in it.
     bool isListedHeldBack = false;   // In `heldBack_`.
     bool isListedImpatient = false;  // In `impatient_`.

@@ -1,6 +1,8 @@
 // How many replies a client may leave unread while the others of its user do so too.
 #include <gtest/gtest.h>
+#include <sys/socket.h>
 
+#include <atomic>
 #include <chrono>
 #include <deque>
 #include <map>
@@ -261,6 +263,89 @@ TEST_P(ListenerUnreadRepliesAround, WhatAClientHasInNeedAreTakenUpToThat) {
 }
 
 INSTANTIATE_TEST_SUITE_P(Each, ListenerUnreadRepliesAround, testing::Values(-1, 0, 1));
+
+/// Clients that ask for all sessions, which is more than a socket holds, and do not read.
+class UntakenReplies : public testing_support::UnixSocketListener {
+ protected:
+  static constexpr std::size_t kSessions = 1'000'000;
+  static constexpr std::size_t kReply = 9 * kSessions;
+
+  UntakenReplies() {
+    service->setReporters(ReporterIDs(kSessions, ReporterID{INT64_MAX}));
+    now = [this] { return PeerConnection::Clock::time_point(time_.load()); };
+  }
+  ~UntakenReplies() override { stop(); }
+
+  void serveWithShareOf(std::size_t bytes) {
+    ListenerLimits limits;
+    limits.ofUser.unreadBytes = bytes;
+    limits.unreadReplyBytes = limits.unreadReplyBytesToPause = 2 * kReply;
+    // It is not to be crowded, nor are all users together.
+    limits.ofUser.memory = 100 * kReply;
+    limits.ofAll.fill(100 * kReply);
+    serve(limits);
+  }
+  std::unique_ptr<RawClient> ask() {
+    auto client = std::make_unique<RawClient>(path);
+    client->send(testing_support::reportersRequest(1));
+    // It has the beginning.
+    char byte;
+    EXPECT_EQ(::recv(client->socket(), &byte, 1, MSG_PEEK), 1);
+    letLookAgain();
+    return client;
+  }
+  /// At the time, and at what is unread.
+  void letLookAgain() {
+    for (int i = 0; i < 2; ++i) {
+      RawClient other(path);
+      other.send(testing_support::createRequest(1, 7));
+      EXPECT_TRUE(other.receive());
+    }
+  }
+  void letTimePass(std::chrono::nanoseconds time) {
+    time_ = time_.load() + time;
+    letLookAgain();
+  }
+  std::size_t cutOff() const {
+    return misuse->counts()[static_cast<std::size_t>(MisuseLog::Kind::kCutOff)];
+  }
+
+ private:
+  std::atomic<std::chrono::nanoseconds> time_{std::chrono::hours(1)};
+};
+
+TEST_F(UntakenReplies, AreCutOffBeyondTwiceTheUsersShareTheOldestFirst) {
+  serveWithShareOf(5 * kReply / 4);
+  const auto first = ask();
+  letTimePass(std::chrono::milliseconds(1));
+  const auto second = ask();
+  EXPECT_EQ(cutOff(), 0u);
+  letTimePass(std::chrono::milliseconds(1));
+  const auto third = ask();
+
+  EXPECT_EQ(cutOff(), 1u);
+  EXPECT_FALSE(first->receive());
+  EXPECT_TRUE(second->receive());
+  EXPECT_TRUE(third->receive());
+}
+
+TEST_F(UntakenReplies, EndAClientThatReadsNothingWhileItsUserHasTooMuch) {
+  serveWithShareOf(kReply / 2);
+  const auto client = ask();
+  letTimePass(limits::kUnreadPatience - std::chrono::nanoseconds(1));
+  EXPECT_EQ(cutOff(), 0u);
+  letTimePass(std::chrono::nanoseconds(1));
+  EXPECT_EQ(cutOff(), 1u);
+  EXPECT_FALSE(client->receive());
+}
+
+TEST_F(UntakenReplies, MayWaitWhereTheirUserHasNoMoreThanItsShare) {
+  serveWithShareOf(2 * kReply);
+  const auto client = ask();
+  letTimePass(limits::kUnreadPatience + std::chrono::nanoseconds(1));
+  EXPECT_EQ(cutOff(), 0u);
+  EXPECT_TRUE(client->receive());
+}
 
 }  // namespace
 }  // namespace ostrel

@@ -154,6 +154,11 @@ class UserAccount {
     return unread != 0 && unread > most(MemoryKind::kUnread);
   }
 
+  /// Whether its clients may leave so much unread though they have more than their share.
+  bool mayLeaveUntaken(std::size_t bytes) const {
+    return bytes - bytes / 2 <= most(MemoryKind::kUnread);
+  }
+
   /// Bytes of frames that are not whole, likewise.
   void changeHalfFrames(std::size_t before, std::size_t now) noexcept {
     halfFrameBytes_ += now - before;

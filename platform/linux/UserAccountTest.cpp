@@ -144,6 +144,16 @@ TEST(UserAccount, KeepsBytesUpToTheUsersShareAndTheServices) {
   EXPECT_TRUE(two.keep(500));
 }
 
+TEST(UserAccount, MayLeaveTwiceItsShareUntaken) {
+  UserAccount::Limits limits{/*queuedBytes=*/100, /*sessions=*/10, /*keptBytes=*/1000};
+  limits.unreadBytes = 500;
+  const UserAccount user(limits, serviceWith(/*sessions=*/10, /*keptBytes=*/1000));
+  EXPECT_TRUE(user.mayLeaveUntaken(0));
+  EXPECT_TRUE(user.mayLeaveUntaken(999));
+  EXPECT_TRUE(user.mayLeaveUntaken(1000));
+  EXPECT_FALSE(user.mayLeaveUntaken(1001));
+}
+
 TEST(UserAccount, HasItsPartOfTheServicesShareWhateverTheOthersHave) {
   constexpr std::size_t kPart = 3;
   constexpr std::size_t kAll = kPart * limits::kUsersInReserve;

@@ -11,6 +11,7 @@
 #include <map>
 
 #include "platform/linux/TestSockets.h"
+#include "platform/linux/wire/Frame.h"
 #include "tests/hostile/ProcessUsage.h"
 #include "tests/integration/ServiceUnderTest.h"
 
@@ -113,6 +114,52 @@ TEST_F(PressedService, SendsLargeMessagesToAllSessionsInTheirOrder) {
   if (hostile::kMemoryIsBounded) {
     EXPECT_LT(peak, hostile::kMostResidentKiB);
   }
+}
+
+// A list of so many sessions is more than half of what a socket holds.
+TEST_F(PressedService, HasLittleInMemoryForManyClientsThatDoNotReadLargeReplies) {
+  constexpr std::int64_t kSessions = 16'384;
+  constexpr std::int64_t kFirstID = std::int64_t{1} << 40;
+  constexpr std::size_t kClients = 700;
+  constexpr std::size_t kQuestions = 3;
+  service.start();
+  RecordingClient owner(service.socketPath());
+  for (std::int64_t i = 0; i < kSessions; ++i) {
+    owner->createReportingSession(ReporterID{kFirstID + i}, /*reply=*/nullptr);
+  }
+  owner->createReportingSession(ReporterID{1}, owner.boolean("create"));
+  ASSERT_EQ(owner.wait(1), RecordingClient::Replies{"create true"});
+
+  std::string questions;
+  for (std::size_t number = 1; number <= kQuestions; ++number) {
+    wire::Request question;
+    question.operation = wire::Operation::kGetAllReporters;
+    question.number = number;
+    wire::appendRequest(questions, question);
+  }
+  std::vector<FileDescriptor> clients;
+  for (std::size_t i = 0; i < kClients; ++i) {
+    clients.push_back(testing_support::connectedSocket(service.socketPath()));
+    ASSERT_TRUE(clients.back());
+    ASSERT_EQ(::send(clients.back().get(), questions.data(), questions.size(), 0),
+              static_cast<ssize_t>(questions.size()));
+  }
+  // Each has been served, or cut off, once nothing of it is in memory but what is unread.
+  for (const FileDescriptor& client : clients) {
+    char byte = 0;
+    EXPECT_EQ(::recv(client.get(), &byte, 1, MSG_PEEK), 1);
+  }
+  ASSERT_TRUE(serves());
+  const std::size_t peak = usageOf(service.process().pid()).peakResidentKiB;
+  std::cout << "peak of resident memory " << peak / 1024 << " MiB\n";
+  if (hostile::kMemoryIsBounded) {
+    EXPECT_LT(peak, hostile::kMostResidentKiB / 2);
+  }
+
+  // Who reads has all of it.
+  owner->getAllReporters(owner.reporterIDs("all"));
+  const std::string all = owner.wait(2).back();
+  EXPECT_GE(std::ranges::count(all, ' '), kSessions + 1);
 }
 
 TEST_F(PressedService, HardlyRunsWhileItHasNoDescriptorAndServesOnceItHas) {
