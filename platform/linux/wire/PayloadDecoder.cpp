@@ -10,9 +10,9 @@
 //
 // Repeated keys. A small dictionary keeps a mask of 64 bits, one set by the hash
 // of each key; only a key that meets a set bit is compared with the earlier
-// ones, first by hash, then byte by byte. A large one notes hash and place of
-// each key and sorts them when it ends. That hash begins with a number that the
-// sender cannot know, so that it cannot make the keys collide.
+// ones, first by hash, then byte by byte. A large one has a table of its keys, with a
+// hash that the sender cannot know, so that it cannot make the keys meet there; once one
+// is repeated nobody looks for more. What is replaced is found by such a table too.
 #include "platform/linux/wire/PayloadDecoder.h"
 
 #include <algorithm>
@@ -21,6 +21,7 @@
 #include <string>
 #include <vector>
 
+#include "platform/SpreadHash.h"
 #include "platform/linux/wire/Head.h"
 
 namespace ostrel::wire {
@@ -162,22 +163,6 @@ constexpr auto kPlainSizes = [] {
   }
 }
 
-// A number that differs from process to process.
-std::uint64_t hashSeed() {
-  static const std::uint64_t seed = [] {
-    const auto place = reinterpret_cast<std::uintptr_t>(&kSmallDictionary);
-    const int onStack = 0;
-    const auto stack = reinterpret_cast<std::uintptr_t>(&onStack);
-    return (place * 0xD6E8FEB86659FD93) ^ (stack * 0xA0761D6478BD642F);
-  }();
-  return seed;
-}
-
-std::uint64_t fold(std::uint64_t a, std::uint64_t b) {
-  a *= b | 1;
-  return a ^ std::rotl(a, 32) ^ (b >> 7);
-}
-
 // Reads a key that was checked, and moves `at` behind it.
 struct Key {
   std::uint8_t majorType;
@@ -195,32 +180,45 @@ Key readKey(const Byte*& at, const Byte* end) {
 
 Key keyAt(const Byte* at, const Byte* end) { return readKey(at, end); }
 
-// Any order in which equal keys, and no others, are equal.
-int compare(const Key& a, const Key& b) {
-  if (a.majorType != b.majorType) return a.majorType < b.majorType ? -1 : 1;
-  if (a.argument != b.argument) return a.argument < b.argument ? -1 : 1;
-  if (a.majorType != kTextString) return 0;
-  return std::memcmp(a.text, b.text, a.argument);
+bool areEqual(const Key& a, const Key& b) {
+  return a.majorType == b.majorType && a.argument == b.argument &&
+         (a.majorType != kTextString || std::memcmp(a.text, b.text, a.argument) == 0);
 }
 
-std::uint32_t seededHash(const Key& key) {
-  std::uint64_t hash = fold(hashSeed() + key.majorType, key.argument);
-  if (key.majorType == kTextString) {
-    std::size_t i = 0;
-    for (; i + sizeof hash <= key.argument; i += sizeof hash) {
-      hash = fold(hash ^ loadWord(key.text + i), hashSeed() + i);
-    }
-    std::uint64_t rest = 0;
-    for (; i < key.argument; ++i) rest = rest << 8 | key.text[i];
-    hash = fold(hash ^ rest, hashSeed());
-  }
+std::uint32_t spreadHash(const Key& key) {
+  const std::uint64_t hash =
+      key.majorType == kTextString
+          ? SpreadHash()({reinterpret_cast<const char*>(key.text), key.argument})
+          : SpreadHash()(key.argument) + key.majorType;
   return static_cast<std::uint32_t>(hash >> 32);
 }
 
-// A key of a large dictionary.
-struct KeyNote {
-  std::uint32_t hash;
-  std::uint32_t offset;
+/// Finds keys by their hash: half empty, the next slot where one is taken.
+class KeyTable {
+ public:
+  /// For `keys` keys.
+  explicit KeyTable(std::size_t keys) : slots_(std::bit_ceil(2 * keys)) {}
+
+  /// What is noted of the key with this hash that `isEqual` says is the same; none, and
+  /// room for it, when it is new. What is noted is never 0.
+  template <typename IsEqual>
+  std::uint32_t& find(std::uint32_t hash, const IsEqual& isEqual) {
+    const std::size_t mask = slots_.size() - 1;
+    for (std::size_t i = hash & mask;; i = (i + 1) & mask) {
+      Slot& slot = slots_[i];
+      if (slot.noted == 0) slot.hash = hash;
+      if (slot.noted == 0 || (slot.hash == hash && isEqual(slot.noted))) {
+        return slot.noted;
+      }
+    }
+  }
+
+ private:
+  struct Slot {
+    std::uint32_t hash = 0;
+    std::uint32_t noted = 0;
+  };
+  std::vector<Slot> slots_;
 };
 
 class ItemCheck {
@@ -241,10 +239,9 @@ class ItemCheck {
     bool isMap;
     bool isLarge;
     struct Keys {
-      std::size_t count;    // In the two tables below.
-      std::uint64_t bits;   // Of their hashes.
-    } keys;                 // Of a small dictionary.
-    std::size_t firstNote;  // Of a large dictionary, in `notes_`.
+      std::size_t count;   // In the two tables below.
+      std::uint64_t bits;  // Of their hashes.
+    } keys;  // Of a small dictionary; a large one has the last of `tables_` that is open.
     std::uint32_t hashes[kSmallDictionary];
     std::uint32_t offsets[kSmallDictionary];
   };
@@ -254,7 +251,6 @@ class ItemCheck {
   const char* checkKey(const Byte*& at, Level& level);
   const char* open(const Byte*& at, const Head& head, std::size_t& depth);
   const char* checkDate(const Byte*& at) const;
-  void close(Level& level);
 
   std::size_t bytesFrom(const Byte* at) const {
     return static_cast<std::size_t>(readableEnd_ - at);
@@ -273,7 +269,7 @@ class ItemCheck {
   const std::size_t nesting_;
   std::size_t nodesLeft_;
   bool hasRepeatedKeys_ = false;
-  std::vector<KeyNote> notes_;  // Of the large dictionaries that are open.
+  std::vector<KeyTable> tables_;  // Of the large dictionaries that are open.
   Level levels_[kDeepestNesting];
 };
 
@@ -350,7 +346,7 @@ class ItemCheck {
     for (std::size_t i = 0; i < keys.count; ++i) {
       if (level.hashes[i] != hash) continue;
       const Byte* const other = begin_ + level.offsets[i];
-      if (compare(keyAt(other, end_), keyAt(key, end_)) == 0) hasRepeatedKeys_ = true;
+      if (areEqual(keyAt(other, end_), keyAt(key, end_))) hasRepeatedKeys_ = true;
     }
   }
   keys.bits |= bit;
@@ -360,8 +356,13 @@ class ItemCheck {
 }
 
 [[gnu::noinline]] void ItemCheck::noteLargeKey(const Byte* key) {
-  notes_.push_back(
-      {seededHash(keyAt(key, end_)), static_cast<std::uint32_t>(key - begin_)});
+  if (hasRepeatedKeys_) return;
+  const Key read = keyAt(key, end_);
+  std::uint32_t& offset = tables_.back().find(spreadHash(read), [&](std::uint32_t other) {
+    return areEqual(keyAt(begin_ + other, end_), read);
+  });
+  hasRepeatedKeys_ = offset != 0;
+  offset = static_cast<std::uint32_t>(key - begin_);
 }
 
 const char* ItemCheck::open(const Byte*& at, const Head& head, std::size_t& depth) {
@@ -379,7 +380,7 @@ const char* ItemCheck::open(const Byte*& at, const Head& head, std::size_t& dept
   level.isMap = isMap;
   level.isLarge = isMap && level.left > kSmallDictionary;
   level.keys = {};
-  level.firstNote = notes_.size();
+  if (level.isLarge) tables_.emplace_back(hasRepeatedKeys_ ? 0 : level.left);
   return nullptr;
 }
 
@@ -405,23 +406,6 @@ const char* ItemCheck::open(const Byte*& at, const Head& head, std::size_t& dept
     default:
       return kWrongDate.data();
   }
-}
-
-[[gnu::noinline]] void ItemCheck::close(Level& level) {
-  const auto first = notes_.begin() + static_cast<std::ptrdiff_t>(level.firstNote);
-  const auto less = [this](const KeyNote& a, const KeyNote& b) {
-    if (a.hash != b.hash) return a.hash < b.hash;
-    return compare(keyAt(begin_ + a.offset, end_), keyAt(begin_ + b.offset, end_)) < 0;
-  };
-  const auto equal = [this](const KeyNote& a, const KeyNote& b) {
-    return a.hash == b.hash &&
-           compare(keyAt(begin_ + a.offset, end_), keyAt(begin_ + b.offset, end_)) == 0;
-  };
-  if (!hasRepeatedKeys_) {
-    std::sort(first, notes_.end(), less);
-    hasRepeatedKeys_ = std::adjacent_find(first, notes_.end(), equal) != notes_.end();
-  }
-  notes_.erase(first, notes_.end());
 }
 
 [[gnu::always_inline]] inline void ItemCheck::passPlainItems(const Byte*& at,
@@ -472,7 +456,7 @@ DecodeError ItemCheck::run(std::size_t& size, bool& hasRepeatedKeys) {
     Level& level = levels_[depth - 1];
     passPlainItems(at, level);
     if (level.left == 0) {
-      if (level.isLarge) close(level);
+      if (level.isLarge) tables_.pop_back();
       --depth;
       continue;
     }
@@ -510,11 +494,13 @@ class RepeatedKeyRemover {
   };
   struct Entry {
     std::uint32_t map;  // In `maps_`.
-    std::uint32_t hash;
     std::uint32_t begin;
     std::uint32_t end = 0;
     bool isReplaced = false;
   };
+  // So that one key of many dictionaries is at as many places of the table.
+  static constexpr std::uint32_t kOddFactor = 0x9E3779B9;
+
   struct Level {
     std::size_t left;
     bool isMap;
@@ -534,8 +520,8 @@ class RepeatedKeyRemover {
       if (!open.empty() && open.back().isMap) {
         Level& level = open.back();
         level.entry = entries_.size();
-        const std::uint32_t begin = offset(at);
-        entries_.push_back({level.map, seededHash(readKey(at, end_)), begin});
+        entries_.push_back({level.map, offset(at)});
+        readKey(at, end_);
       }
       passValue(at, open);
       while (!open.empty() && open.back().left == 0) {
@@ -570,26 +556,26 @@ class RepeatedKeyRemover {
   }
 
   void markReplaced() {
-    std::vector<std::uint32_t> order(entries_.size());
-    for (std::uint32_t i = 0; i < order.size(); ++i) order[i] = i;
-    const auto difference = [this](std::uint32_t a, std::uint32_t b) {
-      const Entry& x = entries_[a];
-      const Entry& y = entries_[b];
-      if (x.map != y.map) return x.map < y.map ? -1 : 1;
-      if (x.hash != y.hash) return x.hash < y.hash ? -1 : 1;
-      return compare(keyAt(begin_ + x.begin, end_), keyAt(begin_ + y.begin, end_));
-    };
-    std::sort(order.begin(), order.end(), [&](std::uint32_t a, std::uint32_t b) {
-      const int sign = difference(a, b);
-      return sign != 0 ? sign < 0 : a < b;
-    });
-    for (std::size_t i = 1; i < order.size(); ++i) {
-      if (difference(order[i - 1], order[i]) != 0) continue;
-      Entry& earlier = entries_[order[i - 1]];
-      earlier.isReplaced = true;
-      --maps_[earlier.map].entries;
-      maps_[earlier.map].isChanged = true;
+    KeyTable latest(entries_.size());
+    for (std::uint32_t i = 0; i < entries_.size(); ++i) {
+      const Entry& entry = entries_[i];
+      const Key key = keyAt(begin_ + entry.begin, end_);
+      // Counted from 1.
+      std::uint32_t& number =
+          latest.find(spreadHash(key) + entry.map * kOddFactor, [&](std::uint32_t other) {
+            const Entry& earlier = entries_[other - 1];
+            return earlier.map == entry.map &&
+                   areEqual(keyAt(begin_ + earlier.begin, end_), key);
+          });
+      if (number != 0) replace(entries_[number - 1]);
+      number = i + 1;
     }
+  }
+
+  void replace(Entry& entry) {
+    entry.isReplaced = true;
+    --maps_[entry.map].entries;
+    maps_[entry.map].isChanged = true;
   }
 
   // Entries and maps both stand in the order of their first bytes.
