@@ -31,7 +31,7 @@ class FairLineTest : public testing::Test {
     line.use(places[*next], work);
     return next;
   }
-  void makeBusy(std::size_t client) { line.introduce(places[client]); }
+  void makeBusy(std::size_t client) { line.introduce(places[client], group); }
   /// Clients 1 and 2.
   void lineUpBusyOnes() {
     for (const std::size_t client : {1u, 2u}) {
@@ -41,6 +41,7 @@ class FairLineTest : public testing::Test {
   }
 
   FairLine line;
+  const std::shared_ptr<FairLine::Group> group = std::make_shared<FairLine::Group>();
   std::array<FairLine::Place, kClients> places;
 };
 
@@ -61,7 +62,7 @@ TEST_F(FairLineOrder, TellsLittleFromMuchByWhatWasSaved) {
     FairLine::Place busy;
     fresh.use(asking, work - 100);
     fresh.use(asking, 100);
-    fresh.introduce(busy);
+    fresh.introduce(busy, group);
     fresh.enter(1, busy);
     fresh.enter(2, asking);
     EXPECT_EQ(fresh.take(), work <= FairLine::kSavedWork ? 2u : 1u) << work;
@@ -123,6 +124,65 @@ TEST_F(FairLineOrder, TellsWhoAsksForLittleByItsLastTurnToo) {
     EXPECT_EQ(fresh.isNextLight(), work <= FairLine::kLittleAtOnce) << work;
     EXPECT_EQ(fresh.take(), 1u);
   }
+}
+
+/// Those that ask for little: one client of one group, all others of another.
+class FairLineGroups : public FairLineTest {
+ protected:
+  static constexpr std::size_t kAlone = 0;
+
+  FairLineGroups() {
+    for (std::size_t client = 0; client < kClients; ++client) {
+      line.introduce(places[client], client == kAlone ? ofOne : group);
+    }
+    // Until nobody is new any more.
+    line.setTime(FairLine::kTimeForWork * (FairLine::kSavedWork + FairLine::kDebtOfNew));
+  }
+  void enterAll(std::size_t begin, std::size_t end) {
+    for (std::size_t client = begin; client < end; ++client) enter(client);
+  }
+
+  const std::shared_ptr<FairLine::Group> ofOne = std::make_shared<FairLine::Group>();
+};
+
+TEST_F(FairLineGroups, LetNobodyWaitForMoreThanOneOfAnother) {
+  enterAll(1, kClients);
+  enter(kAlone);
+  EXPECT_EQ(serveNext(5000), 1u);
+  EXPECT_EQ(serveNext(5000), kAlone);
+  EXPECT_EQ(serveNext(5000), 2u);
+  enter(kAlone);
+  EXPECT_EQ(serveNext(5000), kAlone) << "as much as all of the others together";
+}
+
+TEST_F(FairLineGroups, ServeTheirOwnInTheOrderInWhichTheyCame) {
+  enterAll(kAlone, kClients);
+  EXPECT_EQ(serveNext(0), kAlone);
+  for (std::size_t client = 1; client < kClients; ++client) {
+    EXPECT_EQ(serveNext(0), client);
+  }
+  EXPECT_TRUE(line.empty());
+}
+
+TEST_F(FairLineGroups, GoOnWhenOneOfThemHasGone) {
+  enterAll(1, 4);
+  EXPECT_EQ(line.take(), 1u);  // And says nothing more.
+  EXPECT_EQ(serveNext(1000), 2u);
+  EXPECT_EQ(line.take(), 3u);
+  EXPECT_TRUE(line.empty());
+  EXPECT_FALSE(line.take());
+}
+
+TEST_F(FairLineGroups, TakeTurnsByWhatTheyAskFor) {
+  enterAll(1, kClients);
+  enter(kAlone);
+  std::size_t turnsOfOthers = 0;
+  for (int i = 0; i < 10; ++i) {
+    while (serveNext(3000) != kAlone) ++turnsOfOthers;
+    enter(kAlone);
+  }
+  EXPECT_GE(turnsOfOthers, 9u);
+  EXPECT_LE(turnsOfOthers, 11u);
 }
 
 TEST_F(FairLineOrder, HasNobodyNextWhereNobodyIs) { EXPECT_FALSE(line.isNextLight()); }

@@ -528,7 +528,7 @@ void UnixSocketIPCListener::accept(FileDescriptor socket) {
   Watched& watched = connections_[id];
   watched.connection = connection;
   watched.process = process;
-  line_.introduce(watched.place);
+  line_.introduce(watched.place, {process, &process->group()});
   ++user.connections;
   const bool isAccepted = delegate_ != nullptr &&
                           delegate_->listenerShouldAcceptNewConnection(*this, connection);

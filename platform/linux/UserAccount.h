@@ -8,6 +8,7 @@
 #include <utility>
 
 #include "platform/ValueBuffer.h"
+#include "platform/linux/FairLine.h"
 #include "platform/linux/Limits.h"
 #include "platform/linux/MemoryOfAll.h"
 #include "platform/linux/RequestBudget.h"
@@ -265,7 +266,8 @@ inline bool KeptLists::keep(std::size_t bytes) noexcept { return user_.keep(byte
 inline void KeptLists::discard(std::size_t bytes) noexcept { user_.discard(bytes); }
 
 /// What the connections of one process have in common: many of them have no more of what
-/// is reserved than one. Any thread.
+/// is reserved than one, and no more turns where they ask for little. Any thread, unless
+/// it says otherwise.
 class ProcessAccount {
  public:
   explicit ProcessAccount(std::shared_ptr<UserAccount> user) : user_(std::move(user)) {}
@@ -292,8 +294,12 @@ class ProcessAccount {
   }
   std::size_t halfFrameBytes() const { return halfFrameBytes_; }
 
+  /// Of its connections in the listener's line. The listener's thread.
+  FairLine::Group& group() { return group_; }
+
  private:
   const std::shared_ptr<UserAccount> user_;
+  FairLine::Group group_;
   std::atomic<std::size_t> busyConnections_{0};
   std::atomic<std::size_t> halfFrameBytes_{0};
 };
