@@ -7,6 +7,7 @@
 #include <string>
 
 #include "platform/EntryStorage.h"
+#include "platform/WorkQueue.h"
 #include "platform/linux/SpillFile.h"
 
 namespace ostrel {
@@ -29,8 +30,12 @@ class FileEntryStorage final : public EntryStorage {
     static Limits ofService();
   };
 
-  explicit FileEntryStorage(std::string directory);
-  FileEntryStorage(std::string directory, const Limits& limits, const SpillCalls& calls);
+  /// `disposal` gives the file's room on the disk back, and outlives the storage, though
+  /// not the lists; none: whoever releases a list does.
+  explicit FileEntryStorage(std::string directory, ConcurrentQueue* disposal = nullptr);
+  FileEntryStorage(std::string directory, const Limits& limits, const SpillCalls& calls,
+                   ConcurrentQueue* disposal = nullptr);
+  ~FileEntryStorage() override;
 
   std::unique_ptr<StoredEntries> makeEntries(ReporterID session) override;
 

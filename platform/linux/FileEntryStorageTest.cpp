@@ -7,7 +7,9 @@
 
 #include <cerrno>
 #include <filesystem>
+#include <optional>
 #include <random>
+#include <utility>
 
 #include "platform/linux/Limits.h"
 #include "platform/linux/OwnProcess.h"
@@ -186,6 +188,101 @@ TEST_F(FileEntryStorageTest, GivesTheRoomOnTheDiskBackWithEachList) {
   ::fstat(files[0], &after);
   EXPECT_LT(after.st_blocks, before.st_blocks / 2);
   EXPECT_EQ(bytesOf(*small->snapshot()), std::string(300'000, 'x'));
+}
+
+/// Runs what it has when the test says so.
+class ManualDisposal final : public ConcurrentQueue {
+ public:
+  void asyncAfter(std::chrono::nanoseconds, Task step) override {
+    steps.push_back(std::move(step));
+  }
+  void run() {
+    for (Task& step : std::exchange(steps, {})) step();
+  }
+
+  std::vector<Task> steps;
+};
+
+class FileEntryStorageDisposal : public FileEntryStorageTest {
+ protected:
+  static constexpr std::size_t kEntry = 5000;
+
+  /// Of an own extent each.
+  std::unique_ptr<StoredEntries> makeList(std::size_t entries) {
+    auto list = storage_->makeEntries(kSession);
+    for (std::size_t i = 0; i < entries; ++i) append(*list, std::string(kEntry, 'x'));
+    return list;
+  }
+  blkcnt_t blocksOnDisk() const {
+    const auto files = namelessFiles(directory_.path());
+    if (files.size() != 1) return 0;
+    struct stat status {};
+    ::fstat(files[0], &status);
+    return status.st_blocks;
+  }
+
+  ManualDisposal disposal_;
+  std::optional<FileEntryStorage> storage_{std::in_place, directory_.path(),
+                                           FileEntryStorage::Limits{1, 1, kNoPause},
+                                           faults_.calls(), &disposal_};
+};
+
+TEST_F(FileEntryStorageDisposal, GivesRoomOnTheDiskBackLaterAndForManyAtOnce) {
+  const auto kept = makeList(10);
+  const blkcnt_t before = blocksOnDisk();
+  for (int i = 0; i < 10; ++i) makeList(100);
+  EXPECT_EQ(disposal_.steps.size(), 1u);
+  EXPECT_GT(blocksOnDisk(), 50 * before);
+  disposal_.run();
+  EXPECT_EQ(blocksOnDisk(), before);
+  EXPECT_TRUE(disposal_.steps.empty());
+  EXPECT_EQ(bytesOf(*kept->snapshot()), std::string(10 * kEntry, 'x'));
+}
+
+TEST_F(FileEntryStorageDisposal, HasTheFileOpenUntilThen) {
+  auto first = makeList(10);
+  const auto second = makeList(10);
+  first.reset();
+  EXPECT_TRUE(storage_->hasFile());
+  const auto third = makeList(10);
+  disposal_.run();
+  EXPECT_EQ(bytesOf(*second->snapshot()), std::string(10 * kEntry, 'x'));
+  EXPECT_EQ(bytesOf(*third->snapshot()), std::string(10 * kEntry, 'x'));
+}
+
+TEST_F(FileEntryStorageDisposal, ClosesTheFileWhenNothingIsLeft) {
+  auto first = makeList(10);
+  makeList(10);
+  first.reset();
+  disposal_.run();
+  EXPECT_FALSE(storage_->hasFile());
+  EXPECT_EQ(bytesOf(*makeList(3)->snapshot()), std::string(3 * kEntry, 'x'));
+}
+
+TEST_F(FileEntryStorageDisposal, IsNotAskedWhenTheStorageHasGone) {
+  auto first = makeList(10);
+  auto second = makeList(10);
+  storage_.reset();
+  first.reset();
+  EXPECT_TRUE(disposal_.steps.empty());
+  second.reset();
+  EXPECT_TRUE(namelessFiles(directory_.path()).empty());
+}
+
+TEST_F(FileEntryStorageDisposal, KeepsNoMoreForLaterThanAFewThousandHoles) {
+  const auto kept = makeList(1);
+  // One of each two, so that no hole joins another.
+  std::vector<std::unique_ptr<StoredEntries>> lists;
+  constexpr std::size_t kLists = 6000;
+  for (std::size_t i = 0; i < kLists; ++i) lists.push_back(makeList(1));
+  const blkcnt_t before = blocksOnDisk();
+  const blkcnt_t ofOne = before / static_cast<blkcnt_t>(kLists + 1);
+  for (std::size_t i = 0; i < kLists; i += 2) lists[i].reset();
+  EXPECT_EQ(blocksOnDisk(), before);
+  for (std::size_t i = 1; i < kLists; i += 2) lists[i].reset();
+  EXPECT_EQ(blocksOnDisk(), before - ofOne * (6000 - 4096));
+  disposal_.run();
+  EXPECT_EQ(blocksOnDisk(), ofOne);
 }
 
 TEST_F(FileEntryStorageTest, GoesOnAfterAWriteThatTookAPart) {

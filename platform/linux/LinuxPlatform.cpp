@@ -86,7 +86,7 @@ struct LinuxPlatform::Bindings {
   std::shared_ptr<ThreadPoolWorkQueues> queues;
   std::unique_ptr<UnixSocketIPCListener> listener;
   std::shared_ptr<FileEntryStorage> entries =
-      std::make_shared<FileEntryStorage>(stateDirectory());
+      std::make_shared<FileEntryStorage>(stateDirectory(), &queues->backgroundQueue());
   std::shared_ptr<Store> store = Store::open(storePath(), storeOptions());
 
   StoreOptions storeOptions() const {

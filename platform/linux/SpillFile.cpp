@@ -33,6 +33,9 @@ std::uint64_t roomOf(std::size_t size) {
   return (std::max<std::size_t>(size, 1) + kPage - 1) / kPage * kPage;
 }
 
+// What is given back later is little in memory.
+constexpr std::size_t kMostHoles = 4096;
+
 // 0, or the error.
 int writeAll(int file, std::span<iovec> parts, std::uint64_t begin,
              const SpillCalls& calls) {
@@ -72,24 +75,20 @@ class SpillFile::Holes {
     if (holes_.empty() || begin != holes_.back().end) holes_.push_back({begin, begin});
     holes_.back().end = begin + size;
   }
-  bool empty() const { return holes_.empty(); }
-
-  // Where the file system knows no holes, the room comes back with the file.
-  void punch(int file) const {
-    for (const Hole& hole : holes_) {
-      ::fallocate(file, FALLOC_FL_PUNCH_HOLE | FALLOC_FL_KEEP_SIZE,
-                  static_cast<off_t>(hole.begin),
-                  static_cast<off_t>(hole.end - hole.begin));
-    }
-  }
+  const std::vector<Hole>& all() const { return holes_; }
 
  private:
-  struct Hole {
-    std::uint64_t begin;
-    std::uint64_t end;
-  };
   std::vector<Hole> holes_;
 };
+
+// Where the file system knows no holes, the room comes back with the file.
+void SpillFile::punch(int file, const std::vector<Hole>& holes) {
+  for (const Hole& hole : holes) {
+    ::fallocate(file, FALLOC_FL_PUNCH_HOLE | FALLOC_FL_KEEP_SIZE,
+                static_cast<off_t>(hole.begin),
+                static_cast<off_t>(hole.end - hole.begin));
+  }
+}
 
 /// Pieces that are written together. What a piece changes is one line of the cache.
 struct alignas(64) SpillFile::Group {
@@ -358,10 +357,46 @@ void SpillFile::forget(std::size_t count) { leave(Holes(), count); }
 // The extents, which kept the file open until now, are none any more. Without the lock,
 // as holes take their time too.
 void SpillFile::leave(const Holes& holes, std::size_t extents) {
-  if (!holes.empty()) holes.punch(file_.get());
+  if (!isLeftForLater(holes.all())) punch(file_.get(), holes.all());
   FileDescriptor last;
   const std::lock_guard lock(mutex_);
   last = dropExtents(extents);
+}
+
+bool SpillFile::isLeftForLater(const std::vector<Hole>& holes) {
+  const std::lock_guard lock(mutex_);
+  if (!giveRoomBackLater_ || holes_.size() + holes.size() > kMostHoles) return false;
+  holes_.insert(holes_.end(), holes.begin(), holes.end());
+  if (!holes_.empty() && !std::exchange(isRoomGivenBackLater_, true)) {
+    ++extents_;  // The file stays.
+    giveRoomBackLater_();
+  }
+  return true;
+}
+
+void SpillFile::giveRoomBackLater(std::function<void()> later) {
+  const std::lock_guard lock(mutex_);
+  giveRoomBackLater_ = std::move(later);
+}
+
+void SpillFile::giveRoomBack() {
+  FileDescriptor last;
+  std::vector<Hole> holes;
+  std::unique_lock lock(mutex_);
+  if (!isRoomGivenBackLater_) return;
+  holes.swap(holes_);
+  if (extents_ > 1) {  // Else it comes back with the file.
+    const int file = file_.get();
+    lock.unlock();
+    punch(file, holes);
+    lock.lock();
+  }
+  if (!holes_.empty() && giveRoomBackLater_) {
+    giveRoomBackLater_();
+    return;
+  }
+  isRoomGivenBackLater_ = false;
+  last = dropExtents(1);
 }
 
 std::optional<ErrorObject> SpillFile::latestError() const {

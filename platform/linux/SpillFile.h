@@ -6,12 +6,14 @@
 #include <chrono>
 #include <cstddef>
 #include <cstdint>
+#include <functional>
 #include <memory>
 #include <mutex>
 #include <optional>
 #include <span>
 #include <string>
 #include <unordered_map>
+#include <vector>
 
 #include "platform/ErrorObject.h"
 #include "platform/SmallMutex.h"
@@ -59,6 +61,12 @@ class SpillFile {
             std::size_t bytesInMemory, const SpillCalls& calls);
   ~SpillFile();
 
+  /// How the room of what is released is given back from now on: `later` has
+  /// `giveRoomBack` called some time after, by a thread that may wait for the disk;
+  /// empty: `release` does so itself. It is called with a lock held.
+  void giveRoomBackLater(std::function<void()> later);
+  void giveRoomBack();
+
   /// Writes `parts` one after the other as one new extent, which is the caller's to
   /// release. None when it cannot be written or could not be a moment ago.
   std::optional<Extent> write(std::span<const Bytes> parts);
@@ -66,7 +74,7 @@ class SpillFile {
   /// Reads an extent that is not released meanwhile. None when it was read.
   std::optional<ErrorObject> read(Extent extent, std::uint8_t* to);
 
-  /// Gives the extents' room on the disk back.
+  /// Gives the extents' room on the disk back, soon.
   void release(std::span<const Extent> extents);
   /// Releases `count` extents if there are no others, and says so.
   bool releaseIfAll(std::size_t count);
@@ -84,11 +92,17 @@ class SpillFile {
 
  private:
   struct Group;
+  struct Hole {
+    std::uint64_t begin;
+    std::uint64_t end;
+  };
   class Holes;
 
   std::optional<Extent> gather(std::span<const Bytes> parts, std::size_t size);
   std::optional<Extent> writeAlone(std::span<const Bytes> parts, std::size_t size);
   void leave(const Holes& holes, std::size_t extents);
+  bool isLeftForLater(const std::vector<Hole>& holes);
+  static void punch(int file, const std::vector<Hole>& holes);
 
   // With the lock.
   bool isReady();
@@ -116,6 +130,10 @@ class SpillFile {
 
   std::chrono::steady_clock::time_point retryAt_;
   std::uint64_t end_ = 0;
+  // What waits to be given back, and keeps the file open meanwhile.
+  std::function<void()> giveRoomBackLater_;
+  std::vector<Hole> holes_;
+  bool isRoomGivenBackLater_ = false;
   std::unordered_map<std::uint64_t, std::shared_ptr<Group>> groups_;  // By their place.
 };
 
