@@ -38,6 +38,8 @@ constexpr std::size_t kExtentsOfShortList = kFirstChunk / sizeof(SpillFile::Exte
 // What readers have in memory, but for an entry that is larger alone.
 constexpr std::size_t kLargestExtent = 2 * kLargestChunk;
 
+constexpr std::chrono::milliseconds kHolesTogether{200};
+
 using Bytes = StoredEntries::Bytes;
 
 }  // namespace
@@ -312,10 +314,11 @@ FileEntryStorage::FileEntryStorage(std::string directory, const Limits& limits,
                                    const SpillCalls& calls, ConcurrentQueue* disposal)
     : state_(std::make_shared<State>(std::move(directory), limits, calls)) {
   if (disposal == nullptr) return;
-  // A hole waits until the file system's journal is written: on the thread that serves, a
-  // fifth of a second when many clients left together.
+  // A hole waits until the file system's journal is written: a fifth of a second on the
+  // thread that serves, when many clients left together. Holes that come soon after one
+  // another are often one.
   state_->file.giveRoomBackLater([disposal, state = std::weak_ptr<State>(state_)] {
-    disposal->asyncAfter(std::chrono::nanoseconds(0), [state] {
+    disposal->asyncAfter(kHolesTogether, [state] {
       if (const auto still = state.lock()) still->file.giveRoomBack();
     });
   });

@@ -33,8 +33,10 @@ std::uint64_t roomOf(std::size_t size) {
   return (std::max<std::size_t>(size, 1) + kPage - 1) / kPage * kPage;
 }
 
-// What is given back later is little in memory.
-constexpr std::size_t kMostHoles = 4096;
+// What waits to be given back, of groups and of others: little in memory. Where there is
+// more, whoever adds to it gives a few back, so that nobody is held up for long.
+constexpr std::size_t kMostWaiting = 16'384;
+constexpr std::size_t kFewAtOnce = 4;
 
 // 0, or the error.
 int writeAll(int file, std::span<iovec> parts, std::uint64_t begin,
@@ -68,25 +70,17 @@ SpillCalls SpillCalls::system() {
       ::mkostemp, ::pwritev, ::pread};
 }
 
-/// The places in the file that nothing is in any more. Neighbours make one hole.
-class SpillFile::Holes {
- public:
-  void add(std::uint64_t begin, std::uint64_t size) {
-    if (holes_.empty() || begin != holes_.back().end) holes_.push_back({begin, begin});
-    holes_.back().end = begin + size;
-  }
-  const std::vector<Hole>& all() const { return holes_; }
-
- private:
-  std::vector<Hole> holes_;
-};
-
-// Where the file system knows no holes, the room comes back with the file.
-void SpillFile::punch(int file, const std::vector<Hole>& holes) {
-  for (const Hole& hole : holes) {
+// Neighbours make one hole. Where the file system knows none, the room comes back with
+// the file. Without the lock.
+void SpillFile::punch(int file, std::vector<Hole> holes) {
+  std::sort(holes.begin(), holes.end(),
+            [](const Hole& a, const Hole& b) { return a.begin < b.begin; });
+  for (auto hole = holes.begin(); hole != holes.end();) {
+    const std::uint64_t begin = hole->begin;
+    std::uint64_t end = begin;
+    for (; hole != holes.end() && hole->begin == end; ++hole) end = hole->end;
     ::fallocate(file, FALLOC_FL_PUNCH_HOLE | FALLOC_FL_KEEP_SIZE,
-                static_cast<off_t>(hole.begin),
-                static_cast<off_t>(hole.end - hole.begin));
+                static_cast<off_t>(begin), static_cast<off_t>(end - begin));
   }
 }
 
@@ -117,21 +111,32 @@ struct alignas(64) SpillFile::Group {
   }
   bool isFilled() const { return unfilled.load(std::memory_order_acquire) == 0; }
 
-  /// Pages that are free by it are added to `holes` if the group is in the file.
-  void release(Extent extent, Holes& holes) {
+  /// Pages of a group that is in the file are free then.
+  void release(Extent extent) {
     --extents;
     for (std::size_t page = pageOf(extent.begin); page <= lastPageOf(extent); ++page) {
-      if (--extentsOfPage[page] == 0 && !bytes) holes.add(begin + page * kPage, kPage);
+      if (--extentsOfPage[page] == 0 && !bytes) freePages |= bitOf(page);
     }
     if (extents == 0 && !isBeingWritten) used = 0;  // It may be filled anew.
   }
 
-  /// It is in the file. What was released meanwhile leaves holes.
-  void becameWritten(Holes& holes) {
+  /// It is in the file. What was released meanwhile is free.
+  void becameWritten() {
     bytes.reset();
     for (std::size_t page = 0; page * kPage < used; ++page) {
-      if (extentsOfPage[page] == 0) holes.add(begin + page * kPage, kPage);
+      if (extentsOfPage[page] == 0) freePages |= bitOf(page);
     }
+  }
+
+  /// The free pages, which are given back then; neighbours make one hole.
+  void takeHoles(std::vector<Hole>& holes) {
+    for (std::size_t page = 0; page < kPages; ++page) {
+      if ((freePages & bitOf(page)) == 0) continue;
+      const std::uint64_t at = begin + page * kPage;
+      if (holes.empty() || holes.back().end != at) holes.push_back({at, at});
+      holes.back().end = at + kPage;
+    }
+    freePages = 0;
   }
 
   const std::uint64_t begin;
@@ -139,9 +144,15 @@ struct alignas(64) SpillFile::Group {
   std::uint32_t used = 0;
   std::uint32_t extents = 0;
   std::atomic<std::uint32_t> unfilled{0};  // Places whose pieces are still copied.
+  std::uint32_t freePages = 0;             // In the file, and not given back; a bit each.
   bool isBeingWritten = false;
+  bool isListedFreed = false;  // In `freed_`.
 
  private:
+  static constexpr std::size_t kPages = kGroupBytes / kPage;
+  static_assert(kPages <= 32);
+
+  static std::uint32_t bitOf(std::size_t page) { return std::uint32_t{1} << page; }
   std::size_t pageOf(std::uint64_t at) const {
     return static_cast<std::size_t>((at - begin) / kPage);
   }
@@ -149,7 +160,7 @@ struct alignas(64) SpillFile::Group {
     return pageOf(extent.begin + extent.size - 1);
   }
 
-  std::array<std::uint16_t, kGroupBytes / kPage> extentsOfPage{};
+  std::array<std::uint16_t, kPages> extentsOfPage{};
 };
 
 SpillFile::SpillFile(std::string directory, std::chrono::milliseconds pause,
@@ -264,16 +275,16 @@ bool SpillFile::writeFullGroup(std::unique_lock<SmallMutex>& lock) {
   const int error = writeAll(file, {&bytes, 1}, group->begin, calls_);
   lock.lock();
   group->isBeingWritten = false;
-  Holes holes;
   if (error != 0) {
     fail(error);
   } else {
     full_.reset();
-    group->becameWritten(holes);
+    group->becameWritten();
+    noteFree(group);
   }
   dropIfUnused(group);
   lock.unlock();
-  leave(holes, /*extents=*/1);
+  leave(/*extents=*/1);
   lock.lock();
   return error == 0;
 }
@@ -297,6 +308,8 @@ FileDescriptor SpillFile::dropExtents(std::size_t count) {
   groups_.clear();
   filling_.reset();
   full_.reset();
+  holes_.clear();
+  freed_.clear();
   end_ = 0;
   return std::move(file_);
 }
@@ -337,41 +350,62 @@ bool SpillFile::releaseIfAll(std::size_t count) {
 
 void SpillFile::release(std::span<const Extent> extents) {
   if (extents.empty() || releaseIfAll(extents.size())) return;
-  Holes holes;
   {
     const std::lock_guard lock(mutex_);
     for (const Extent extent : extents) {
       if (const auto group = groupOf(extent)) {
-        group->release(extent, holes);
+        group->release(extent);
+        noteFree(group);
         dropIfUnused(group);
       } else {
-        holes.add(extent.begin, roomOf(extent.size));
+        holes_.push_back({extent.begin, extent.begin + roomOf(extent.size)});
       }
     }
   }
-  leave(holes, extents.size());
+  leave(extents.size());
 }
 
-void SpillFile::forget(std::size_t count) { leave(Holes(), count); }
+void SpillFile::forget(std::size_t count) { leave(count); }
 
-// The extents, which kept the file open until now, are none any more. Without the lock,
-// as holes take their time too.
-void SpillFile::leave(const Holes& holes, std::size_t extents) {
-  if (!isLeftForLater(holes.all())) punch(file_.get(), holes.all());
+// The extents, which kept the file open until now, are none any more. What is free is
+// given back without the lock, as it takes its time too.
+void SpillFile::leave(std::size_t extents) {
   FileDescriptor last;
-  const std::lock_guard lock(mutex_);
-  last = dropExtents(extents);
-}
-
-bool SpillFile::isLeftForLater(const std::vector<Hole>& holes) {
-  const std::lock_guard lock(mutex_);
-  if (!giveRoomBackLater_ || holes_.size() + holes.size() > kMostHoles) return false;
-  holes_.insert(holes_.end(), holes.begin(), holes.end());
-  if (!holes_.empty() && !std::exchange(isRoomGivenBackLater_, true)) {
+  std::unique_lock lock(mutex_);
+  const std::size_t waiting = holes_.size() + freed_.size();
+  const bool isLater = giveRoomBackLater_ && waiting <= kMostWaiting;
+  if (isLater && waiting != 0 && !std::exchange(isRoomGivenBackLater_, true)) {
     ++extents_;  // The file stays.
     giveRoomBackLater_();
   }
-  return true;
+  if (!isLater && waiting != 0) {
+    std::vector<Hole> holes = takeHoles(giveRoomBackLater_ ? kFewAtOnce : waiting);
+    const int file = file_.get();
+    lock.unlock();
+    punch(file, std::move(holes));
+    lock.lock();
+  }
+  last = dropExtents(extents);
+}
+
+// What was left last goes first. In no order.
+std::vector<SpillFile::Hole> SpillFile::takeHoles(std::size_t most) {
+  std::vector<Hole> all;
+  for (; most != 0 && !freed_.empty(); --most) {
+    freed_.back()->takeHoles(all);
+    freed_.back()->isListedFreed = false;
+    freed_.pop_back();
+  }
+  for (; most != 0 && !holes_.empty(); --most) {
+    all.push_back(holes_.back());
+    holes_.pop_back();
+  }
+  return all;
+}
+
+void SpillFile::noteFree(const std::shared_ptr<Group>& group) {
+  if (group->freePages == 0 || std::exchange(group->isListedFreed, true)) return;
+  freed_.push_back(group);
 }
 
 void SpillFile::giveRoomBackLater(std::function<void()> later) {
@@ -381,17 +415,16 @@ void SpillFile::giveRoomBackLater(std::function<void()> later) {
 
 void SpillFile::giveRoomBack() {
   FileDescriptor last;
-  std::vector<Hole> holes;
   std::unique_lock lock(mutex_);
   if (!isRoomGivenBackLater_) return;
-  holes.swap(holes_);
+  std::vector<Hole> holes = takeHoles(SIZE_MAX);
   if (extents_ > 1) {  // Else it comes back with the file.
     const int file = file_.get();
     lock.unlock();
-    punch(file, holes);
+    punch(file, std::move(holes));
     lock.lock();
   }
-  if (!holes_.empty() && giveRoomBackLater_) {
+  if ((!holes_.empty() || !freed_.empty()) && giveRoomBackLater_) {
     giveRoomBackLater_();
     return;
   }

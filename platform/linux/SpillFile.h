@@ -96,13 +96,11 @@ class SpillFile {
     std::uint64_t begin;
     std::uint64_t end;
   };
-  class Holes;
 
   std::optional<Extent> gather(std::span<const Bytes> parts, std::size_t size);
   std::optional<Extent> writeAlone(std::span<const Bytes> parts, std::size_t size);
-  void leave(const Holes& holes, std::size_t extents);
-  bool isLeftForLater(const std::vector<Hole>& holes);
-  static void punch(int file, const std::vector<Hole>& holes);
+  void leave(std::size_t extents);
+  static void punch(int file, std::vector<Hole> holes);
 
   // With the lock.
   bool isReady();
@@ -112,6 +110,8 @@ class SpillFile {
   std::shared_ptr<Group> groupOf(Extent extent) const;
   void dropIfUnused(const std::shared_ptr<Group>& group);
   FileDescriptor dropExtents(std::size_t count);
+  void noteFree(const std::shared_ptr<Group>& group);
+  std::vector<Hole> takeHoles(std::size_t most);
   void fail(int error);
 
   const std::string directory_;
@@ -130,10 +130,11 @@ class SpillFile {
 
   std::chrono::steady_clock::time_point retryAt_;
   std::uint64_t end_ = 0;
-  // What waits to be given back, and keeps the file open meanwhile.
-  std::function<void()> giveRoomBackLater_;
+  // What waits to be given back: pages of groups, and pieces that were in none.
+  std::vector<std::shared_ptr<Group>> freed_;
   std::vector<Hole> holes_;
-  bool isRoomGivenBackLater_ = false;
+  std::function<void()> giveRoomBackLater_;
+  bool isRoomGivenBackLater_ = false;  // Then it keeps the file open.
   std::unordered_map<std::uint64_t, std::shared_ptr<Group>> groups_;  // By their place.
 };
 

@@ -5,6 +5,7 @@
 
 #include <algorithm>
 #include <array>
+#include <atomic>
 #include <deque>
 #include <filesystem>
 #include <random>
@@ -93,6 +94,43 @@ class SpillFileTest : public testing::Test {
       return static_cast<std::size_t>(status.st_blocks) * 512;
     }
     return 0;
+  }
+
+  /// Threads that write, read and release; nothing is left of it.
+  void useByManyThreads() {
+    constexpr int kThreads = 4;
+    std::vector<std::thread> threads;
+    for (int number = 0; number < kThreads; ++number) {
+      threads.emplace_back([this, number] {
+        std::mt19937 random(static_cast<unsigned>(number));
+        std::deque<Piece> mine;
+        const auto check = [&](const Piece& piece) {
+          std::string bytes(piece.extent.size, '\0');
+          ASSERT_FALSE(
+              file_.read(piece.extent, reinterpret_cast<std::uint8_t*>(bytes.data())));
+          ASSERT_TRUE(bytes == piece.bytes);
+        };
+        for (std::size_t i = 0; i < 2000; ++i) {
+          std::string bytes =
+              bytesOf(i * kThreads + static_cast<std::size_t>(number),
+                      1 + random() % (random() % 20 == 0 ? 2 * kLargest : 1500));
+          const auto extent = file_.write(std::array{asBytes(bytes)});
+          ASSERT_TRUE(extent);
+          mine.push_back({*extent, std::move(bytes)});
+          check(mine[random() % mine.size()]);
+          if (mine.size() > 100) {
+            check(mine.front());
+            file_.release({&mine.front().extent, 1});
+            mine.pop_front();
+          }
+        }
+        for (const Piece& piece : mine) {
+          check(piece);
+          file_.release({&piece.extent, 1});
+        }
+      });
+    }
+    for (std::thread& thread : threads) thread.join();
   }
 
   testing_support::SpillFaults faults_;
@@ -331,40 +369,28 @@ TEST_F(SpillFileBeingWritten, MayFailWithoutALoss) {
 
 // Each with pieces of its own, which it reads and releases in any order.
 TEST_F(SpillFileTest, ServesManyThreads) {
-  constexpr int kThreads = 4;
-  std::vector<std::thread> threads;
-  for (int number = 0; number < kThreads; ++number) {
-    threads.emplace_back([this, number] {
-      std::mt19937 random(static_cast<unsigned>(number));
-      std::deque<Piece> mine;
-      const auto check = [&](const Piece& piece) {
-        std::string bytes(piece.extent.size, '\0');
-        ASSERT_FALSE(
-            file_.read(piece.extent, reinterpret_cast<std::uint8_t*>(bytes.data())));
-        ASSERT_TRUE(bytes == piece.bytes);
-      };
-      for (std::size_t i = 0; i < 2000; ++i) {
-        std::string bytes =
-            bytesOf(i * kThreads + static_cast<std::size_t>(number),
-                    1 + random() % (random() % 20 == 0 ? 2 * kLargest : 1500));
-        const auto extent = file_.write(std::array{asBytes(bytes)});
-        ASSERT_TRUE(extent);
-        mine.push_back({*extent, std::move(bytes)});
-        check(mine[random() % mine.size()]);
-        if (mine.size() > 100) {
-          check(mine.front());
-          file_.release({&mine.front().extent, 1});
-          mine.pop_front();
-        }
-      }
-      for (const Piece& piece : mine) {
-        check(piece);
-        file_.release({&piece.extent, 1});
-      }
-    });
-  }
-  for (std::thread& thread : threads) thread.join();
+  useByManyThreads();
   EXPECT_FALSE(file_.isOpen());
+  EXPECT_EQ(file_.bytesInMemory(), 0u);
+}
+
+TEST_F(SpillFileTest, ServesManyThreadsWhileAnotherGivesRoomBack) {
+  std::counting_semaphore<> asked{0};
+  std::atomic<bool> isDone = false;
+  file_.giveRoomBackLater([&] { asked.release(); });
+  std::thread giver([&] {
+    for (;;) {
+      asked.acquire();
+      if (isDone) return;
+      file_.giveRoomBack();
+    }
+  });
+  useByManyThreads();
+  isDone = true;
+  asked.release();
+  giver.join();
+  // What was still asked for then.
+  while (file_.isOpen()) file_.giveRoomBack();
   EXPECT_EQ(file_.bytesInMemory(), 0u);
 }
 
