@@ -130,12 +130,14 @@ inline constexpr std::size_t kMemoryBytesOfAll = 24 * 1024 * 1024;
 inline constexpr std::size_t kUsersInReserve = 16;
 
 /// Bytes of the entries that sessions keep for their summaries, in all, and of the
-/// messages of one user's clients. Room for a session of a million messages with its
-/// summary, twice. What is beyond a small budget in memory is in files.
+/// messages of one user's clients. Room for a session of a million messages. They lie in
+/// a file, but the summary is made in memory, and there it takes four times as much where
+/// the messages are large: so it stays below the 1 GiB that the unit gives the service.
 /// [UserAccount.KeepsBytesUpToTheUsersShareAndTheServices,
-/// ListenerShares.OfAUserAreTheBytesThatItsSessionsKeep]
-inline constexpr std::size_t kKeptBytes = std::size_t{2} * 1024 * 1024 * 1024;
-inline constexpr std::size_t kKeptBytesOfUser = std::size_t{1} * 1024 * 1024 * 1024;
+/// ListenerShares.OfAUserAreTheBytesThatItsSessionsKeep,
+/// PressedService.StopsASessionThatHasKeptMuch]
+inline constexpr std::size_t kKeptBytes = 240 * 1024 * 1024;
+inline constexpr std::size_t kKeptBytesOfUser = 240 * 1024 * 1024;
 
 /// What a request costs on a queue beside its payload: the step, its place in the
 /// queue, the buffer's head.

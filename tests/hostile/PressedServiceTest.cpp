@@ -116,6 +116,43 @@ TEST_F(PressedService, SendsLargeMessagesToAllSessionsInTheirOrder) {
   }
 }
 
+// A user may keep 240 MiB, which is reached by a thousand such messages.
+TEST_F(PressedService, StopsASessionThatHasKeptMuch) {
+  const auto messages = static_cast<std::size_t>(numberIn("OSTREL_KEPT_MESSAGES", 20));
+  constexpr std::size_t kBytes = 256 * 1024;
+  constexpr std::size_t kMostKept = limits::kKeptBytesOfUser / kBytes;
+  constexpr std::size_t kMostKiBAtStop = 1024 * 1024;
+  service.start();
+  RecordingClient client(service.socketPath());
+  startSessions(client, /*sessions=*/1);
+  for (std::size_t i = 0; i < messages; ++i) {
+    client->sendMessage({{"text", std::string(kBytes, 'x')}}, MessageCategory{1},
+                        MessageType{1}, ReporterIDs{ReporterID{1}}, client.error("send"));
+  }
+  for (std::size_t before = 0, now = 0; now < messages; before = now) {
+    now = client.wait(messages).size();
+    ASSERT_GT(now, before);
+  }
+  client->stopReportingSessionForID(ReporterID{1}, /*reply=*/nullptr);
+
+  const std::string summary =
+      "SELECT length(payload) FROM telemetry_messages WHERE category = 65535 AND "
+      "type = 65535 AND substr(payload, 1, 40) LIKE '%Summary%'";
+  ASSERT_TRUE(eventually([&] { return !service.rows(summary).empty(); }));
+  const std::size_t kept =
+      (std::stoul(service.rows(summary).front()) + kBytes / 2) / kBytes;
+  std::cout << kept << " of " << messages << " messages in the summary, peak of "
+            << "resident memory "
+            << usageOf(service.process().pid()).peakResidentKiB / 1024 << " MiB\n";
+  EXPECT_LE(kept, kMostKept);
+  EXPECT_GE(kept, std::min(messages, kMostKept - kMostKept / 16));
+  EXPECT_EQ(linesWith("goes without some messages"), messages > kMostKept ? 1u : 0u);
+  if (hostile::kMemoryIsBounded) {
+    EXPECT_LT(usageOf(service.process().pid()).peakResidentKiB, kMostKiBAtStop);
+  }
+  EXPECT_TRUE(serves());
+}
+
 // A list of so many sessions is more than half of what a socket holds.
 TEST_F(PressedService, HasLittleInMemoryForManyClientsThatDoNotReadLargeReplies) {
   constexpr std::int64_t kSessions = 16'384;
