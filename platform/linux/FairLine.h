@@ -123,6 +123,7 @@ class FairLine {
       lightWork_ += work;
       place.group_->next_ += work;
       lineUp(place.group_);
+      takenLast_.reset();
     }
     place.next_ = std::max(place.next_, now_) + work;
   }
@@ -173,7 +174,7 @@ class FairLine {
   Line<std::shared_ptr<Group>> light_;
   Line<ID> others_;
   std::size_t lightCount_ = 0;
-  std::shared_ptr<Group> takenLast_;  // Of those in `light_`.
+  std::shared_ptr<Group> takenLast_;  // Of those in `light_`, until `use`.
   std::uint64_t lightWork_ = 0;       // In a row.
   bool isLightTurn_ = false;          // That of whom was taken last.
   std::uint64_t time_ = 0;
