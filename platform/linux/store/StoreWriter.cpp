@@ -222,16 +222,7 @@ StoreWriter::Result StoreWriter::write(StoreOperation& operation,
   RowTexts texts(rows_.text, retention_.rowBytes);
   MessageRow row;
   row.session = message.session->row;
-  row.category = message.category;
-  row.type = message.type;
-  row.payload = texts.json(message.payload);
-  row.createdAt = operation.time;
-  row.user = userOf(operation, message.payload);
-  if (texts.areTooLong()) {
-    lose(operation, counters_.lost);
-  } else {
-    rows_.messages.push_back(row);
-  }
+  addRow(operation, message, texts, row);
   return std::nullopt;
 }
 
@@ -241,6 +232,13 @@ StoreWriter::Result StoreWriter::write(StoreOperation& operation,
   MessageRow row;
   row.sessionInfo = texts.json(message.sessionInfo);
   row.userInfo = texts.json(message.userInfo);
+  addRow(operation, message, texts, row);
+  return std::nullopt;
+}
+
+template <typename Message>
+void StoreWriter::addRow(StoreOperation& operation, const Message& message,
+                         RowTexts& texts, MessageRow& row) {
   row.category = message.category;
   row.type = message.type;
   row.payload = texts.json(message.payload);
@@ -251,7 +249,6 @@ StoreWriter::Result StoreWriter::write(StoreOperation& operation,
   } else {
     rows_.messages.push_back(row);
   }
-  return std::nullopt;
 }
 
 StoreWriter::Result StoreWriter::write(StoreOperation& operation, AnalyticsEvent& event) {

@@ -95,6 +95,10 @@ class StoreWriter {
   Result write(StoreOperation& operation, const LoneMessage& message);
   Result write(StoreOperation& operation, AnalyticsEvent& event);
   Result write(StoreOperation& operation, const PowerEvent& event);
+  /// Completes a message's row, whose other columns are set, and adds it.
+  template <typename Message>
+  void addRow(StoreOperation& operation, const Message& message, RowTexts& texts,
+              MessageRow& row);
   void lose(StoreOperation& operation, std::atomic<std::uint64_t>& counter);
   Result insertSession(StoreSession& session);
   Result writeRows(bool evenIfFew);
